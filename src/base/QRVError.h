@@ -1,0 +1,84 @@
+// The one error type of the daemon.
+//
+// An error carries a domain, a numeric code, a rendered message, the function
+// and source line that reported it, and optionally the error that caused it.
+// Only the numeric code ever reaches a client; the rest is for the log.
+//
+// Errors are made through the QRV_ERROR family of macros, which fill in the
+// reporting function and line and write the message to the log, so that every
+// failure is logged exactly once, where it is first understood.
+#pragma once
+
+#include <cstdint>
+#include <memory>
+#include <string>
+#include <utility>
+
+#include <fmt/format.h>
+
+#include "QRVLog.h"
+
+class QRVError {
+ public:
+  static constexpr const char* kDomain = "QRVErrorDomain";
+  static constexpr const char* kPOSIXDomain = "POSIXErrorDomain";
+
+  // Codes shared by many components. Each component documents its own.
+  static constexpr uint64_t kSuccess = 1;
+  static constexpr uint64_t kInvalidInput = 38;
+  static constexpr uint64_t kException = 40;
+  static constexpr uint64_t kInvalidCommand = 49;
+  static constexpr uint64_t kNotEntitled = 55;
+
+  QRVError() = default;
+
+  // The single builder. Prefer the macros below, which fill `function` and
+  // `line`. `level` is the log level the error is reported at; a negative
+  // level reports nothing (for codes that are an expected outcome, such as
+  // "no such container").
+  static QRVError make(const char* domain, uint64_t code, const char* function, uint32_t line,
+                       int level, std::string message,
+                       std::shared_ptr<const QRVError> underlying = nullptr);
+
+  const std::string& domain() const { return domain_; }
+  uint64_t code() const { return code_; }
+  const std::string& message() const { return message_; }
+  const std::string& functionName() const { return function_; }
+  uint32_t sourceFileLine() const { return line_; }
+  const QRVError* underlying() const { return underlying_.get(); }
+
+  bool isPOSIX() const { return domain_ == kPOSIXDomain; }
+
+  // "<domain> <code>: <message> (function:line)", followed by the underlying
+  // error's description.
+  std::string description() const;
+
+ private:
+  std::string domain_;
+  uint64_t code_ = 0;
+  std::string message_;
+  std::string function_;
+  uint32_t line_ = 0;
+  std::shared_ptr<const QRVError> underlying_;
+};
+
+// Stores `e` through `out` when the caller asked for it; returns false so that
+// failing paths read `return QRVFail(error, QRV_ERROR(...));`.
+inline bool QRVFail(QRVError* out, QRVError e) {
+  if (out) *out = std::move(e);
+  return false;
+}
+
+#define QRV_ERROR(code, ...)                                                            \
+  QRVError::make(QRVError::kDomain, (code), __func__, __LINE__, QRVLogLevel::kError, \
+                 fmt::format(__VA_ARGS__))
+// An error that is an expected outcome and therefore not logged.
+#define QRV_ERROR_QUIET(code, ...) \
+  QRVError::make(QRVError::kDomain, (code), __func__, __LINE__, -1, fmt::format(__VA_ARGS__))
+#define QRV_ERROR_UNDERLYING(code, underlying, ...)                                     \
+  QRVError::make(QRVError::kDomain, (code), __func__, __LINE__, QRVLogLevel::kError, \
+                 fmt::format(__VA_ARGS__), std::make_shared<const QRVError>(underlying))
+// errno is translated here, where the system call was made.
+#define QRV_POSIX_ERROR(errnum, ...)                                                        \
+  QRVError::make(QRVError::kPOSIXDomain, static_cast<uint64_t>(errnum), __func__, __LINE__, \
+                 QRVLogLevel::kError, fmt::format(__VA_ARGS__))

@@ -1,0 +1,218 @@
+#include "QRVSerialQueue.h"
+
+#include <sys/resource.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <cstdio>
+#include <cstdlib>
+#include <exception>
+#include <thread>
+
+namespace {
+
+// Threads are started on demand, so a job that blocks never starves the
+// others, and leave after a while without work.
+class ThreadPool {
+ public:
+  ThreadPool(int nice, size_t maxThreads) : nice_(nice), maxThreads_(maxThreads) {}
+
+  void submit(std::function<void()> job) {
+    std::unique_lock<std::mutex> lock(mutex_);
+    jobs_.push_back(std::move(job));
+    if (idle_ >= jobs_.size()) {
+      cv_.notify_one();
+    } else if (threads_ < maxThreads_) {
+      threads_++;
+      std::thread([this] { work(); }).detach();
+    }
+  }
+
+ private:
+  void work() {
+    if (nice_) setpriority(PRIO_PROCESS, static_cast<id_t>(gettid()), nice_);
+    std::unique_lock<std::mutex> lock(mutex_);
+    for (;;) {
+      idle_++;
+      bool got = cv_.wait_for(lock, std::chrono::seconds(30), [this] { return !jobs_.empty(); });
+      idle_--;
+      if (!got) {
+        threads_--;
+        return;
+      }
+      auto job = std::move(jobs_.front());
+      jobs_.pop_front();
+      lock.unlock();
+      job();
+      lock.lock();
+    }
+  }
+
+  const int nice_;
+  const size_t maxThreads_;
+  std::mutex mutex_;
+  std::condition_variable cv_;
+  std::deque<std::function<void()>> jobs_;
+  size_t idle_ = 0;
+  size_t threads_ = 0;
+};
+
+// Never destroyed: detached workers may still be waiting when the process
+// exits.
+ThreadPool& pool(QRVSerialQueue::Priority priority) {
+  static ThreadPool* def = new ThreadPool(0, 256);
+  static ThreadPool* background = new ThreadPool(10, 64);
+  return priority == QRVSerialQueue::Priority::kBackground ? *background : *def;
+}
+
+thread_local const QRVSerialQueue* tCurrent = nullptr;
+std::atomic<QRVSerialQueue::ExceptionHandler> gExceptionHandler{nullptr};
+
+// Marks the calling thread as running `queue` for the scope's duration.
+class CurrentQueueScope {
+ public:
+  explicit CurrentQueueScope(const QRVSerialQueue* queue) : saved_(tCurrent) { tCurrent = queue; }
+  ~CurrentQueueScope() { tCurrent = saved_; }
+
+ private:
+  const QRVSerialQueue* saved_;
+};
+
+}  // namespace
+
+std::shared_ptr<QRVSerialQueue> QRVSerialQueue::create(std::string label,
+                                                       std::shared_ptr<QRVSerialQueue> target,
+                                                       Priority priority) {
+  return std::shared_ptr<QRVSerialQueue>(
+      new QRVSerialQueue(std::move(label), std::move(target), priority));
+}
+
+QRVSerialQueue::QRVSerialQueue(std::string label, std::shared_ptr<QRVSerialQueue> target,
+                               Priority priority)
+    : label_(std::move(label)), target_(std::move(target)), priority_(priority) {}
+
+void QRVSerialQueue::setUncaughtExceptionHandler(ExceptionHandler handler) {
+  gExceptionHandler = handler;
+}
+
+void QRVSerialQueue::async(Job job) {
+  std::lock_guard<std::mutex> lock(mutex_);
+  jobs_.push_back(std::move(job));
+  if (!draining_ && suspendCount_ == 0) scheduleDrainLocked();
+}
+
+void QRVSerialQueue::scheduleDrainLocked() {
+  draining_ = true;
+  // The drain keeps the queue alive even if its owner lets go meanwhile.
+  auto self = shared_from_this();
+  if (target_)
+    target_->async([self] { self->drain(); });
+  else
+    pool(priority_).submit([self] { self->drain(); });
+}
+
+void QRVSerialQueue::drain() {
+  CurrentQueueScope scope(this);
+  for (;;) {
+    Job job;
+    {
+      std::lock_guard<std::mutex> lock(mutex_);
+      if (jobs_.empty() || suspendCount_ > 0) {
+        draining_ = false;
+        return;
+      }
+      job = std::move(jobs_.front());
+      jobs_.pop_front();
+    }
+    run(job);
+  }
+}
+
+void QRVSerialQueue::run(const Job& job) {
+  try {
+    job();
+  } catch (...) {
+    ExceptionHandler handler = gExceptionHandler.load();
+    if (handler) handler(std::current_exception());
+    fprintf(stderr, "quorvad: uncaught exception in queue job\n");
+    abort();
+  }
+}
+
+void QRVSerialQueue::sync(const Job& job) {
+  if (isCurrent()) {
+    fprintf(stderr, "quorvad: sync on the current queue \"%s\" would deadlock\n", label_.c_str());
+    abort();
+  }
+  // Fast path: an idle queue without target is taken over by the caller,
+  // with no other thread involved.
+  {
+    std::unique_lock<std::mutex> lock(mutex_);
+    if (!target_ && !draining_ && jobs_.empty() && suspendCount_ == 0) {
+      draining_ = true;
+      lock.unlock();
+      {
+        CurrentQueueScope scope(this);
+        run(job);
+      }
+      lock.lock();
+      draining_ = false;
+      if (!jobs_.empty() && suspendCount_ == 0) scheduleDrainLocked();
+      return;
+    }
+  }
+  // Otherwise wait for our turn in line, then hold the queue's worker until
+  // the job is done on this thread. The handshake state is shared because the
+  // worker may still be waking up after this function has returned.
+  struct Handshake {
+    std::mutex m;
+    std::condition_variable cv;
+    bool turn = false, done = false;
+  };
+  auto h = std::make_shared<Handshake>();
+  async([h] {
+    std::unique_lock<std::mutex> l(h->m);
+    h->turn = true;
+    h->cv.notify_all();
+    h->cv.wait(l, [&] { return h->done; });
+  });
+  {
+    std::unique_lock<std::mutex> l(h->m);
+    h->cv.wait(l, [&] { return h->turn; });
+  }
+  {
+    CurrentQueueScope scope(this);
+    run(job);
+  }
+  std::lock_guard<std::mutex> l(h->m);
+  h->done = true;
+  h->cv.notify_all();
+}
+
+void QRVSerialQueue::suspend() {
+  std::lock_guard<std::mutex> lock(mutex_);
+  suspendCount_++;
+}
+
+void QRVSerialQueue::resume() {
+  std::lock_guard<std::mutex> lock(mutex_);
+  if (suspendCount_ == 0) {
+    fprintf(stderr, "quorvad: queue \"%s\" resumed more often than suspended\n", label_.c_str());
+    abort();
+  }
+  if (--suspendCount_ == 0 && !draining_ && !jobs_.empty()) scheduleDrainLocked();
+}
+
+bool QRVSerialQueue::isSuspended() const {
+  std::lock_guard<std::mutex> lock(mutex_);
+  return suspendCount_ > 0;
+}
+
+bool QRVSerialQueue::isCurrent() const {
+  // A job of a queue that targets this one also holds this one.
+  for (const QRVSerialQueue* q = tCurrent; q; q = q->target_.get())
+    if (q == this) return true;
+  return false;
+}
+
+const char* QRVSerialQueue::currentLabel() { return tCurrent ? tCurrent->label_.c_str() : nullptr; }
