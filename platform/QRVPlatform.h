@@ -1,0 +1,31 @@
+// The platform services a daemon runs on, handed to it at construction. Only
+// main() builds the real ones; tests mix real and fake services.
+#pragma once
+
+#include <memory>
+#include <string>
+
+#include "QRVAccounts.h"
+#include "QRVFeatureFlags.h"
+#include "QRVFirstBootMarker.h"
+#include "QRVLockStateService.h"
+#include "QRVMessageService.h"
+#include "QRVNotificationService.h"
+#include "QRVSandbox.h"
+#include "QRVSystemInfo.h"
+#include "QRVTrustStore.h"
+
+struct QRVPlatform {
+  std::shared_ptr<QRVMessageService> messages;
+  std::shared_ptr<QRVTrustStore> trustStore;
+  std::shared_ptr<QRVSandbox> sandbox;
+  std::shared_ptr<QRVLockStateService> lockState;
+  std::shared_ptr<QRVNotificationService> notifications;
+  std::shared_ptr<QRVFirstBootMarker> firstBootMarker;
+  std::shared_ptr<QRVSystemInfo> systemInfo;
+  std::shared_ptr<QRVAccounts> accounts;
+  std::shared_ptr<QRVFeatureFlags> featureFlags;
+
+  // The Linux services for a daemon whose paths all lie under `root`.
+  static QRVPlatform makeLinux(const std::string& root);
+};

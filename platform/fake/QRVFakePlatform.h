@@ -1,0 +1,149 @@
+// In-memory stand-ins for the platform services, for tests. Each holds plain
+// state that a test sets and inspects; none restates the real logic.
+#pragma once
+
+#include <map>
+#include <mutex>
+#include <string>
+#include <vector>
+
+#include "QRVAccounts.h"
+#include "QRVFeatureFlags.h"
+#include "QRVFirstBootMarker.h"
+#include "QRVLockStateService.h"
+#include "QRVNotificationService.h"
+#include "QRVSandbox.h"
+#include "QRVSystemInfo.h"
+#include "QRVTrustStore.h"
+
+class QRVFakeTrustStore : public QRVTrustStore {
+ public:
+  struct Client {
+    std::string signingIdentifier;  // empty: the identifier cannot be read
+    std::optional<QRVPlist> entitlements;
+  };
+  void setClient(pid_t pid, Client client) {
+    std::lock_guard<std::mutex> l(m_);
+    clients_[pid] = std::move(client);
+  }
+  std::optional<std::string> signingIdentifierForAuditToken(const QRVAuditToken& token, QRVError* error) override {
+    std::lock_guard<std::mutex> l(m_);
+    auto it = clients_.find(token.pid());
+    if (it == clients_.end() || it->second.signingIdentifier.empty()) {
+      QRVFail(error, QRV_POSIX_ERROR_QUIET(ESRCH, "no signing identifier for pid {}", token.pid()));
+      return std::nullopt;
+    }
+    return it->second.signingIdentifier;
+  }
+  std::optional<QRVPlist> entitlementsForAuditToken(const QRVAuditToken& token) override {
+    std::lock_guard<std::mutex> l(m_);
+    auto it = clients_.find(token.pid());
+    return it == clients_.end() ? std::nullopt : it->second.entitlements;
+  }
+
+ private:
+  std::mutex m_;
+  std::map<pid_t, Client> clients_;
+};
+
+class QRVFakeLockStateService : public QRVLockStateService {
+ public:
+  int state = 0;
+  int registrationResult = 0;
+  std::function<void()> onChange;
+  int currentLockState() override { return state; }
+  int observe(std::function<void()> handler) override {
+    if (registrationResult == 0) onChange = std::move(handler);
+    return registrationResult;
+  }
+  // Changes the state and notifies, as the device would.
+  void change(int newState) {
+    state = newState;
+    if (onChange) onChange();
+  }
+};
+
+class QRVFakeNotificationService : public QRVNotificationService {
+ public:
+  uint32_t post(const std::string& name) override {
+    std::lock_guard<std::mutex> l(m_);
+    posted_.push_back(name);
+    return result;
+  }
+  std::vector<std::string> posted() {
+    std::lock_guard<std::mutex> l(m_);
+    return posted_;
+  }
+  uint32_t result = 0;
+
+ private:
+  std::mutex m_;
+  std::vector<std::string> posted_;
+};
+
+class QRVFakeFirstBootMarker : public QRVFirstBootMarker {
+ public:
+  bool present = false;
+  int createError = 0;
+  const std::string& name() const override { return name_; }
+  bool exists() override { return present; }
+  bool create(int* errnum) override {
+    if (createError) {
+      if (errnum) *errnum = createError;
+      return false;
+    }
+    present = true;
+    return true;
+  }
+
+ private:
+  std::string name_ = "quorvad.fb_check";
+};
+
+class QRVFakeSystemInfo : public QRVSystemInfo {
+ public:
+  bool internal = false;
+  std::string build = "1A1";
+  bool isInternalBuild() override { return internal; }
+  std::string buildVersion() override { return build; }
+  QRVPlist systemVersion() override { return QRVPlist::dictionary().set("BUILD_ID", QRVPlist::string(build)); }
+};
+
+class QRVFakeAccounts : public QRVAccounts {
+ public:
+  std::vector<QRVAccount> accounts;
+  std::map<std::string, gid_t> groups;
+  std::optional<QRVAccount> accountForName(const std::string& name) override {
+    for (const auto& a : accounts)
+      if (a.name == name) return a;
+    return std::nullopt;
+  }
+  std::optional<QRVAccount> accountForUID(uid_t uid) override {
+    for (const auto& a : accounts)
+      if (a.uid == uid) return a;
+    return std::nullopt;
+  }
+  std::optional<gid_t> groupIDForName(const std::string& name) override {
+    auto it = groups.find(name);
+    return it == groups.end() ? std::nullopt : std::optional<gid_t>(it->second);
+  }
+};
+
+class QRVFakeSandbox : public QRVSandbox {
+ public:
+  std::map<pid_t, bool> sandboxed;
+  bool isSandboxed(const QRVAuditToken& token) override { return sandboxed[token.pid()]; }
+  std::optional<std::string> issueExtension(const std::string& extensionClass, const std::string& path,
+                                            const QRVAuditToken&, int*) override {
+    return extensionClass + ";" + path;
+  }
+  bool registerContainerPath(const std::string&, const std::string&, uint32_t, QRVError*) override { return true; }
+};
+
+class QRVFakeFeatureFlags : public QRVFeatureFlags {
+ public:
+  std::map<std::string, bool> flags;  // "domain/feature"
+  bool isEnabled(const std::string& domain, const std::string& feature) override {
+    return flags[domain + "/" + feature];
+  }
+};

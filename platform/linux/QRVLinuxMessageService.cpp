@@ -1,0 +1,473 @@
+#include "linux/QRVLinuxMessageService.h"
+
+#include <fcntl.h>
+#include <poll.h>
+#include <sys/epoll.h>
+#include <sys/eventfd.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/syscall.h>
+#include <sys/un.h>
+#include <systemd/sd-daemon.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstring>
+#include <filesystem>
+
+#include "QRVLog.h"
+#include "QRVWireFrame.h"
+#include "linux/QRVProcInfo.h"
+
+namespace {
+
+constexpr uint64_t kListenerTag = 0;
+constexpr uint64_t kWakeTag = UINT64_MAX;
+constexpr size_t kReadChunk = 64 * 1024;
+// Frames handled per wake-up before the connection yields its worker.
+constexpr int kFramesPerTurn = 64;
+
+int64_t nowMillis() {
+  return std::chrono::duration_cast<std::chrono::milliseconds>(
+             std::chrono::steady_clock::now().time_since_epoch())
+      .count();
+}
+
+}  // namespace
+
+class QRVLinuxMessageService::Connection : public QRVConnection {
+ public:
+  Connection(QRVLinuxMessageService* service, uint64_t id, int fd, const ucred& cred,
+             QRVAuditToken token, int pidfd)
+      : service_(service), id_(id), fd_(fd), pidfd_(pidfd), cred_(cred), token_(token) {}
+
+  ~Connection() override {
+    if (fd_ >= 0) ::close(fd_);
+    if (pidfd_ >= 0) ::close(pidfd_);
+  }
+
+  pid_t pid() const override { return cred_.pid; }
+  uid_t euid() const override { return cred_.uid; }
+  gid_t egid() const override { return cred_.gid; }
+  const QRVAuditToken& auditToken() const override { return token_; }
+
+  void setEventHandler(EventHandler handler) override {
+    std::lock_guard<std::mutex> lock(mutex_);
+    handler_ = std::move(handler);
+  }
+
+  void resume() override {
+    std::lock_guard<std::mutex> lock(mutex_);
+    if (resumed_ || closed_) return;
+    resumed_ = true;
+    epoll_event ev{};
+    ev.events = EPOLLIN | EPOLLONESHOT;
+    ev.data.u64 = id_;
+    if (epoll_ctl(service_->epollFd_, EPOLL_CTL_ADD, fd_, &ev) != 0)
+      closeLocked(fmt::format("cannot watch the connection: {}", strerror(errno)));
+  }
+
+  void cancel() override {
+    std::lock_guard<std::mutex> lock(mutex_);
+    closeLocked("");
+  }
+
+  void sendReply(uint64_t messageId, const QRVPlist& reply) override {
+    std::vector<uint8_t> frame = QRVWireFrame::encode(reply, 0, messageId);
+    std::lock_guard<std::mutex> lock(mutex_);
+    if (closed_) return;
+    if (pendingOutput() == 0) lastProgress_ = nowMillis();
+    out_.insert(out_.end(), frame.begin(), frame.end());
+    // The worker that owns the connection flushes when its handler returns;
+    // a reply sent later, from elsewhere, is flushed here.
+    if (!busy_ && resumed_) {
+      flushLocked();
+      if (!closed_) rearmLocked();
+    }
+  }
+
+  // Runs on a worker for an epoll event of this connection.
+  void process(uint32_t events) {
+    std::unique_lock<std::mutex> lock(mutex_);
+    if (closed_ || busy_) return;  // another worker already owns it
+    busy_ = true;
+    if (events & EPOLLERR) {
+      closeLocked("socket error");
+      busy_ = false;
+      return;
+    }
+    EventHandler handler = handler_;
+    for (int frames = 0;;) {
+      if (!flushLocked()) break;
+      if (pendingOutput() > 0) break;  // backpressure: read nothing until the peer reads
+      lock.unlock();
+      std::string problem;
+      std::optional<QRVMessage> message = nextMessage(&problem);
+      lock.lock();
+      if (closed_) break;
+      if (!problem.empty()) {
+        closeLocked(problem);
+        break;
+      }
+      if (message) {
+        if (++frames > kFramesPerTurn) {
+          // Let other connections have the worker; come back at once.
+          pushBack_ = std::move(message);
+          break;
+        }
+        lock.unlock();
+        deliver(handler, std::move(*message));
+        lock.lock();
+        if (closed_) break;
+        continue;
+      }
+      if (peerEOF_) {
+        closeLocked(in_.empty() ? "" : "peer closed the connection in the middle of a frame");
+        break;
+      }
+      lock.unlock();
+      bool wouldBlock = readSome(&problem);
+      lock.lock();
+      if (!problem.empty()) {
+        closeLocked(problem);
+        break;
+      }
+      if (wouldBlock) break;
+    }
+    busy_ = false;
+    if (!closed_) rearmLocked();
+  }
+
+  // True when its replies have not moved for longer than `timeout`.
+  void closeIfStalled(int64_t now, int64_t timeoutMillis) {
+    std::lock_guard<std::mutex> lock(mutex_);
+    if (!closed_ && pendingOutput() > 0 && now - lastProgress_ > timeoutMillis)
+      closeLocked("client is not reading its replies");
+  }
+
+ private:
+  size_t pendingOutput() const { return out_.size() - outOffset_; }
+
+  // Takes the next complete frame out of the input buffer. Only the owning
+  // worker touches in_, so no lock is needed.
+  std::optional<QRVMessage> nextMessage(std::string* problem) {
+    if (pushBack_) {
+      std::optional<QRVMessage> m = std::move(pushBack_);
+      pushBack_.reset();
+      return m;
+    }
+    if (in_.size() - inOffset_ < QRVWireFrame::kHeaderSize) return std::nullopt;
+    QRVWireFrame::Header h = QRVWireFrame::decodeHeader(in_.data() + inOffset_);
+    if (h.length > QRVWireFrame::kMaxBodySize) {
+      *problem = fmt::format("frame of {} bytes exceeds the limit of {}", h.length,
+                             QRVWireFrame::kMaxBodySize);
+      return std::nullopt;
+    }
+    if (in_.size() - inOffset_ < QRVWireFrame::kHeaderSize + h.length) return std::nullopt;
+    auto body = QRVWireFrame::decodeBody(in_.data() + inOffset_ + QRVWireFrame::kHeaderSize, h.length);
+    inOffset_ += QRVWireFrame::kHeaderSize + h.length;
+    if (inOffset_ == in_.size()) {
+      in_.clear();
+      inOffset_ = 0;
+    }
+    if (!body) {
+      *problem = "message body is not a dictionary";
+      return std::nullopt;
+    }
+    QRVMessage m;
+    m.body = std::move(*body);
+    m.messageId = h.messageId;
+    m.hasReplyContext = (h.flags & QRVWireFrame::kFlagWantsReply) != 0;
+    m.connection = weak_from_this();
+    return m;
+  }
+
+  // Reads what the socket has, up to one chunk. Returns true when it had
+  // nothing (would block).
+  bool readSome(std::string* problem) {
+    if (inOffset_ > 0) {
+      in_.erase(in_.begin(), in_.begin() + static_cast<ptrdiff_t>(inOffset_));
+      inOffset_ = 0;
+    }
+    size_t old = in_.size();
+    in_.resize(old + kReadChunk);
+    ssize_t n;
+    do {
+      n = recv(fd_, in_.data() + old, kReadChunk, 0);
+    } while (n < 0 && errno == EINTR);
+    in_.resize(old + (n > 0 ? static_cast<size_t>(n) : 0));
+    if (n == 0) {
+      peerEOF_ = true;
+      return false;
+    }
+    if (n < 0) {
+      if (errno == EAGAIN || errno == EWOULDBLOCK) return true;
+      if (errno == ECONNRESET) {
+        peerEOF_ = true;
+        in_.clear();
+        return false;
+      }
+      *problem = fmt::format("read failed: {}", strerror(errno));
+    }
+    return false;
+  }
+
+  void deliver(const EventHandler& handler, QRVMessage message) {
+    if (!handler) return;
+    QRVConnectionEvent event;
+    event.kind = QRVConnectionEvent::Kind::kMessage;
+    event.message = std::move(message);
+    handler(shared_from_this(), event);
+  }
+
+  // Writes what it can. Returns false when the connection had to be closed.
+  bool flushLocked() {
+    while (pendingOutput() > 0) {
+      ssize_t n = ::send(fd_, out_.data() + outOffset_, pendingOutput(), MSG_NOSIGNAL | MSG_DONTWAIT);
+      if (n < 0) {
+        if (errno == EINTR) continue;
+        if (errno == EAGAIN || errno == EWOULDBLOCK) return true;
+        closeLocked(errno == EPIPE || errno == ECONNRESET ? ""
+                                                          : fmt::format("write failed: {}", strerror(errno)));
+        return false;
+      }
+      outOffset_ += static_cast<size_t>(n);
+      lastProgress_ = nowMillis();
+    }
+    out_.clear();
+    outOffset_ = 0;
+    return true;
+  }
+
+  void rearmLocked() {
+    epoll_event ev{};
+    bool more = pushBack_.has_value() || pendingOutput() > 0;
+    ev.events = (more ? EPOLLOUT : EPOLLIN) | EPOLLONESHOT;
+    ev.data.u64 = id_;
+    if (epoll_ctl(service_->epollFd_, EPOLL_CTL_MOD, fd_, &ev) != 0)
+      closeLocked(fmt::format("cannot re-arm the connection: {}", strerror(errno)));
+  }
+
+  // An empty reason is an ordinary end (the peer left, or the daemon
+  // cancelled); anything else is logged as the reason for cutting it off.
+  void closeLocked(const std::string& reason) {
+    if (closed_) return;
+    closed_ = true;
+    if (!reason.empty())
+      QRVLogError("closing connection from pid {} (uid {}): {}", cred_.pid, cred_.uid, reason);
+    epoll_ctl(service_->epollFd_, EPOLL_CTL_DEL, fd_, nullptr);
+    ::close(fd_);
+    fd_ = -1;
+    out_.clear();
+    outOffset_ = 0;
+    service_->forget(id_);
+  }
+
+  QRVLinuxMessageService* const service_;
+  const uint64_t id_;
+  int fd_;
+  int pidfd_;
+  const ucred cred_;
+  const QRVAuditToken token_;
+
+  std::mutex mutex_;
+  EventHandler handler_;           // GUARDED_BY(mutex_)
+  bool resumed_ = false;           // GUARDED_BY(mutex_)
+  bool busy_ = false;              // GUARDED_BY(mutex_): a worker owns the connection
+  bool closed_ = false;            // GUARDED_BY(mutex_)
+  std::vector<uint8_t> out_;       // GUARDED_BY(mutex_)
+  size_t outOffset_ = 0;           // GUARDED_BY(mutex_)
+  int64_t lastProgress_ = 0;       // GUARDED_BY(mutex_)
+
+  // Owned by the worker that holds busy_.
+  std::vector<uint8_t> in_;
+  size_t inOffset_ = 0;
+  bool peerEOF_ = false;
+  std::optional<QRVMessage> pushBack_;
+};
+
+QRVLinuxMessageService::QRVLinuxMessageService(Options options) : options_(std::move(options)) {}
+
+QRVLinuxMessageService::~QRVLinuxMessageService() {
+  stopping_ = true;
+  if (wakeFd_ >= 0) {
+    uint64_t one = 1;
+    ssize_t ignored = write(wakeFd_, &one, sizeof one);
+    (void)ignored;
+  }
+  for (auto& t : workers_) t.join();
+  std::map<uint64_t, std::shared_ptr<Connection>> connections;
+  {
+    std::lock_guard<std::mutex> lock(mutex_);
+    connections.swap(connections_);
+  }
+  for (auto& [id, c] : connections) c->cancel();
+  if (listenFd_ >= 0) ::close(listenFd_);
+  if (wakeFd_ >= 0) ::close(wakeFd_);
+  if (epollFd_ >= 0) ::close(epollFd_);
+}
+
+bool QRVLinuxMessageService::openListeningSocket(const std::string& name, QRVError* error) {
+  // Socket activation: systemd hands over a socket named after the service.
+  char** names = nullptr;
+  int n = sd_listen_fds_with_names(1, &names);
+  for (int i = 0; i < n; i++) {
+    if (listenFd_ < 0 && names && names[i] && name == names[i]) listenFd_ = SD_LISTEN_FDS_START + i;
+  }
+  if (names) {
+    for (int i = 0; i < n; i++) free(names[i]);
+    free(names);
+  }
+  if (listenFd_ >= 0) {
+    int flags = fcntl(listenFd_, F_GETFL);
+    fcntl(listenFd_, F_SETFL, flags | O_NONBLOCK);
+    QRVLogNotice("using socket-activated listener for {}", name);
+    return true;
+  }
+
+  const std::string& path = options_.socketPath;
+  sockaddr_un addr{};
+  if (path.size() >= sizeof addr.sun_path)
+    return QRVFail(error, QRV_POSIX_ERROR(ENAMETOOLONG, "socket path too long: {}", path));
+  std::error_code ec;
+  std::filesystem::create_directories(std::filesystem::path(path).parent_path(), ec);
+  // A socket left by an earlier run would make bind fail.
+  struct stat st;
+  if (lstat(path.c_str(), &st) == 0 && S_ISSOCK(st.st_mode)) unlink(path.c_str());
+
+  listenFd_ = socket(AF_UNIX, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0);
+  if (listenFd_ < 0) return QRVFail(error, QRV_POSIX_ERROR(errno, "socket: {}", strerror(errno)));
+  addr.sun_family = AF_UNIX;
+  memcpy(addr.sun_path, path.c_str(), path.size() + 1);
+  if (bind(listenFd_, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0 ||
+      chmod(path.c_str(), 0666) != 0 || ::listen(listenFd_, SOMAXCONN) != 0) {
+    int e = errno;
+    ::close(listenFd_);
+    listenFd_ = -1;
+    return QRVFail(error, QRV_POSIX_ERROR(e, "cannot listen on {}: {}", path, strerror(e)));
+  }
+  return true;
+}
+
+bool QRVLinuxMessageService::listen(const std::string& name, std::shared_ptr<QRVSerialQueue> queue,
+                                    ConnectionHandler onConnection, QRVError* error) {
+  listenerQueue_ = std::move(queue);
+  onConnection_ = std::move(onConnection);
+  epollFd_ = epoll_create1(EPOLL_CLOEXEC);
+  wakeFd_ = eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
+  if (epollFd_ < 0 || wakeFd_ < 0)
+    return QRVFail(error, QRV_POSIX_ERROR(errno, "epoll set-up failed: {}", strerror(errno)));
+  if (!openListeningSocket(name, error)) return false;
+
+  epoll_event ev{};
+  ev.events = EPOLLIN | EPOLLONESHOT;
+  ev.data.u64 = kListenerTag;
+  epoll_ctl(epollFd_, EPOLL_CTL_ADD, listenFd_, &ev);
+  ev.events = EPOLLIN;  // level-triggered: wakes every worker on shutdown
+  ev.data.u64 = kWakeTag;
+  epoll_ctl(epollFd_, EPOLL_CTL_ADD, wakeFd_, &ev);
+
+  for (size_t i = 0; i < std::max<size_t>(1, options_.workerThreads); i++)
+    workers_.emplace_back([this] { workerLoop(); });
+  return true;
+}
+
+void QRVLinuxMessageService::workerLoop() {
+  epoll_event events[16];
+  while (!stopping_) {
+    int n = epoll_wait(epollFd_, events, 16, 1000);
+    if (stopping_) return;
+    for (int i = 0; i < n; i++) {
+      uint64_t tag = events[i].data.u64;
+      if (tag == kWakeTag) continue;
+      if (tag == kListenerTag) {
+        // New connections are announced on the listener queue, after
+        // whatever it was doing (start-up) has finished.
+        listenerQueue_->async([this] { acceptPending(); });
+      } else {
+        handleConnectionEvent(tag, events[i].events);
+      }
+    }
+    int64_t now = nowMillis();
+    int64_t last = lastSweep_.load();
+    if (now - last >= 1000 && lastSweep_.compare_exchange_strong(last, now)) sweepStalledConnections();
+  }
+}
+
+void QRVLinuxMessageService::acceptPending() {
+  for (int accepted = 0; accepted < 64; accepted++) {
+    int fd = accept4(listenFd_, nullptr, nullptr, SOCK_NONBLOCK | SOCK_CLOEXEC);
+    if (fd < 0) {
+      if (errno == EINTR || errno == ECONNABORTED) continue;
+      if (errno != EAGAIN && errno != EWOULDBLOCK) {
+        QRVLogError("accept failed: {}", strerror(errno));
+        // Out of descriptors: give the clients that hold them a moment.
+        if (errno == EMFILE || errno == ENFILE) usleep(10'000);
+      }
+      break;
+    }
+    ucred cred{};
+    socklen_t len = sizeof cred;
+    if (getsockopt(fd, SOL_SOCKET, SO_PEERCRED, &cred, &len) != 0) {
+      QRVLogError("cannot read peer credentials: {}", strerror(errno));
+      ::close(fd);
+      continue;
+    }
+    // The pidfd pins the peer's identity: if the process is gone by the time
+    // its start time has been read, the pid may already be someone else's.
+    int pidfd = static_cast<int>(syscall(SYS_pidfd_open, cred.pid, 0));
+    std::optional<uint64_t> start = QRVProcInfo::startTime(cred.pid);
+    if (pidfd >= 0) {
+      pollfd p{pidfd, POLLIN, 0};
+      if (poll(&p, 1, 0) == 1) start.reset();
+    }
+    QRVAuditToken token = QRVAuditToken::make(cred.uid, cred.gid, cred.pid, start.value_or(0));
+    std::shared_ptr<Connection> connection;
+    {
+      std::lock_guard<std::mutex> lock(mutex_);
+      uint64_t id = nextConnectionId_++;
+      connection = std::make_shared<Connection>(this, id, fd, cred, token, pidfd);
+      connections_[id] = connection;
+    }
+    if (onConnection_) onConnection_(connection);
+  }
+  epoll_event ev{};
+  ev.events = EPOLLIN | EPOLLONESHOT;
+  ev.data.u64 = kListenerTag;
+  epoll_ctl(epollFd_, EPOLL_CTL_MOD, listenFd_, &ev);
+}
+
+void QRVLinuxMessageService::handleConnectionEvent(uint64_t id, uint32_t events) {
+  if (std::shared_ptr<Connection> c = find(id)) c->process(events);
+}
+
+void QRVLinuxMessageService::sweepStalledConnections() {
+  std::vector<std::shared_ptr<Connection>> all;
+  {
+    std::lock_guard<std::mutex> lock(mutex_);
+    for (auto& [id, c] : connections_) all.push_back(c);
+  }
+  int64_t now = nowMillis();
+  for (auto& c : all) c->closeIfStalled(now, options_.writeStallTimeout.count());
+}
+
+void QRVLinuxMessageService::forget(uint64_t id) {
+  std::lock_guard<std::mutex> lock(mutex_);
+  connections_.erase(id);
+}
+
+std::shared_ptr<QRVLinuxMessageService::Connection> QRVLinuxMessageService::find(uint64_t id) const {
+  std::lock_guard<std::mutex> lock(mutex_);
+  auto it = connections_.find(id);
+  return it == connections_.end() ? nullptr : it->second;
+}
+
+void QRVLinuxMessageService::beginTransaction() { transactions_++; }
+void QRVLinuxMessageService::endTransaction() { transactions_--; }
+
+bool QRVLinuxMessageService::isIdle() const { return transactions_ == 0 && openConnections() == 0; }
+
+size_t QRVLinuxMessageService::openConnections() const {
+  std::lock_guard<std::mutex> lock(mutex_);
+  return connections_.size();
+}

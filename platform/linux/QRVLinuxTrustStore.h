@@ -1,0 +1,47 @@
+// Trust store backed by <root>/etc/quorva/clients.d/: one property list per
+// client with "SigningIdentifier" (string), "Entitlements" (dictionary) and
+// what a peer must match, "Executable" (absolute path, compared by device and
+// inode with /proc/<pid>/exe) and/or "UID". An entry with neither matches
+// nobody. Entries are tried in file-name order; the first match wins.
+//
+// The directory is watched with inotify and re-read on the next look-up after
+// a change, so look-ups cost no file I/O in the steady state.
+#pragma once
+
+#include <mutex>
+#include <string>
+#include <vector>
+
+#include "QRVTrustStore.h"
+#include "linux/QRVProcInfo.h"
+
+class QRVLinuxTrustStore : public QRVTrustStore {
+ public:
+  explicit QRVLinuxTrustStore(std::string directory);
+  ~QRVLinuxTrustStore() override;
+
+  std::optional<std::string> signingIdentifierForAuditToken(const QRVAuditToken& token,
+                                                            QRVError* error) override;
+  std::optional<QRVPlist> entitlementsForAuditToken(const QRVAuditToken& token) override;
+
+ private:
+  struct Entry {
+    std::string file;
+    std::string signingIdentifier;
+    QRVPlist entitlements;
+    std::optional<QRVProcInfo::FileId> executable;
+    bool executableMissing = false;  // named a path that does not exist: matches nobody
+    std::optional<uid_t> uid;
+  };
+
+  // The entry for the live process behind `token`, or null.
+  const Entry* match(const QRVAuditToken& token);
+  void reloadIfChangedLocked();
+  void loadLocked();
+
+  const std::string directory_;
+  std::mutex mutex_;
+  int inotifyFd_ = -1;
+  bool loaded_ = false;        // GUARDED_BY(mutex_)
+  std::vector<Entry> entries_;  // GUARDED_BY(mutex_)
+};

@@ -1,0 +1,30 @@
+#include "QRVPlatform.h"
+#include "linux/QRVLinuxAccounts.h"
+#include "linux/QRVLinuxFeatureFlags.h"
+#include "linux/QRVLinuxFirstBootMarker.h"
+#include "linux/QRVLinuxLockStateService.h"
+#include "linux/QRVLinuxMessageService.h"
+#include "linux/QRVLinuxNotificationService.h"
+#include "linux/QRVLinuxSandbox.h"
+#include "linux/QRVLinuxSystemInfo.h"
+#include "linux/QRVLinuxTrustStore.h"
+
+QRVPlatform QRVPlatform::makeLinux(const std::string& root) {
+  std::string r = root;
+  while (r.size() > 1 && r.back() == '/') r.pop_back();
+  auto under = [&](const std::string& path) { return r == "/" ? path : r + path; };
+
+  QRVPlatform p;
+  QRVLinuxMessageService::Options options;
+  options.socketPath = under("/run/quorvad/com.kelva.quorvad");
+  p.messages = std::make_shared<QRVLinuxMessageService>(options);
+  p.trustStore = std::make_shared<QRVLinuxTrustStore>(under("/etc/quorva/clients.d"));
+  p.sandbox = std::make_shared<QRVLinuxSandbox>();
+  p.lockState = std::make_shared<QRVLinuxLockStateService>(under("/run/quorva/lockstate"));
+  p.notifications = std::make_shared<QRVLinuxNotificationService>(under("/run/quorva/notify"));
+  p.firstBootMarker = std::make_shared<QRVLinuxFirstBootMarker>(r);
+  p.systemInfo = std::make_shared<QRVLinuxSystemInfo>(under("/etc/os-release"));
+  p.accounts = std::make_shared<QRVLinuxAccounts>(under("/etc/passwd"), under("/etc/group"));
+  p.featureFlags = std::make_shared<QRVLinuxFeatureFlags>(under("/etc/quorva/features.plist"));
+  return p;
+}

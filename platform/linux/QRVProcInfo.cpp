@@ -1,0 +1,77 @@
+#include "linux/QRVProcInfo.h"
+
+#include <sys/stat.h>
+
+#include <cstdlib>
+#include <fstream>
+#include <sstream>
+#include <string>
+
+namespace QRVProcInfo {
+
+namespace {
+
+std::string readFile(const std::string& path) {
+  std::ifstream in(path);
+  std::stringstream ss;
+  ss << in.rdbuf();
+  return ss.str();
+}
+
+std::string procPath(pid_t pid, const char* leaf) { return "/proc/" + std::to_string(pid) + "/" + leaf; }
+
+}  // namespace
+
+std::optional<uint64_t> startTime(pid_t pid) {
+  std::string stat = readFile(procPath(pid, "stat"));
+  // The command name (field 2) may hold spaces and parentheses; fields after
+  // it start behind the last ')'.
+  size_t close = stat.rfind(')');
+  if (close == std::string::npos) return std::nullopt;
+  std::istringstream fields(stat.substr(close + 1));
+  std::string field;
+  // Fields 3..21 precede the start time.
+  for (int i = 3; i <= 21; i++)
+    if (!(fields >> field)) return std::nullopt;
+  uint64_t start = 0;
+  if (!(fields >> start)) return std::nullopt;
+  return start;
+}
+
+std::optional<FileId> executable(pid_t pid) {
+  struct stat st;
+  if (stat(procPath(pid, "exe").c_str(), &st) != 0) return std::nullopt;
+  return FileId{st.st_dev, st.st_ino};
+}
+
+bool isSandboxed(pid_t pid) {
+  std::istringstream status(readFile(procPath(pid, "status")));
+  bool noNewPrivs = false, seccompFilter = false;
+  for (std::string line; std::getline(status, line);) {
+    if (line.rfind("NoNewPrivs:", 0) == 0) noNewPrivs = atoi(line.c_str() + 11) == 1;
+    if (line.rfind("Seccomp:", 0) == 0) seccompFilter = atoi(line.c_str() + 8) == 2;
+  }
+  return noNewPrivs && seccompFilter;
+}
+
+std::optional<uint32_t> personaFromCgroup(pid_t pid) {
+  static const std::string kPrefix = "persona-", kSuffix = ".slice";
+  std::istringstream cgroups(readFile(procPath(pid, "cgroup")));
+  for (std::string line; std::getline(cgroups, line);) {
+    size_t at = line.find(kPrefix);
+    while (at != std::string::npos) {
+      size_t end = line.find(kSuffix, at);
+      if (end == std::string::npos) break;
+      std::string digits = line.substr(at + kPrefix.size(), end - at - kPrefix.size());
+      if (!digits.empty() && digits.size() <= 10 &&
+          digits.find_first_not_of("0123456789") == std::string::npos) {
+        uint64_t id = std::stoull(digits);
+        if (id <= UINT32_MAX) return static_cast<uint32_t>(id);
+      }
+      at = line.find(kPrefix, end);
+    }
+  }
+  return std::nullopt;
+}
+
+}  // namespace QRVProcInfo

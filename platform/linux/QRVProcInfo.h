@@ -1,0 +1,32 @@
+// Facts about a live process read from /proc. Every function answers for the
+// process as it is at the time of the call; callers that need them to belong
+// to a particular process compare its start time (see QRVAuditToken).
+#pragma once
+
+#include <sys/types.h>
+
+#include <cstdint>
+#include <optional>
+#include <string>
+
+namespace QRVProcInfo {
+
+// Field 22 of /proc/<pid>/stat: clock ticks after boot at which it started.
+std::optional<uint64_t> startTime(pid_t pid);
+
+// Device and inode of the process's executable (/proc/<pid>/exe).
+struct FileId {
+  dev_t device = 0;
+  ino_t inode = 0;
+  bool operator==(const FileId&) const = default;
+};
+std::optional<FileId> executable(pid_t pid);
+
+// Runs with no_new_privs and a seccomp filter: how a sandboxed process shows.
+bool isSandboxed(pid_t pid);
+
+// The numeric id of a "persona-<id>.slice" component of the process's cgroup
+// path, if any.
+std::optional<uint32_t> personaFromCgroup(pid_t pid);
+
+}  // namespace QRVProcInfo
