@@ -1,0 +1,76 @@
+#include "QRVClientConnection.h"
+
+#include "QRVLog.h"
+
+QRVClientConnection::QRVClientConnection(std::shared_ptr<const QRVClientIdentity> clientIdentity, bool entitled,
+                                         bool allowOtherIdLookup, bool unrestricted,
+                                         std::optional<QRVPlist> lookup,
+                                         std::optional<QRVPlist::Array> entitledWipeIdentifiers,
+                                         std::shared_ptr<QRVCommandQueue> commandQueue,
+                                         std::shared_ptr<QRVServices> services)
+    : clientIdentity_(std::move(clientIdentity)),
+      entitled_(entitled),
+      allowOtherIdLookup_(allowOtherIdLookup),
+      unrestricted_(unrestricted),
+      lookup_(std::move(lookup)),
+      entitledWipeIdentifiers_(std::move(entitledWipeIdentifiers)),
+      commandQueue_(std::move(commandQueue)),
+      services_(std::move(services)) {}
+
+std::shared_ptr<QRVClientConnection> QRVClientConnection::makeSharedClientConnection(
+    std::shared_ptr<QRVServices> services) {
+  return std::make_shared<QRVClientConnection>(QRVClientIdentity::anonymousPrivilegedClientIdentity(), true, false,
+                                               true, std::nullopt, std::nullopt,
+                                               std::make_shared<QRVCommandQueue>(), std::move(services));
+}
+
+bool QRVClientConnection::completeWithError(uint64_t* result) {
+  return commandQueue_->executeAllUntilExhaustedOrError(result);
+}
+
+// The boot steps below are entry points that the container lifecycle work
+// fills in; until then they say so in the log, so a reader of the log knows
+// that nothing was restored or cleaned.
+
+void QRVClientConnection::rebootQuorvaSetup() {
+  QRVLogNotice("reboot set-up does nothing yet: there is no container state to restore");
+}
+
+void QRVClientConnection::quorvaSetup() {
+  QRVLogNotice("boot set-up does nothing yet: no replace recovery or code-signing reconciliation is built");
+}
+
+void QRVClientConnection::rebootQuorvaCleanupWithCompletion(std::function<void()> completion) {
+  services_->backgroundQueue->async([completion = std::move(completion)] {
+    QRVLogNotice("reboot cleanup does nothing yet");
+    if (completion) completion();
+  });
+}
+
+void QRVClientConnection::quorvaCleanupWithCompletion(std::function<void()> completion) {
+  services_->backgroundQueue->async([completion = std::move(completion)] {
+    QRVLogNotice("boot cleanup does nothing yet: staging and death row are not emptied");
+    if (completion) completion();
+  });
+}
+
+bool QRVClientConnection::retryTestWithNumCrashes(uint64_t numCrashes, QRVError* error) {
+  QRVFileManager& fm = *services_->fileManager;
+  std::string directory = services_->globalConfiguration->homeDirectory() + "Library/Quorva";
+  if (!fm.createDirectoryAtURL(directory, true, 0755, error)) return false;
+  std::string path = directory + "/retry-test.plist";
+
+  uint64_t crashed = 0;
+  std::vector<uint8_t> bytes;
+  if (fm.readFileAtURL(path, &bytes, nullptr)) {
+    if (auto record = QRVPlist::fromBytes(bytes.data(), bytes.size())) crashed = record->uint64ForKey("QRVRetryTestCrashes");
+  }
+  if (crashed >= numCrashes) {
+    QRVLogNotice("retry test done after {} crashes", crashed);
+    return fm.removeFileAtURL(path, error);
+  }
+  QRVPlist record = QRVPlist::dictionary().set("QRVRetryTestCrashes", QRVPlist::uinteger(crashed + 1));
+  if (!fm.writeFileAtomically(path, record.toBinary(), 0644, error)) return false;
+  QRVLogNotice("retry test: crashing ({} of {})", crashed + 1, numCrashes);
+  abort();
+}

@@ -1,0 +1,24 @@
+#include "QRVCommandHandlers.h"
+
+#include "QRVClientConnection.h"
+#include "QRVLog.h"
+
+// The function names below are what the log lines name.
+namespace {
+
+void retryTest(const QRVPlist& request, QRVClientConnection& connection, uint64_t* result) {
+  if (!connection.services().globalConfiguration->isInternalImage()) {
+    // Deliberately a success: the caller learns nothing about the build.
+    QRVLogError("People really shouldn't be calling this on non-internal installs!");
+    return;
+  }
+  QRVError error;
+  if (!connection.retryTestWithNumCrashes(request.uint64ForKey("NumRetryCrashes"), &error)) *result = error.code();
+}
+
+}  // namespace
+
+void QRVHandleRetryTest(const QRVPlist& request, const std::shared_ptr<QRVReply>&, QRVClientConnection& connection,
+                        uint64_t* result) {
+  retryTest(request, connection, result);
+}

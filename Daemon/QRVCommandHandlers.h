@@ -1,0 +1,8 @@
+// The handlers of the command table. Each unpacks its arguments, calls one
+// operation, and writes its results into the reply.
+#pragma once
+
+#include "QRVCommandTable.h"
+
+void QRVHandleRetryTest(const QRVPlist& request, const std::shared_ptr<QRVReply>& reply,
+                        QRVClientConnection& connection, uint64_t* result);

@@ -1,0 +1,54 @@
+#include "QRVCommandQueue.h"
+
+#include "QRVLog.h"
+
+QRVCommandQueue::QRVCommandQueue() : queue_(QRVSerialQueue::create("com.kelva.quorvad.QRVCommandQueue")) {}
+
+void QRVCommandQueue::insertCommand(std::shared_ptr<QRVCommand> command) {
+  uint64_t type = command->command();
+  const void* address = command.get();
+  {
+    std::lock_guard<std::mutex> lock(mutex_);
+    commands_.push_back(std::move(command));
+  }
+  QRVLogInfo("Added command <{}; {}> to queue", address, type);
+}
+
+bool QRVCommandQueue::executeNextCommandWithError(uint64_t* result) {
+  std::shared_ptr<QRVCommand> command;
+  {
+    std::lock_guard<std::mutex> lock(mutex_);
+    if (!commands_.empty()) {
+      command = std::move(commands_.front());
+      commands_.pop_front();
+    }
+  }
+  if (!command) {
+    if (result) *result = kExhausted;
+    return false;
+  }
+  uint64_t code = 1;
+  bool success = false;
+  queue_->sync([&] {
+    QRVLogInfo("Executing command <{}; {}>...", static_cast<const void*>(command.get()), command->command());
+    success = command->fromQueue(*this, &code);
+    QRVLogInfo("Completed command <{}; {}>: success = {}, error = {}", static_cast<const void*>(command.get()),
+               command->command(), success ? 1 : 0, code);
+  });
+  if (!success && result) *result = code;
+  return success;
+}
+
+bool QRVCommandQueue::executeAllUntilExhaustedOrError(uint64_t* result) {
+  uint64_t code = 1;
+  while (executeNextCommandWithError(&code)) {
+  }
+  if (code == kExhausted) return true;
+  if (result) *result = code;
+  return false;
+}
+
+size_t QRVCommandQueue::pendingCount() {
+  std::lock_guard<std::mutex> lock(mutex_);
+  return commands_.size();
+}

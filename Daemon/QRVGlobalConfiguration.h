@@ -1,0 +1,40 @@
+// The daemon-wide configuration: the root every path lives under, and the
+// daemon's own directories.
+//
+// Directory accessors create their directory on every access and return the
+// path even when creation fails, logging the failure: the caller's own use of
+// the path then reports the real problem.
+#pragma once
+
+#include <memory>
+#include <mutex>
+#include <string>
+
+#include "QRVFileManager.h"
+#include "QRVSystemInfo.h"
+
+class QRVGlobalConfiguration {
+ public:
+  QRVGlobalConfiguration(std::string root, std::shared_ptr<QRVSystemInfo> systemInfo,
+                         std::shared_ptr<QRVFileManager> fileManager);
+
+  const std::string& root() const { return root_; }
+  // `path` (absolute, as on a device) under the root.
+  std::string pathUnderRoot(const std::string& path) const;
+
+  // The daemon's home: "/private/var/root/" under the root.
+  std::string homeDirectory() const;
+  // HOME + "Library/Logs/Quorva", mode 0755.
+  std::string logDirectory();
+
+  bool isInternalImage();
+  // Overrides what the build variant says (tests).
+  void setIsInternalImage(bool internal);
+
+ private:
+  const std::string root_;
+  const std::shared_ptr<QRVSystemInfo> systemInfo_;
+  const std::shared_ptr<QRVFileManager> fileManager_;
+  std::mutex mutex_;
+  int internalOverride_ = -1;  // GUARDED_BY(mutex_): -1 none, else 0/1
+};

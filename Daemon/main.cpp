@@ -1,0 +1,94 @@
+// quorvad: owns every application's containers on disk.
+//
+// Usage: quorvad [--root DIR] [--log-level N] [--idle-exit SECONDS]
+//   --root DIR        every path the daemon uses lies under DIR (default "/",
+//                     or $QUORVAD_ROOT)
+//   --log-level N     level of the log file: 5 notice (default), 7 debug
+//   --idle-exit S     exit after S seconds without connections or pending
+//                     work (for socket activation; default: never)
+#include <signal.h>
+#include <systemd/sd-daemon.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <string>
+#include <thread>
+
+#include "QRVDaemon.h"
+#include "QRVExceptionReporter.h"
+#include "QRVLog.h"
+#include "QRVPlatform.h"
+#include "QRVServices.h"
+
+namespace {
+
+struct Arguments {
+  std::string root = "/";
+  int logLevel = QRVLogLevel::kNotice;
+  int idleExitSeconds = 0;
+};
+
+[[noreturn]] void usage(const char* problem) {
+  if (problem) fprintf(stderr, "quorvad: %s\n", problem);
+  fprintf(stderr, "usage: quorvad [--root DIR] [--log-level N] [--idle-exit SECONDS]\n");
+  exit(2);
+}
+
+Arguments parseArguments(int argc, char** argv) {
+  Arguments a;
+  if (const char* env = getenv("QUORVAD_ROOT"); env && *env) a.root = env;
+  for (int i = 1; i < argc; i++) {
+    std::string arg = argv[i];
+    auto value = [&]() -> std::string {
+      if (i + 1 >= argc) usage(("missing value for " + arg).c_str());
+      return argv[++i];
+    };
+    if (arg == "--root") {
+      a.root = value();
+    } else if (arg == "--log-level") {
+      a.logLevel = atoi(value().c_str());
+    } else if (arg == "--idle-exit") {
+      a.idleExitSeconds = atoi(value().c_str());
+    } else if (arg == "--help" || arg == "-h") {
+      usage(nullptr);
+    } else {
+      usage(("unknown argument " + arg).c_str());
+    }
+  }
+  if (a.root.empty() || a.root[0] != '/') usage("--root needs an absolute path");
+  return a;
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  Arguments args = parseArguments(argc, argv);
+  // Replies to a peer that has gone must not kill the daemon.
+  signal(SIGPIPE, SIG_IGN);
+  QRVSerialQueue::setUncaughtExceptionHandler(QRVReportUncaughtException);
+  std::set_terminate([] { QRVReportUncaughtException(std::current_exception()); });
+
+  auto services = QRVServices::make(args.root, QRVPlatform::makeLinux(args.root));
+  QRVDaemon daemon(services, {args.logLevel});
+  daemon.start();
+  // Tell systemd we are ready once start-up has run.
+  daemon.listenerQueue()->async([] { sd_notify(0, "READY=1"); });
+
+  // The run loop: the daemon's work happens on its queues; the main thread
+  // only watches for idleness when asked to exit when idle.
+  auto idleSince = std::chrono::steady_clock::now();
+  for (;;) {
+    std::this_thread::sleep_for(std::chrono::seconds(1));
+    if (args.idleExitSeconds <= 0) continue;
+    auto now = std::chrono::steady_clock::now();
+    if (!services->platform.messages->isIdle()) {
+      idleSince = now;
+    } else if (now - idleSince >= std::chrono::seconds(args.idleExitSeconds)) {
+      QRVLogNotice("idle for {} seconds; exiting", args.idleExitSeconds);
+      _exit(0);
+    }
+  }
+}

@@ -1,0 +1,68 @@
+// Daemon services on a temporary root with fake platform services.
+#pragma once
+
+#include <atomic>
+#include <cstdlib>
+#include <filesystem>
+#include <memory>
+#include <string>
+
+#include "QRVServices.h"
+#include "fake/QRVFakePlatform.h"
+
+class QRVTemporaryDirectory {
+ public:
+  QRVTemporaryDirectory() {
+    std::string pattern = (std::filesystem::temp_directory_path() / "quorvad-test-XXXXXX").string();
+    path_ = mkdtemp(pattern.data()) ? pattern : std::string();
+  }
+  ~QRVTemporaryDirectory() {
+    std::error_code ec;
+    if (!path_.empty()) std::filesystem::remove_all(path_, ec);
+  }
+  const std::string& path() const { return path_; }
+
+ private:
+  std::string path_;
+};
+
+// A message service that serves nothing: for tests that drive the daemon's
+// objects directly.
+class QRVNullMessageService : public QRVMessageService {
+ public:
+  bool listen(const std::string&, std::shared_ptr<QRVSerialQueue>, ConnectionHandler, QRVError*) override {
+    return true;
+  }
+  void beginTransaction() override { transactions++; }
+  void endTransaction() override { transactions--; }
+  bool isIdle() const override { return transactions == 0; }
+  std::atomic<int> transactions{0};
+};
+
+struct QRVTestServices {
+  QRVTemporaryDirectory root;
+  std::shared_ptr<QRVNullMessageService> messages = std::make_shared<QRVNullMessageService>();
+  std::shared_ptr<QRVFakeTrustStore> trustStore = std::make_shared<QRVFakeTrustStore>();
+  std::shared_ptr<QRVFakeSandbox> sandbox = std::make_shared<QRVFakeSandbox>();
+  std::shared_ptr<QRVFakeLockStateService> lockState = std::make_shared<QRVFakeLockStateService>();
+  std::shared_ptr<QRVFakeNotificationService> notifications = std::make_shared<QRVFakeNotificationService>();
+  std::shared_ptr<QRVFakeFirstBootMarker> firstBootMarker = std::make_shared<QRVFakeFirstBootMarker>();
+  std::shared_ptr<QRVFakeSystemInfo> systemInfo = std::make_shared<QRVFakeSystemInfo>();
+  std::shared_ptr<QRVFakeAccounts> accounts = std::make_shared<QRVFakeAccounts>();
+  std::shared_ptr<QRVFakeFeatureFlags> featureFlags = std::make_shared<QRVFakeFeatureFlags>();
+  std::shared_ptr<QRVServices> services;
+
+  QRVTestServices() {
+    QRVPlatform p;
+    p.messages = messages;
+    p.trustStore = trustStore;
+    p.sandbox = sandbox;
+    p.lockState = lockState;
+    p.notifications = notifications;
+    p.firstBootMarker = firstBootMarker;
+    p.systemInfo = systemInfo;
+    p.accounts = accounts;
+    p.featureFlags = featureFlags;
+    services = QRVServices::make(root.path(), std::move(p));
+  }
+};
