@@ -82,3 +82,6 @@ inline bool QRVFail(QRVError* out, QRVError e) {
 #define QRV_POSIX_ERROR(errnum, ...)                                                        \
   QRVError::make(QRVError::kPOSIXDomain, static_cast<uint64_t>(errnum), __func__, __LINE__, \
                  QRVLogLevel::kError, fmt::format(__VA_ARGS__))
+#define QRV_POSIX_ERROR_QUIET(errnum, ...)                                                  \
+  QRVError::make(QRVError::kPOSIXDomain, static_cast<uint64_t>(errnum), __func__, __LINE__, -1, \
+                 fmt::format(__VA_ARGS__))
