@@ -6,10 +6,14 @@
 //   --log-level N     level of the log file: 5 notice (default), 7 debug
 //   --idle-exit S     exit after S seconds without connections or pending
 //                     work (for socket activation; default: never)
+//   --write-stall-timeout MS
+//                     close a client that leaves its replies unread this long
+//                     (default 30000)
 #include <signal.h>
 #include <systemd/sd-daemon.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <chrono>
 #include <cstdio>
 #include <cstdlib>
@@ -29,11 +33,12 @@ struct Arguments {
   std::string root = "/";
   int logLevel = QRVLogLevel::kNotice;
   int idleExitSeconds = 0;
+  int writeStallMillis = 30'000;
 };
 
 [[noreturn]] void usage(const char* problem) {
   if (problem) fprintf(stderr, "quorvad: %s\n", problem);
-  fprintf(stderr, "usage: quorvad [--root DIR] [--log-level N] [--idle-exit SECONDS]\n");
+  fprintf(stderr, "usage: quorvad [--root DIR] [--log-level N] [--idle-exit SECONDS] [--write-stall-timeout MS]\n");
   exit(2);
 }
 
@@ -52,6 +57,8 @@ Arguments parseArguments(int argc, char** argv) {
       a.logLevel = atoi(value().c_str());
     } else if (arg == "--idle-exit") {
       a.idleExitSeconds = atoi(value().c_str());
+    } else if (arg == "--write-stall-timeout") {
+      a.writeStallMillis = atoi(value().c_str());
     } else if (arg == "--help" || arg == "-h") {
       usage(nullptr);
     } else {
@@ -71,7 +78,9 @@ int main(int argc, char** argv) {
   QRVSerialQueue::setUncaughtExceptionHandler(QRVReportUncaughtException);
   std::set_terminate([] { QRVReportUncaughtException(std::current_exception()); });
 
-  auto services = QRVServices::make(args.root, QRVPlatform::makeLinux(args.root));
+  QRVPlatform::LinuxOptions linuxOptions;
+  linuxOptions.writeStallTimeout = std::chrono::milliseconds(std::max(100, args.writeStallMillis));
+  auto services = QRVServices::make(args.root, QRVPlatform::makeLinux(args.root, linuxOptions));
   QRVDaemon daemon(services, {args.logLevel});
   daemon.start();
   // Tell systemd we are ready once start-up has run.

@@ -2,6 +2,7 @@
 // main() builds the real ones; tests mix real and fake services.
 #pragma once
 
+#include <chrono>
 #include <memory>
 #include <string>
 
@@ -26,6 +27,10 @@ struct QRVPlatform {
   std::shared_ptr<QRVAccounts> accounts;
   std::shared_ptr<QRVFeatureFlags> featureFlags;
 
+  struct LinuxOptions {
+    // How long a client may leave its replies unread before it is cut off.
+    std::chrono::milliseconds writeStallTimeout{30'000};
+  };
   // The Linux services for a daemon whose paths all lie under `root`.
-  static QRVPlatform makeLinux(const std::string& root);
+  static QRVPlatform makeLinux(const std::string& root, const LinuxOptions& options);
 };

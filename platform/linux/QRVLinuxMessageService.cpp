@@ -24,8 +24,6 @@ namespace {
 constexpr uint64_t kListenerTag = 0;
 constexpr uint64_t kWakeTag = UINT64_MAX;
 constexpr size_t kReadChunk = 64 * 1024;
-// Frames handled per wake-up before the connection yields its worker.
-constexpr int kFramesPerTurn = 64;
 
 int64_t nowMillis() {
   return std::chrono::duration_cast<std::chrono::milliseconds>(
@@ -92,12 +90,18 @@ class QRVLinuxMessageService::Connection : public QRVConnection {
     if (closed_ || busy_) return;  // another worker already owns it
     busy_ = true;
     if (events & EPOLLERR) {
-      closeLocked("socket error");
+      // A peer that left with unread replies shows as a reset: an ordinary end.
+      int err = 0;
+      socklen_t len = sizeof err;
+      getsockopt(fd_, SOL_SOCKET, SO_ERROR, &err, &len);
+      closeLocked(err == ECONNRESET || err == EPIPE || err == 0 ? "" : fmt::format("socket error: {}", strerror(err)));
       busy_ = false;
       return;
     }
     EventHandler handler = handler_;
-    for (int frames = 0;;) {
+    // A connection keeps its worker while it has requests and its replies are
+    // being read; the other workers serve everyone else meanwhile.
+    for (;;) {
       if (!flushLocked()) break;
       if (pendingOutput() > 0) break;  // backpressure: read nothing until the peer reads
       lock.unlock();
@@ -110,11 +114,6 @@ class QRVLinuxMessageService::Connection : public QRVConnection {
         break;
       }
       if (message) {
-        if (++frames > kFramesPerTurn) {
-          // Let other connections have the worker; come back at once.
-          pushBack_ = std::move(message);
-          break;
-        }
         lock.unlock();
         deliver(handler, std::move(*message));
         lock.lock();
@@ -151,11 +150,6 @@ class QRVLinuxMessageService::Connection : public QRVConnection {
   // Takes the next complete frame out of the input buffer. Only the owning
   // worker touches in_, so no lock is needed.
   std::optional<QRVMessage> nextMessage(std::string* problem) {
-    if (pushBack_) {
-      std::optional<QRVMessage> m = std::move(pushBack_);
-      pushBack_.reset();
-      return m;
-    }
     if (in_.size() - inOffset_ < QRVWireFrame::kHeaderSize) return std::nullopt;
     QRVWireFrame::Header h = QRVWireFrame::decodeHeader(in_.data() + inOffset_);
     if (h.length > QRVWireFrame::kMaxBodySize) {
@@ -241,8 +235,8 @@ class QRVLinuxMessageService::Connection : public QRVConnection {
 
   void rearmLocked() {
     epoll_event ev{};
-    bool more = pushBack_.has_value() || pendingOutput() > 0;
-    ev.events = (more ? EPOLLOUT : EPOLLIN) | EPOLLONESHOT;
+    // While replies wait to be written, requests are left unread.
+    ev.events = (pendingOutput() > 0 ? EPOLLOUT : EPOLLIN) | EPOLLONESHOT;
     ev.data.u64 = id_;
     if (epoll_ctl(service_->epollFd_, EPOLL_CTL_MOD, fd_, &ev) != 0)
       closeLocked(fmt::format("cannot re-arm the connection: {}", strerror(errno)));
@@ -283,7 +277,6 @@ class QRVLinuxMessageService::Connection : public QRVConnection {
   std::vector<uint8_t> in_;
   size_t inOffset_ = 0;
   bool peerEOF_ = false;
-  std::optional<QRVMessage> pushBack_;
 };
 
 QRVLinuxMessageService::QRVLinuxMessageService(Options options) : options_(std::move(options)) {}

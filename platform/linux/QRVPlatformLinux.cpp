@@ -9,7 +9,7 @@
 #include "linux/QRVLinuxSystemInfo.h"
 #include "linux/QRVLinuxTrustStore.h"
 
-QRVPlatform QRVPlatform::makeLinux(const std::string& root) {
+QRVPlatform QRVPlatform::makeLinux(const std::string& root, const LinuxOptions& linuxOptions) {
   std::string r = root;
   while (r.size() > 1 && r.back() == '/') r.pop_back();
   auto under = [&](const std::string& path) { return r == "/" ? path : r + path; };
@@ -17,6 +17,7 @@ QRVPlatform QRVPlatform::makeLinux(const std::string& root) {
   QRVPlatform p;
   QRVLinuxMessageService::Options options;
   options.socketPath = under("/run/quorvad/com.kelva.quorvad");
+  options.writeStallTimeout = linuxOptions.writeStallTimeout;
   p.messages = std::make_shared<QRVLinuxMessageService>(options);
   p.trustStore = std::make_shared<QRVLinuxTrustStore>(under("/etc/quorva/clients.d"));
   p.sandbox = std::make_shared<QRVLinuxSandbox>();

@@ -1,0 +1,50 @@
+// Runs the real quorvad binary on a temporary root, for integration tests.
+//
+// The root is prepared as a development root (accounts, os-release, lock
+// state) with a trust store written by the test. Clients reach the daemon
+// from other processes, usually under other uids (see QRVRunAs.h).
+#pragma once
+
+#include <sys/types.h>
+
+#include <chrono>
+#include <map>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "QRVPlist.h"
+
+class QRVDaemonProcess {
+ public:
+  // Makes a fresh root (world-searchable, so clients of any uid can reach
+  // the socket). The daemon is not started yet.
+  QRVDaemonProcess();
+  // Stops the daemon, forgets the root's first-boot marker, removes the root.
+  ~QRVDaemonProcess();
+
+  const std::string& root() const { return root_; }
+  std::string socketPath() const { return root_ + "/run/quorvad/com.kelva.quorvad"; }
+  std::string logPath() const { return root_ + "/private/var/root/Library/Logs/Quorva/quorvad.log"; }
+
+  // A trust-store entry matching processes of `uid`.
+  void trustUID(uid_t uid, const std::string& signingIdentifier, const QRVPlist& entitlements);
+
+  // Starts the daemon with `extraArguments` and waits until it answers on its
+  // socket. Returns the time that took.
+  std::chrono::milliseconds start(const std::vector<std::string>& extraArguments = {});
+  // Stops it (SIGTERM, then SIGKILL) and reaps it.
+  void stop();
+  // Waits for the daemon to exit by itself; returns its wait status.
+  std::optional<int> waitForExit(std::chrono::milliseconds timeout);
+  bool isRunning();
+  pid_t pid() const { return pid_; }
+
+  std::string readLog() const;
+  // Waits until the log contains `text`.
+  bool logEventuallyContains(const std::string& text, std::chrono::milliseconds timeout = std::chrono::seconds(5));
+
+ private:
+  std::string root_;
+  pid_t pid_ = -1;
+};

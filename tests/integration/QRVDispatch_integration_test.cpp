@@ -1,0 +1,245 @@
+// The real daemon, reached from separate processes under different uids.
+#include <gtest/gtest.h>
+
+#include <fcntl.h>
+#include <poll.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cstring>
+#include <filesystem>
+
+#include "QRVClient.h"
+#include "QRVDaemonProcess.h"
+#include "QRVRunAs.h"
+#include "QRVWireFrame.h"
+
+namespace {
+
+constexpr uid_t kAllowedUID = 2001;   // "com.kelva.private.Quorva.allowed"
+constexpr uid_t kPlainUID = 2002;     // known, no entitlements
+constexpr uid_t kTesterUID = 2003;    // testability only
+constexpr uid_t kStrangerUID = 2004;  // not in the trust store
+
+QRVPlist request(uint64_t command) { return QRVPlist::dictionary().set("Command", QRVPlist::uinteger(command)); }
+
+// Sends each request in turn from a process running as `uid` and returns
+// the result codes, space-separated ("x" for a request without reply).
+std::string resultsAs(const QRVDaemonProcess& daemon, uid_t uid, const std::vector<QRVPlist>& requests) {
+  auto out = QRVRunAs(uid, uid, [&] {
+    QRVClientError error;
+    auto client = QRVClient::connect(daemon.root(), &error);
+    if (!client) return std::string("connect-failed");
+    std::string codes;
+    for (const QRVPlist& r : requests) {
+      auto reply = client->sendRequest(r, std::chrono::seconds(10), &error);
+      codes += (codes.empty() ? "" : " ") + (reply ? std::to_string(QRVClient::resultCode(*reply)) : "x");
+    }
+    return codes;
+  });
+  return out.value_or("child-failed");
+}
+
+// A raw connection for frames the client library would never send.
+class RawSocket {
+ public:
+  explicit RawSocket(const std::string& path) {
+    fd_ = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    sockaddr_un addr{};
+    addr.sun_family = AF_UNIX;
+    strncpy(addr.sun_path, path.c_str(), sizeof addr.sun_path - 1);
+    connected_ = connect(fd_, reinterpret_cast<sockaddr*>(&addr), sizeof addr) == 0;
+  }
+  ~RawSocket() { close(fd_); }
+  bool connected() const { return connected_; }
+  int fd() const { return fd_; }
+  bool sendBytes(const std::vector<uint8_t>& bytes) {
+    return ::send(fd_, bytes.data(), bytes.size(), MSG_NOSIGNAL) == static_cast<ssize_t>(bytes.size());
+  }
+  // True when the daemon closes the connection within the timeout (replies
+  // it sent first are read and dropped).
+  bool closedByPeer(int timeoutMs = 5000) {
+    for (;;) {
+      pollfd p{fd_, POLLIN, 0};
+      if (poll(&p, 1, timeoutMs) <= 0) return false;
+      char buf[4096];
+      ssize_t n = recv(fd_, buf, sizeof buf, 0);
+      if (n <= 0) return true;
+    }
+  }
+
+ private:
+  int fd_ = -1;
+  bool connected_ = false;
+};
+
+std::vector<uint8_t> frame(uint32_t length, uint32_t flags, uint64_t id, const std::vector<uint8_t>& body) {
+  std::vector<uint8_t> bytes(QRVWireFrame::kHeaderSize);
+  QRVWireFrame::encodeHeader({length, flags, id}, bytes.data());
+  bytes.insert(bytes.end(), body.begin(), body.end());
+  return bytes;
+}
+
+class DispatchIntegrationTest : public testing::Test {
+ protected:
+  void SetUp() override {
+    if (geteuid() != 0) GTEST_SKIP() << "needs root: clients run under other uids";
+    daemon_.trustUID(kAllowedUID, "com.example.allowed",
+                     QRVPlist::dictionary().set("com.kelva.private.Quorva.allowed", QRVPlist::boolean(true)));
+    daemon_.trustUID(kPlainUID, "com.example.plain", QRVPlist::dictionary());
+    daemon_.trustUID(kTesterUID, "com.example.tester",
+                     QRVPlist::dictionary().set("com.kelva.private.Quorva.testability", QRVPlist::boolean(true)));
+    startup_ = daemon_.start({"--write-stall-timeout", "1000"});
+    ASSERT_TRUE(daemon_.isRunning());
+  }
+
+  QRVDaemonProcess daemon_;
+  std::chrono::milliseconds startup_{0};
+};
+
+TEST_F(DispatchIntegrationTest, CommandsAreGatedByTheCallersEntitlements) {
+  RecordProperty("startup_ms", static_cast<int>(startup_.count()));
+  QRVPlist retry = request(25).set("NumRetryCrashes", QRVPlist::uinteger(0));
+  // Unknown numbers and the retired command are invalid for everybody.
+  EXPECT_EQ(resultsAs(daemon_, kAllowedUID, {request(32), request(27), retry}), "49 49 55");
+  EXPECT_EQ(resultsAs(daemon_, kPlainUID, {request(27), request(32), retry}), "49 49 55");
+  EXPECT_EQ(resultsAs(daemon_, kStrangerUID, {retry}), "55");
+  EXPECT_EQ(resultsAs(daemon_, kTesterUID, {retry}), "1");
+  EXPECT_TRUE(daemon_.logEventuallyContains("command=25, client=com.example.plain, error=55"));
+  EXPECT_TRUE(daemon_.logEventuallyContains("connection attempt from pid"));
+}
+
+TEST_F(DispatchIntegrationTest, AbsentCommandIsCommandZero) {
+  // Command 0 is open to callers without entitlements, so it is not refused;
+  // its operation is not served yet, which answers "invalid command".
+  EXPECT_EQ(resultsAs(daemon_, kPlainUID, {QRVPlist::dictionary()}), "49");
+  EXPECT_TRUE(daemon_.logEventuallyContains("command=0, client=com.example.plain, error=49"));
+}
+
+TEST_F(DispatchIntegrationTest, PipelinedRequestsAreAnsweredInOrder) {
+  auto out = QRVRunAs(kPlainUID, kPlainUID, [&] {
+    QRVClientError error;
+    auto client = QRVClient::connect(daemon_.root(), &error);
+    if (!client) return std::string("connect-failed");
+    std::vector<uint64_t> ids;
+    for (int i = 0; i < 200; i++) {
+      auto id = client->send(request(i % 2 ? 25 : 32), std::chrono::seconds(10), &error);
+      if (!id) return "send failed: " + error.message;
+      ids.push_back(*id);
+    }
+    for (int i = 0; i < 200; i++) {
+      auto reply = client->receive(std::chrono::seconds(10), &error);
+      if (!reply) return "receive failed: " + error.message;
+      uint64_t expected = i % 2 ? 55 : 49;
+      if (reply->messageId != ids[i] || QRVClient::resultCode(reply->body) != expected)
+        return "reply " + std::to_string(i) + " out of order";
+    }
+    return std::string("ok");
+  });
+  EXPECT_EQ(out.value_or("child failed"), "ok");
+}
+
+TEST_F(DispatchIntegrationTest, BadFramesCloseOnlyTheirOwnConnection) {
+  // A well-behaved client connected before the bad ones and used after them.
+  QRVClientError error;
+  auto good = QRVClient::connect(daemon_.root(), &error);
+  ASSERT_TRUE(good) << error.message;
+
+  std::vector<uint8_t> dict = request(32).toBinary();
+  std::vector<uint8_t> array = QRVPlist::array({QRVPlist::uinteger(1)}).toBinary();
+  const std::vector<std::pair<std::string, std::vector<uint8_t>>> bad = {
+      {"oversized", frame(QRVWireFrame::kMaxBodySize + 1, 1, 1, {})},
+      {"not a dictionary", frame(static_cast<uint32_t>(array.size()), 1, 1, array)},
+      {"garbage body", frame(8, 1, 1, {1, 2, 3, 4, 5, 6, 7, 8})},
+      {"no reply context", frame(static_cast<uint32_t>(dict.size()), 0, 1, dict)},
+  };
+  for (const auto& [what, bytes] : bad) {
+    RawSocket s(daemon_.socketPath());
+    ASSERT_TRUE(s.connected());
+    ASSERT_TRUE(s.sendBytes(bytes)) << what;
+    EXPECT_TRUE(s.closedByPeer()) << what;
+  }
+  {
+    // Truncated: half a frame, then the client goes away.
+    RawSocket s(daemon_.socketPath());
+    ASSERT_TRUE(s.sendBytes(frame(100, 1, 1, {1, 2, 3})));
+    shutdown(s.fd(), SHUT_WR);
+    EXPECT_TRUE(s.closedByPeer());
+  }
+  {
+    // A client that disconnects right after asking.
+    RawSocket s(daemon_.socketPath());
+    ASSERT_TRUE(s.sendBytes(frame(static_cast<uint32_t>(dict.size()), 1, 1, dict)));
+  }
+  auto reply = good->sendRequest(request(32), std::chrono::seconds(5), &error);
+  ASSERT_TRUE(reply) << error.message;
+  EXPECT_EQ(QRVClient::resultCode(*reply), 49u);
+  EXPECT_TRUE(daemon_.isRunning());
+  EXPECT_TRUE(daemon_.logEventuallyContains("exceeds the limit"));
+  EXPECT_TRUE(daemon_.logEventuallyContains("Dictionary does not have reply context"));
+}
+
+TEST_F(DispatchIntegrationTest, ClientThatNeverReadsIsCutOffWithoutSlowingOthers) {
+  RawSocket slow(daemon_.socketPath());
+  ASSERT_TRUE(slow.connected());
+  int flags = fcntl(slow.fd(), F_GETFL);
+  fcntl(slow.fd(), F_SETFL, flags | O_NONBLOCK);
+  std::vector<uint8_t> dict = request(32).toBinary();
+  std::vector<uint8_t> one = frame(static_cast<uint32_t>(dict.size()), 1, 1, dict);
+  // Ask until the daemon stops taking requests (for 300 ms): its replies are
+  // not being read, so it has stopped reading.
+  size_t sent = 0;
+  auto lastAccepted = std::chrono::steady_clock::now();
+  for (int round = 0; round < 500; round++) {
+    while (::send(slow.fd(), one.data(), one.size(), MSG_NOSIGNAL) > 0) {
+      sent++;
+      lastAccepted = std::chrono::steady_clock::now();
+    }
+    if (std::chrono::steady_clock::now() - lastAccepted > std::chrono::milliseconds(300)) break;
+    usleep(10'000);
+  }
+  EXPECT_GT(sent, 0u);
+  // Everybody else is still served at once.
+  EXPECT_EQ(resultsAs(daemon_, kPlainUID, {request(27)}), "49");
+  // After the stall timeout the slow client is closed.
+  fcntl(slow.fd(), F_SETFL, flags);
+  EXPECT_TRUE(daemon_.logEventuallyContains("client is not reading its replies", std::chrono::seconds(10)));
+  EXPECT_TRUE(slow.closedByPeer(10'000));
+  EXPECT_TRUE(daemon_.isRunning());
+}
+
+TEST_F(DispatchIntegrationTest, RetryTestCrashesTheDaemonAsOftenAsAsked) {
+  QRVPlist retry = request(25).set("NumRetryCrashes", QRVPlist::uinteger(1));
+  // The first attempt takes the daemon down without a reply...
+  EXPECT_EQ(resultsAs(daemon_, kTesterUID, {retry}), "x");
+  auto status = daemon_.waitForExit(std::chrono::seconds(10));
+  ASSERT_TRUE(status.has_value());
+  EXPECT_TRUE(WIFSIGNALED(*status) || WEXITSTATUS(*status) != 0);
+  // ...and the retry after the restart succeeds.
+  daemon_.start({"--write-stall-timeout", "1000"});
+  EXPECT_EQ(resultsAs(daemon_, kTesterUID, {retry}), "1");
+}
+
+TEST_F(DispatchIntegrationTest, SecondStartInTheSameBootSkipsTheBootWork) {
+  const std::string rebootDone = daemon_.root() + "/run/quorva/notify/com.kelva.quorvad.reboot-cleanup-complete";
+  const std::string cleanupDone = daemon_.root() + "/run/quorva/notify/com.kelva.quorvad.cleanup-complete";
+  ASSERT_TRUE(daemon_.logEventuallyContains("quorvad first boot cleanup complete"));
+  EXPECT_TRUE(std::filesystem::exists(rebootDone));
+  daemon_.stop();
+  std::filesystem::remove(rebootDone);
+  std::filesystem::remove(cleanupDone);
+  size_t before = daemon_.readLog().size();
+
+  daemon_.start();
+  ASSERT_TRUE(daemon_.logEventuallyContains("boot cleanup does nothing yet"));
+  for (int i = 0; i < 200 && !std::filesystem::exists(cleanupDone); i++) usleep(10'000);
+  EXPECT_TRUE(std::filesystem::exists(cleanupDone));
+  std::string second = daemon_.readLog().substr(before);
+  EXPECT_EQ(second.find("performing first boot initialization"), std::string::npos);
+  EXPECT_EQ(second.find("reboot set-up"), std::string::npos);
+  EXPECT_FALSE(std::filesystem::exists(rebootDone));
+}
+
+}  // namespace
