@@ -3,8 +3,17 @@
 #include "QRVLog.h"
 
 QRVGlobalConfiguration::QRVGlobalConfiguration(std::string root, std::shared_ptr<QRVSystemInfo> systemInfo,
+                                               std::shared_ptr<QRVAccounts> accounts,
                                                std::shared_ptr<QRVFileManager> fileManager)
-    : root_(std::move(root)), systemInfo_(std::move(systemInfo)), fileManager_(std::move(fileManager)) {}
+    : root_(std::move(root)), systemInfo_(std::move(systemInfo)), fileManager_(std::move(fileManager)) {
+  if (std::optional<QRVAccount> mobile = accounts->accountForName("mobile")) {
+    mobileUID_ = mobile->uid;
+    mobileGID_ = mobile->gid;
+    QRVLogDebug("Current mobile user ID is {}, group ID is {}", mobileUID_, mobileGID_);
+  } else {
+    QRVLogError("Failed to get mobile uid. This is bad");
+  }
+}
 
 std::string QRVGlobalConfiguration::pathUnderRoot(const std::string& path) const {
   std::string r = root_;

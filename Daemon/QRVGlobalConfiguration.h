@@ -10,13 +10,15 @@
 #include <mutex>
 #include <string>
 
+#include "QRVAccounts.h"
 #include "QRVFileManager.h"
 #include "QRVSystemInfo.h"
 
 class QRVGlobalConfiguration {
  public:
+  // Looks up the account "mobile"; without it both ids stay 0.
   QRVGlobalConfiguration(std::string root, std::shared_ptr<QRVSystemInfo> systemInfo,
-                         std::shared_ptr<QRVFileManager> fileManager);
+                         std::shared_ptr<QRVAccounts> accounts, std::shared_ptr<QRVFileManager> fileManager);
 
   const std::string& root() const { return root_; }
   // `path` (absolute, as on a device) under the root.
@@ -27,6 +29,9 @@ class QRVGlobalConfiguration {
   // HOME + "Library/Logs/Quorva", mode 0755.
   std::string logDirectory();
 
+  uid_t currentMobileUserId() const { return mobileUID_; }
+  gid_t currentMobileGroupId() const { return mobileGID_; }
+
   bool isInternalImage();
   // Overrides what the build variant says (tests).
   void setIsInternalImage(bool internal);
@@ -35,6 +40,8 @@ class QRVGlobalConfiguration {
   const std::string root_;
   const std::shared_ptr<QRVSystemInfo> systemInfo_;
   const std::shared_ptr<QRVFileManager> fileManager_;
+  uid_t mobileUID_ = 0;
+  gid_t mobileGID_ = 0;
   std::mutex mutex_;
   int internalOverride_ = -1;  // GUARDED_BY(mutex_): -1 none, else 0/1
 };

@@ -1,11 +1,28 @@
 #include "QRVServices.h"
 
+std::string QRVServices::homeDirectoryForUID(uid_t uid) const {
+  std::optional<QRVAccount> account = platform.accounts->accountForUID(uid);
+  return globalConfiguration->pathUnderRoot(account && !account->home.empty() ? account->home : "/private/var/mobile");
+}
+
 std::shared_ptr<QRVServices> QRVServices::make(const std::string& root, QRVPlatform platform) {
   auto s = std::make_shared<QRVServices>();
   s->platform = std::move(platform);
   s->fileManager = std::make_shared<QRVFileManager>();
-  s->globalConfiguration = std::make_shared<QRVGlobalConfiguration>(root, s->platform.systemInfo, s->fileManager);
+  s->globalConfiguration =
+      std::make_shared<QRVGlobalConfiguration>(root, s->platform.systemInfo, s->platform.accounts, s->fileManager);
   s->backgroundQueue = QRVSerialQueue::create("com.kelva.quorvad.background", nullptr,
                                               QRVSerialQueue::Priority::kBackground);
+
+  QRVUserIdentityCache::Options cacheOptions;
+  cacheOptions.mobileUID = s->globalConfiguration->currentMobileUserId();
+  cacheOptions.mobileGID = s->globalConfiguration->currentMobileGroupId();
+  // The services outlive the cache they own; a raw pointer avoids a cycle.
+  QRVServices* self = s.get();
+  cacheOptions.homeDirectoryForUID = [self](uid_t uid) { return self->homeDirectoryForUID(uid); };
+  cacheOptions.pathUnderRoot = [self](const std::string& path) {
+    return self->globalConfiguration->pathUnderRoot(path);
+  };
+  s->userIdentityCache = std::make_shared<QRVUserIdentityCache>(s->platform.personas, std::move(cacheOptions));
   return s;
 }

@@ -8,13 +8,19 @@
 #include "QRVGlobalConfiguration.h"
 #include "QRVPlatform.h"
 #include "QRVSerialQueue.h"
+#include "QRVUserIdentityCache.h"
 
 struct QRVServices {
   QRVPlatform platform;
   std::shared_ptr<QRVFileManager> fileManager;
   std::shared_ptr<QRVGlobalConfiguration> globalConfiguration;
+  std::shared_ptr<QRVUserIdentityCache> userIdentityCache;
   // Shared by every client connection for its asynchronous work.
   std::shared_ptr<QRVSerialQueue> backgroundQueue;
+
+  // The home directory of a uid as a path on this machine: the account's
+  // home under the root, "/private/var/mobile" under the root without one.
+  std::string homeDirectoryForUID(uid_t uid) const;
 
   // The services of a daemon on `root` over `platform`.
   static std::shared_ptr<QRVServices> make(const std::string& root, QRVPlatform platform);

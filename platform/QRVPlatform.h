@@ -12,6 +12,7 @@
 #include "QRVLockStateService.h"
 #include "QRVMessageService.h"
 #include "QRVNotificationService.h"
+#include "QRVPersonaService.h"
 #include "QRVSandbox.h"
 #include "QRVSystemInfo.h"
 #include "QRVTrustStore.h"
@@ -22,6 +23,7 @@ struct QRVPlatform {
   std::shared_ptr<QRVSandbox> sandbox;
   std::shared_ptr<QRVLockStateService> lockState;
   std::shared_ptr<QRVNotificationService> notifications;
+  std::shared_ptr<QRVPersonaService> personas;
   std::shared_ptr<QRVFirstBootMarker> firstBootMarker;
   std::shared_ptr<QRVSystemInfo> systemInfo;
   std::shared_ptr<QRVAccounts> accounts;

@@ -12,6 +12,7 @@
 #include "QRVFirstBootMarker.h"
 #include "QRVLockStateService.h"
 #include "QRVNotificationService.h"
+#include "QRVPersonaService.h"
 #include "QRVSandbox.h"
 #include "QRVSystemInfo.h"
 #include "QRVTrustStore.h"
@@ -145,5 +146,31 @@ class QRVFakeFeatureFlags : public QRVFeatureFlags {
   std::map<std::string, bool> flags;  // "domain/feature"
   bool isEnabled(const std::string& domain, const std::string& feature) override {
     return flags[domain + "/" + feature];
+  }
+};
+
+class QRVFakePersonaService : public QRVPersonaService {
+ public:
+  bool supported = false;
+  std::vector<QRVPersona> list;
+  uint64_t flags = 0;
+  int fetches = 0;
+  std::function<void()> onChange;
+  bool personasSupported() override { return supported; }
+  std::vector<QRVPersona> personas() override {
+    fetches++;
+    return list;
+  }
+  std::optional<QRVPersona> personaForID(uint32_t id) override {
+    for (const auto& p : list)
+      if (p.personaID == id) return p;
+    return std::nullopt;
+  }
+  void observe(std::function<void()> handler) override { onChange = std::move(handler); }
+  uint64_t multiUserFlags() override { return flags; }
+  // Replaces the list and notifies, as the device would.
+  void change(std::vector<QRVPersona> personas) {
+    list = std::move(personas);
+    if (onChange) onChange();
   }
 };

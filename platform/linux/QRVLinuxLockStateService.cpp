@@ -1,27 +1,8 @@
 #include "linux/QRVLinuxLockStateService.h"
 
-#include <poll.h>
-#include <sys/eventfd.h>
-#include <sys/inotify.h>
-#include <unistd.h>
-
-#include <cerrno>
-#include <cstring>
-#include <filesystem>
 #include <fstream>
 
 QRVLinuxLockStateService::QRVLinuxLockStateService(std::string path) : path_(std::move(path)) {}
-
-QRVLinuxLockStateService::~QRVLinuxLockStateService() {
-  if (watcher_.joinable()) {
-    uint64_t one = 1;
-    ssize_t ignored = write(stopFd_, &one, sizeof one);
-    (void)ignored;
-    watcher_.join();
-  }
-  if (inotifyFd_ >= 0) close(inotifyFd_);
-  if (stopFd_ >= 0) close(stopFd_);
-}
 
 int QRVLinuxLockStateService::currentLockState() {
   std::ifstream in(path_);
@@ -31,32 +12,5 @@ int QRVLinuxLockStateService::currentLockState() {
 }
 
 int QRVLinuxLockStateService::observe(std::function<void()> onChange) {
-  if (watcher_.joinable()) return EBUSY;
-  // Watch the directory, not the file: writers replace the file by rename.
-  std::filesystem::path dir = std::filesystem::path(path_).parent_path();
-  std::error_code ec;
-  std::filesystem::create_directories(dir, ec);
-  inotifyFd_ = inotify_init1(IN_CLOEXEC);
-  stopFd_ = eventfd(0, EFD_CLOEXEC);
-  if (inotifyFd_ < 0 || stopFd_ < 0) return errno;
-  if (inotify_add_watch(inotifyFd_, dir.c_str(), IN_CLOSE_WRITE | IN_MOVED_TO | IN_DELETE) < 0) return errno;
-  std::string leaf = std::filesystem::path(path_).filename();
-  watcher_ = std::thread([this, leaf, onChange = std::move(onChange)] {
-    alignas(inotify_event) char buf[4096];
-    for (;;) {
-      pollfd fds[2] = {{inotifyFd_, POLLIN, 0}, {stopFd_, POLLIN, 0}};
-      if (poll(fds, 2, -1) < 0 && errno != EINTR) return;
-      if (fds[1].revents) return;
-      if (!(fds[0].revents & POLLIN)) continue;
-      ssize_t n = read(inotifyFd_, buf, sizeof buf);
-      bool ours = false;
-      for (char* p = buf; n > 0 && p < buf + n;) {
-        auto* ev = reinterpret_cast<inotify_event*>(p);
-        if (ev->len && leaf == ev->name) ours = true;
-        p += sizeof(inotify_event) + ev->len;
-      }
-      if (ours) onChange();
-    }
-  });
-  return 0;
+  return watcher_.start(path_, std::move(onChange));
 }

@@ -2,23 +2,19 @@
 // watched with inotify. A missing or unreadable file reads as unlocked.
 #pragma once
 
-#include <atomic>
 #include <string>
-#include <thread>
 
 #include "QRVLockStateService.h"
+#include "linux/QRVFileWatcher.h"
 
 class QRVLinuxLockStateService : public QRVLockStateService {
  public:
   explicit QRVLinuxLockStateService(std::string path);
-  ~QRVLinuxLockStateService() override;
 
   int currentLockState() override;
   int observe(std::function<void()> onChange) override;
 
  private:
   const std::string path_;
-  int inotifyFd_ = -1;
-  int stopFd_ = -1;
-  std::thread watcher_;
+  QRVFileWatcher watcher_;
 };

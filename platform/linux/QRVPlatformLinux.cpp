@@ -5,6 +5,7 @@
 #include "linux/QRVLinuxLockStateService.h"
 #include "linux/QRVLinuxMessageService.h"
 #include "linux/QRVLinuxNotificationService.h"
+#include "linux/QRVLinuxPersonaService.h"
 #include "linux/QRVLinuxSandbox.h"
 #include "linux/QRVLinuxSystemInfo.h"
 #include "linux/QRVLinuxTrustStore.h"
@@ -23,6 +24,8 @@ QRVPlatform QRVPlatform::makeLinux(const std::string& root, const LinuxOptions& 
   p.sandbox = std::make_shared<QRVLinuxSandbox>();
   p.lockState = std::make_shared<QRVLinuxLockStateService>(under("/run/quorva/lockstate"));
   p.notifications = std::make_shared<QRVLinuxNotificationService>(under("/run/quorva/notify"));
+  p.personas = std::make_shared<QRVLinuxPersonaService>(under("/etc/quorva/personas.plist"),
+                                                        under("/etc/quorva/host.plist"));
   p.firstBootMarker = std::make_shared<QRVLinuxFirstBootMarker>(r);
   p.systemInfo = std::make_shared<QRVLinuxSystemInfo>(under("/etc/os-release"));
   p.accounts = std::make_shared<QRVLinuxAccounts>(under("/etc/passwd"), under("/etc/group"));

@@ -50,6 +50,7 @@ struct QRVTestServices {
   std::shared_ptr<QRVFakeSystemInfo> systemInfo = std::make_shared<QRVFakeSystemInfo>();
   std::shared_ptr<QRVFakeAccounts> accounts = std::make_shared<QRVFakeAccounts>();
   std::shared_ptr<QRVFakeFeatureFlags> featureFlags = std::make_shared<QRVFakeFeatureFlags>();
+  std::shared_ptr<QRVFakePersonaService> personas = std::make_shared<QRVFakePersonaService>();
   std::shared_ptr<QRVServices> services;
 
   QRVTestServices() {
@@ -63,6 +64,11 @@ struct QRVTestServices {
     p.systemInfo = systemInfo;
     p.accounts = accounts;
     p.featureFlags = featureFlags;
+    p.personas = personas;
+    accounts->accounts = {{"root", 0, 0, "/private/var/root"},
+                          {"installer", 33, 33, "/private/var/installer"},
+                          {"mobile", 501, 501, "/private/var/mobile"}};
+    accounts->groups = {{"systemusers", 95}};
     services = QRVServices::make(root.path(), std::move(p));
   }
 };
