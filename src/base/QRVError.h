@@ -22,6 +22,8 @@ class QRVError {
  public:
   static constexpr const char* kDomain = "QRVErrorDomain";
   static constexpr const char* kPOSIXDomain = "POSIXErrorDomain";
+  // Failures of general facilities (a file that is not the expected format).
+  static constexpr const char* kGeneralDomain = "GeneralErrorDomain";
 
   // Codes shared by many components. Each component documents its own.
   static constexpr uint64_t kSuccess = 1;

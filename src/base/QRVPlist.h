@@ -80,10 +80,13 @@ class QRVPlist {
   bool operator==(const QRVPlist& other) const = default;
 
   // Serialisation. The readers return nothing for bytes that are not a
-  // well-formed property list. The binary reader also refuses documents
-  // nested deeper than `kMaxDepth` or expanding to more than `kMaxNodes`
-  // values (a shared sub-object counts at every place it is referenced), so
-  // hostile input can exhaust neither the stack nor memory.
+  // well-formed property list, and refuse documents nested deeper than
+  // `kMaxDepth`. The binary reader also refuses documents expanding to more
+  // than `kMaxNodes` values (a shared sub-object counts at every place it is
+  // referenced), so hostile input can exhaust neither the stack nor memory.
+  // A property list has no null: a none value is written as an empty
+  // dictionary. Strings are written up to their first NUL character (data
+  // keeps every byte). XML keeps dates to the whole second only.
   static constexpr int kMaxDepth = 128;
   static constexpr uint64_t kMaxNodes = 4'000'000;
   Bytes toBinary() const;

@@ -7,24 +7,38 @@
 #include <cstdio>
 #include <cstdlib>
 #include <exception>
+#include <system_error>
 #include <thread>
 
 namespace {
 
 // Threads are started on demand, so a job that blocks never starves the
-// others, and leave after a while without work.
+// others, and leave after a while without work. There is deliberately no cap
+// on the number of threads: a pool that stops growing is a fixed pool once
+// enough jobs block, and can deadlock like one. The count stays bounded all
+// the same, because a queue has at most one drain submitted at a time, so no
+// more threads are started than there are queues with work at once.
 class ThreadPool {
  public:
-  ThreadPool(int nice, size_t maxThreads) : nice_(nice), maxThreads_(maxThreads) {}
+  explicit ThreadPool(int nice) : nice_(nice) {}
 
   void submit(std::function<void()> job) {
     std::unique_lock<std::mutex> lock(mutex_);
     jobs_.push_back(std::move(job));
     if (idle_ >= jobs_.size()) {
       cv_.notify_one();
-    } else if (threads_ < maxThreads_) {
-      threads_++;
+      return;
+    }
+    try {
       std::thread([this] { work(); }).detach();
+      threads_++;
+    } catch (const std::system_error&) {
+      // Out of threads: the job waits for a running thread to come free.
+      // With none at all it would never run.
+      if (threads_ == 0) {
+        fprintf(stderr, "quorvad: cannot start a worker thread\n");
+        abort();
+      }
     }
   }
 
@@ -49,7 +63,6 @@ class ThreadPool {
   }
 
   const int nice_;
-  const size_t maxThreads_;
   std::mutex mutex_;
   std::condition_variable cv_;
   std::deque<std::function<void()>> jobs_;
@@ -60,8 +73,8 @@ class ThreadPool {
 // Never destroyed: detached workers may still be waiting when the process
 // exits.
 ThreadPool& pool(QRVSerialQueue::Priority priority) {
-  static ThreadPool* def = new ThreadPool(0, 256);
-  static ThreadPool* background = new ThreadPool(10, 64);
+  static ThreadPool* def = new ThreadPool(0);
+  static ThreadPool* background = new ThreadPool(10);
   return priority == QRVSerialQueue::Priority::kBackground ? *background : *def;
 }
 
@@ -113,7 +126,7 @@ void QRVSerialQueue::scheduleDrainLocked() {
 
 void QRVSerialQueue::drain() {
   CurrentQueueScope scope(this);
-  for (;;) {
+  for (bool ranOne = false;; ranOne = true) {
     Job job;
     {
       std::lock_guard<std::mutex> lock(mutex_);
@@ -121,11 +134,26 @@ void QRVSerialQueue::drain() {
         draining_ = false;
         return;
       }
+      // This drain is one job of the target. After each of our jobs it
+      // steps aside when the target has been suspended or has other jobs
+      // waiting, so that they go first, and carries on behind them.
+      if (ranOne && targetWantsTurn()) {
+        scheduleDrainLocked();
+        return;
+      }
       job = std::move(jobs_.front());
       jobs_.pop_front();
     }
     run(job);
   }
+}
+
+bool QRVSerialQueue::targetWantsTurn() const {
+  for (const QRVSerialQueue* q = target_.get(); q; q = q->target_.get()) {
+    std::lock_guard<std::mutex> lock(q->mutex_);
+    if (q->suspendCount_ > 0 || !q->jobs_.empty()) return true;
+  }
+  return false;
 }
 
 void QRVSerialQueue::run(const Job& job) {

@@ -61,6 +61,9 @@ class QRVSerialQueue : public std::enable_shared_from_this<QRVSerialQueue> {
   QRVSerialQueue(std::string label, std::shared_ptr<QRVSerialQueue> target, Priority priority);
   void scheduleDrainLocked();
   void drain();
+  // REQUIRES: mutex_ held (targets are locked after the queues aiming at
+  // them, never before).
+  bool targetWantsTurn() const;
   static void run(const Job& job);
 
   const std::string label_;
