@@ -19,7 +19,8 @@ QRVClientConnection::QRVClientConnection(std::shared_ptr<const QRVClientIdentity
 
 std::shared_ptr<QRVClientConnection> QRVClientConnection::makeSharedClientConnection(
     std::shared_ptr<QRVServices> services) {
-  return std::make_shared<QRVClientConnection>(QRVClientIdentity::anonymousPrivilegedClientIdentity(), true, false,
+  auto identity = QRVClientIdentity::anonymousPrivilegedClientIdentity(*services->userIdentityCache);
+  return std::make_shared<QRVClientConnection>(std::move(identity), true, false,
                                                true, std::nullopt, std::nullopt,
                                                std::make_shared<QRVCommandQueue>(), std::move(services));
 }

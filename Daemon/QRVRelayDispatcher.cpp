@@ -4,6 +4,7 @@
 #include <exception>
 
 #include "QRVClientConnection.h"
+#include "QRVCurrentPersona.h"
 #include "QRVExceptionReporter.h"
 #include "QRVLog.h"
 
@@ -63,6 +64,8 @@ void QRVRelayDispatcher::QRVProcessRelayEvent(const std::shared_ptr<QRVConnectio
     entry = &table_[command];
   }
 
+  // While this request is handled, the thread acts in the peer's persona.
+  QRVCurrentPersona::Scope persona(connection->personaID());
   auto commandQueue = std::make_shared<QRVCommandQueue>();
   std::shared_ptr<const QRVClientIdentity> identity =
       QRVClientIdentity::clientIdentityWithRelayConnection(*connection, *services_);

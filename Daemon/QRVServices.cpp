@@ -1,14 +1,10 @@
 #include "QRVServices.h"
 
-std::string QRVServices::homeDirectoryForUID(uid_t uid) const {
-  std::optional<QRVAccount> account = platform.accounts->accountForUID(uid);
-  return globalConfiguration->pathUnderRoot(account && !account->home.empty() ? account->home : "/private/var/mobile");
-}
-
 std::shared_ptr<QRVServices> QRVServices::make(const std::string& root, QRVPlatform platform) {
   auto s = std::make_shared<QRVServices>();
   s->platform = std::move(platform);
-  s->fileManager = std::make_shared<QRVFileManager>();
+  s->fileManager = std::make_shared<QRVFileManager>(root, s->platform.fileSystem, s->platform.accounts,
+                                                   s->platform.featureFlags);
   s->globalConfiguration =
       std::make_shared<QRVGlobalConfiguration>(root, s->platform.systemInfo, s->platform.accounts, s->fileManager);
   s->backgroundQueue = QRVSerialQueue::create("com.kelva.quorvad.background", nullptr,
@@ -19,7 +15,7 @@ std::shared_ptr<QRVServices> QRVServices::make(const std::string& root, QRVPlatf
   cacheOptions.mobileGID = s->globalConfiguration->currentMobileGroupId();
   // The services outlive the cache they own; a raw pointer avoids a cycle.
   QRVServices* self = s.get();
-  cacheOptions.homeDirectoryForUID = [self](uid_t uid) { return self->homeDirectoryForUID(uid); };
+  cacheOptions.homeDirectoryForUID = [self](uid_t uid) { return self->fileManager->homeDirectoryURLForPOSIXUID(uid); };
   cacheOptions.pathUnderRoot = [self](const std::string& path) {
     return self->globalConfiguration->pathUnderRoot(path);
   };

@@ -18,10 +18,6 @@ struct QRVServices {
   // Shared by every client connection for its asynchronous work.
   std::shared_ptr<QRVSerialQueue> backgroundQueue;
 
-  // The home directory of a uid as a path on this machine: the account's
-  // home under the root, "/private/var/mobile" under the root without one.
-  std::string homeDirectoryForUID(uid_t uid) const;
-
   // The services of a daemon on `root` over `platform`.
   static std::shared_ptr<QRVServices> make(const std::string& root, QRVPlatform platform);
 };

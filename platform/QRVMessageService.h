@@ -13,6 +13,7 @@
 #include <cstdint>
 #include <functional>
 #include <memory>
+#include <optional>
 #include <string>
 
 #include "QRVAuditToken.h"
@@ -72,6 +73,8 @@ class QRVConnection : public std::enable_shared_from_this<QRVConnection> {
   virtual uid_t euid() const = 0;
   virtual gid_t egid() const = 0;
   virtual const QRVAuditToken& auditToken() const = 0;
+  // The persona the peer runs in, if any.
+  virtual std::optional<uint32_t> personaID() const = 0;
 
   // Installs the handler; must precede `resume`.
   virtual void setEventHandler(EventHandler handler) = 0;

@@ -8,6 +8,7 @@
 
 #include "QRVAccounts.h"
 #include "QRVFeatureFlags.h"
+#include "QRVFileSystemExtras.h"
 #include "QRVFirstBootMarker.h"
 #include "QRVLockStateService.h"
 #include "QRVMessageService.h"
@@ -28,6 +29,7 @@ struct QRVPlatform {
   std::shared_ptr<QRVSystemInfo> systemInfo;
   std::shared_ptr<QRVAccounts> accounts;
   std::shared_ptr<QRVFeatureFlags> featureFlags;
+  std::shared_ptr<QRVFileSystemExtras> fileSystem;
 
   struct LinuxOptions {
     // How long a client may leave its replies unread before it is cut off.

@@ -35,9 +35,9 @@ int64_t nowMillis() {
 
 class QRVLinuxMessageService::Connection : public QRVConnection {
  public:
-  Connection(QRVLinuxMessageService* service, uint64_t id, int fd, const ucred& cred,
-             QRVAuditToken token, int pidfd)
-      : service_(service), id_(id), fd_(fd), pidfd_(pidfd), cred_(cred), token_(token) {}
+  Connection(QRVLinuxMessageService* service, uint64_t id, int fd, const ucred& cred, QRVAuditToken token,
+             int pidfd, std::optional<uint32_t> persona)
+      : service_(service), id_(id), fd_(fd), pidfd_(pidfd), cred_(cred), token_(token), persona_(persona) {}
 
   ~Connection() override {
     if (fd_ >= 0) ::close(fd_);
@@ -48,6 +48,7 @@ class QRVLinuxMessageService::Connection : public QRVConnection {
   uid_t euid() const override { return cred_.uid; }
   gid_t egid() const override { return cred_.gid; }
   const QRVAuditToken& auditToken() const override { return token_; }
+  std::optional<uint32_t> personaID() const override { return persona_; }
 
   void setEventHandler(EventHandler handler) override {
     std::lock_guard<std::mutex> lock(mutex_);
@@ -263,6 +264,7 @@ class QRVLinuxMessageService::Connection : public QRVConnection {
   int pidfd_;
   const ucred cred_;
   const QRVAuditToken token_;
+  const std::optional<uint32_t> persona_;
 
   std::mutex mutex_;
   EventHandler handler_;           // GUARDED_BY(mutex_)
@@ -415,11 +417,12 @@ void QRVLinuxMessageService::acceptPending() {
       if (poll(&p, 1, 0) == 1) start.reset();
     }
     QRVAuditToken token = QRVAuditToken::make(cred.uid, cred.gid, cred.pid, start.value_or(0));
+    std::optional<uint32_t> persona = QRVProcInfo::personaFromCgroup(cred.pid);
     std::shared_ptr<Connection> connection;
     {
       std::lock_guard<std::mutex> lock(mutex_);
       uint64_t id = nextConnectionId_++;
-      connection = std::make_shared<Connection>(this, id, fd, cred, token, pidfd);
+      connection = std::make_shared<Connection>(this, id, fd, cred, token, pidfd, persona);
       connections_[id] = connection;
     }
     if (onConnection_) onConnection_(connection);

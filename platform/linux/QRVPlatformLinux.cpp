@@ -1,6 +1,7 @@
 #include "QRVPlatform.h"
 #include "linux/QRVLinuxAccounts.h"
 #include "linux/QRVLinuxFeatureFlags.h"
+#include "linux/QRVLinuxFileSystemExtras.h"
 #include "linux/QRVLinuxFirstBootMarker.h"
 #include "linux/QRVLinuxLockStateService.h"
 #include "linux/QRVLinuxMessageService.h"
@@ -30,5 +31,6 @@ QRVPlatform QRVPlatform::makeLinux(const std::string& root, const LinuxOptions& 
   p.systemInfo = std::make_shared<QRVLinuxSystemInfo>(under("/etc/os-release"));
   p.accounts = std::make_shared<QRVLinuxAccounts>(under("/etc/passwd"), under("/etc/group"));
   p.featureFlags = std::make_shared<QRVLinuxFeatureFlags>(under("/etc/quorva/features.plist"));
+  p.fileSystem = std::make_shared<QRVLinuxFileSystemExtras>(p.lockState);
   return p;
 }

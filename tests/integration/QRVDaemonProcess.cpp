@@ -39,7 +39,11 @@ void QRVDaemonProcess::trustUID(uid_t uid, const std::string& signingIdentifier,
                        .set("SigningIdentifier", QRVPlist::string(signingIdentifier))
                        .set("UID", QRVPlist::uinteger(uid))
                        .set("Entitlements", entitlements);
-  std::ofstream(root_ + "/etc/quorva/clients.d/uid-" + std::to_string(uid) + ".plist") << entry.toXML();
+  trustEntry("uid-" + std::to_string(uid), entry);
+}
+
+void QRVDaemonProcess::trustEntry(const std::string& name, const QRVPlist& entry) {
+  std::ofstream(root_ + "/etc/quorva/clients.d/" + name + ".plist") << entry.toXML();
 }
 
 namespace {

@@ -29,6 +29,8 @@ class QRVDaemonProcess {
 
   // A trust-store entry matching processes of `uid`.
   void trustUID(uid_t uid, const std::string& signingIdentifier, const QRVPlist& entitlements);
+  // A trust-store entry as given, stored as `name`.plist.
+  void trustEntry(const std::string& name, const QRVPlist& entry);
 
   // Starts the daemon with `extraArguments` and waits until it answers on its
   // socket. Returns the time that took.

@@ -17,6 +17,7 @@ class QRVTestConnection : public QRVConnection {
   uid_t euid() const override { return uid_; }
   gid_t egid() const override { return gid_; }
   const QRVAuditToken& auditToken() const override { return token_; }
+  std::optional<uint32_t> personaID() const override { return persona; }
   void setEventHandler(EventHandler) override {}
   void resume() override {}
   void cancel() override { cancelled = true; }
@@ -35,6 +36,7 @@ class QRVTestConnection : public QRVConnection {
     return e;
   }
 
+  std::optional<uint32_t> persona;
   bool cancelled = false;
   std::vector<std::pair<uint64_t, QRVPlist>> replies;
 

@@ -7,8 +7,12 @@
 #include <memory>
 #include <string>
 
+#include <unistd.h>
+
 #include "QRVServices.h"
+#include "fake/QRVFakeFileSystemExtras.h"
 #include "fake/QRVFakePlatform.h"
+#include "linux/QRVLinuxFileSystemExtras.h"
 
 class QRVTemporaryDirectory {
  public:
@@ -51,6 +55,10 @@ struct QRVTestServices {
   std::shared_ptr<QRVFakeAccounts> accounts = std::make_shared<QRVFakeAccounts>();
   std::shared_ptr<QRVFakeFeatureFlags> featureFlags = std::make_shared<QRVFakeFeatureFlags>();
   std::shared_ptr<QRVFakePersonaService> personas = std::make_shared<QRVFakePersonaService>();
+  // The real file system under the fake lock state; classes are kept in memory
+  // when the tests cannot write trusted extended attributes (not root).
+  std::shared_ptr<QRVFakeFileSystemExtras> fileSystem = std::make_shared<QRVFakeFileSystemExtras>(
+      std::make_shared<QRVLinuxFileSystemExtras>(lockState), lockState);
   std::shared_ptr<QRVServices> services;
 
   QRVTestServices() {
@@ -65,6 +73,8 @@ struct QRVTestServices {
     p.accounts = accounts;
     p.featureFlags = featureFlags;
     p.personas = personas;
+    p.fileSystem = fileSystem;
+    fileSystem->setInMemoryProtectionClasses(geteuid() != 0);
     accounts->accounts = {{"root", 0, 0, "/private/var/root"},
                           {"installer", 33, 33, "/private/var/installer"},
                           {"mobile", 501, 501, "/private/var/mobile"}};
