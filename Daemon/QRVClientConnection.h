@@ -47,6 +47,23 @@ class QRVClientConnection {
   // through `result`.
   bool completeWithError(uint64_t* result);
 
+  // ---- Death row ----
+  // Removed containers are first renamed into a unique directory under the
+  // death-row directory (atomic on one volume), then deleted in the
+  // background. Both steps survive a crash: whatever is on death row stays
+  // there until the next emptying.
+
+  // Moves `url` into a fresh directory on death row under its own name. A
+  // missing item is success. Fails with 41. With `startDeletionThread` the
+  // emptying of death row is started.
+  bool _moveItemAtURLToDeathRow(const std::string& url, bool isDir, bool startDeletionThread, QRVError* error);
+  // Empties death row on the death-row queue, inside a keep-alive
+  // transaction, then calls `completion` (may be empty) there.
+  void deleteContainersOnDeathRowWithCompletion(std::function<void()> completion);
+  // Removes `url` recursively; what cannot be removed is moved to "/tmp"
+  // (under the root) instead, failing with 4 when even that fails.
+  bool _removeItemOrMoveToTempAtURL(const std::string& url, QRVError* error);
+
   // Test support for clients' retry logic: makes the daemon crash
   // `numCrashes` times in a row on this request (the count survives the
   // crashes in a file under the daemon's home), then succeed and forget the

@@ -40,9 +40,9 @@ void QRVDaemon::quorvad_init() {
   QRVLog::open("com.kelva.quorvad", logPath, options_.logLevel, internal ? 4 : 1, internal ? 262'144 : 102'400);
   QRVLogDebug("quorvad built at {} {} started", __DATE__, __TIME__);
 
-  deathRowQueue_ = QRVSerialQueue::create("com.kelva.quorvad.deathrow", nullptr, QRVSerialQueue::Priority::kBackground);
-  lockStateQueue_ = QRVSerialQueue::create("com.kelva.quorvad.lockstate");
-  if (!deathRowQueue_ || !lockStateQueue_) QRVTerminate("Can't create dispatch queues.");
+  // The death-row and lock-state queues belong to the services, which every
+  // connection reaches; they exist from the services' creation.
+  if (!services_->deathRowQueue || !services_->lockStateQueue) QRVTerminate("Can't create dispatch queues.");
 
   sharedConnection_ = QRVClientConnection::makeSharedClientConnection(services_);
 
@@ -73,10 +73,10 @@ void QRVDaemon::lockStateCallback() {
   QRVLogDebug("LockState={}", state);
   std::lock_guard<std::mutex> lock(lockStateMutex_);
   if (state == 1 && lockStateFlag_ != 1) {
-    lockStateQueue_->suspend();
+    services_->lockStateQueue->suspend();
     lockStateFlag_ = 1;
   } else if (state == 0 && lockStateFlag_ == 1) {
-    lockStateQueue_->resume();
+    services_->lockStateQueue->resume();
     lockStateFlag_ = 0;
   }
 }
@@ -93,13 +93,4 @@ void QRVDaemon::set_first_boot_work_completed() {
 void QRVDaemon::cleanupComplete() {
   uint32_t status = services_->platform.notifications->post(kCleanupCompleteNotification);
   if (status != 0) QRVLogError("Failed to post cleanup-complete: {}", status);
-}
-
-void QRVDaemon::asyncWithKeepAlive(const std::shared_ptr<QRVSerialQueue>& queue, std::function<void()> job) {
-  QRVMessageService& messages = *services_->platform.messages;
-  messages.beginTransaction();
-  queue->async([&messages, job = std::move(job)] {
-    job();
-    messages.endTransaction();
-  });
 }

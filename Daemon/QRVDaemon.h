@@ -40,13 +40,9 @@ class QRVDaemon {
   void set_first_boot_work_completed();
   void cleanupComplete();
 
-  // Runs `job` on `queue` inside a keep-alive transaction, so the daemon is
-  // not considered idle until it has finished.
-  void asyncWithKeepAlive(const std::shared_ptr<QRVSerialQueue>& queue, std::function<void()> job);
-
   const std::shared_ptr<QRVSerialQueue>& listenerQueue() const { return listenerQueue_; }
-  const std::shared_ptr<QRVSerialQueue>& lockStateQueue() const { return lockStateQueue_; }
-  const std::shared_ptr<QRVSerialQueue>& deathRowQueue() const { return deathRowQueue_; }
+  const std::shared_ptr<QRVSerialQueue>& lockStateQueue() const { return services_->lockStateQueue; }
+  const std::shared_ptr<QRVSerialQueue>& deathRowQueue() const { return services_->deathRowQueue; }
   const std::shared_ptr<QRVClientConnection>& sharedClientConnection() const { return sharedConnection_; }
   QRVRelayDispatcher& dispatcher() { return dispatcher_; }
   bool isFirstBoot() const { return firstBoot_; }
@@ -59,8 +55,6 @@ class QRVDaemon {
 
   std::shared_ptr<QRVSerialQueue> listenerQueue_;
   std::shared_ptr<QRVSerialQueue> mainQueue_;
-  std::shared_ptr<QRVSerialQueue> deathRowQueue_;
-  std::shared_ptr<QRVSerialQueue> lockStateQueue_;
   std::shared_ptr<QRVClientConnection> sharedConnection_;
   bool firstBoot_ = false;
 

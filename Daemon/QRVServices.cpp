@@ -9,6 +9,10 @@ std::shared_ptr<QRVServices> QRVServices::make(const std::string& root, QRVPlatf
       std::make_shared<QRVGlobalConfiguration>(root, s->platform.systemInfo, s->platform.accounts, s->fileManager);
   s->backgroundQueue = QRVSerialQueue::create("com.kelva.quorvad.background", nullptr,
                                               QRVSerialQueue::Priority::kBackground);
+  s->deathRowQueue = QRVSerialQueue::create("com.kelva.quorvad.deathrow", nullptr,
+                                            QRVSerialQueue::Priority::kBackground);
+  s->lockStateQueue = QRVSerialQueue::create("com.kelva.quorvad.lockstate");
+  s->testLocks = std::make_shared<QRVTestLocks>();
 
   QRVUserIdentityCache::Options cacheOptions;
   cacheOptions.mobileUID = s->globalConfiguration->currentMobileUserId();
@@ -21,4 +25,13 @@ std::shared_ptr<QRVServices> QRVServices::make(const std::string& root, QRVPlatf
   };
   s->userIdentityCache = std::make_shared<QRVUserIdentityCache>(s->platform.personas, std::move(cacheOptions));
   return s;
+}
+
+void QRVServices::asyncWithKeepAlive(const std::shared_ptr<QRVSerialQueue>& queue, std::function<void()> job) {
+  std::shared_ptr<QRVMessageService> messages = platform.messages;
+  messages->beginTransaction();
+  queue->async([messages, job = std::move(job)] {
+    job();
+    messages->endTransaction();
+  });
 }

@@ -2,12 +2,14 @@
 // connection. Tests build their own, on a temporary root and with fakes.
 #pragma once
 
+#include <functional>
 #include <memory>
 
 #include "QRVFileManager.h"
 #include "QRVGlobalConfiguration.h"
 #include "QRVPlatform.h"
 #include "QRVSerialQueue.h"
+#include "QRVTestLocks.h"
 #include "QRVUserIdentityCache.h"
 
 struct QRVServices {
@@ -17,6 +19,16 @@ struct QRVServices {
   std::shared_ptr<QRVUserIdentityCache> userIdentityCache;
   // Shared by every client connection for its asynchronous work.
   std::shared_ptr<QRVSerialQueue> backgroundQueue;
+  // Empties death row, at background priority.
+  std::shared_ptr<QRVSerialQueue> deathRowQueue;
+  // Carries data-protection work; suspended while the device is locked.
+  std::shared_ptr<QRVSerialQueue> lockStateQueue;
+  // Held and blocking points driven by the testability command.
+  std::shared_ptr<QRVTestLocks> testLocks;
+
+  // Runs `job` on `queue` inside a keep-alive transaction, so the daemon is
+  // not considered idle until it has finished.
+  void asyncWithKeepAlive(const std::shared_ptr<QRVSerialQueue>& queue, std::function<void()> job);
 
   // The services of a daemon on `root` over `platform`.
   static std::shared_ptr<QRVServices> make(const std::string& root, QRVPlatform platform);

@@ -79,6 +79,8 @@ struct QRVTestServices {
                           {"installer", 33, 33, "/private/var/installer"},
                           {"mobile", 501, 501, "/private/var/mobile"}};
     accounts->groups = {{"systemusers", 95}};
+    // The homes the accounts name, as a prepared root has them.
+    std::filesystem::create_directories(root.path() + "/private/var/mobile");
     services = QRVServices::make(root.path(), std::move(p));
   }
 };

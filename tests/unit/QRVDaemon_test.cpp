@@ -120,7 +120,7 @@ TEST_F(DaemonTest, FailedLockStateRegistrationStillAppliesTheCurrentState) {
 TEST_F(DaemonTest, KeepAliveCoversAsynchronousJobs) {
   auto daemon = startDaemon();
   std::atomic<bool> release{false};
-  daemon->asyncWithKeepAlive(daemon->deathRowQueue(), [&] {
+  env_.services->asyncWithKeepAlive(daemon->deathRowQueue(), [&] {
     while (!release) std::this_thread::sleep_for(std::chrono::milliseconds(1));
   });
   EXPECT_FALSE(env_.messages->isIdle());
