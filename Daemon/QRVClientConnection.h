@@ -8,11 +8,17 @@
 #pragma once
 
 #include <functional>
+#include <map>
+#include <mutex>
+#include <set>
+#include <vector>
 #include <memory>
 #include <optional>
 
 #include "QRVClientIdentity.h"
 #include "QRVCommandQueue.h"
+#include "QRVContainerIdentity.h"
+#include "QRVMetadata.h"
 #include "QRVPlist.h"
 #include "QRVServices.h"
 
@@ -46,6 +52,39 @@ class QRVClientConnection {
   // Drains the command queue; the first failing command's code is stored
   // through `result`.
   bool completeWithError(uint64_t* result);
+
+  // ---- Create and look up ----
+
+  // The metadata of the container named by `containerIdentity`, creating
+  // it (in staging, then moved live in one rename) when `createIfNecessary`.
+  // A transient request always yields a fresh, empty container. With
+  // `useLocking` the global read lock guards a look-up and the global write
+  // lock a creation; without it the caller holds what is needed. Codes: 5,
+  // 6, 7, 8, 9, 21 (not found, not logged), 38, 40, 45, 55, and those of the
+  // components that pass through.
+  QRVMetadataRef createOrLookupContainerWithContainerIdentity(const QRVContainerIdentityRef& containerIdentity,
+                                                              bool createIfNecessary, bool transient,
+                                                              bool useLocking, QRVError* error);
+  // Looks up without creating. For a concrete identity the container must
+  // also have that UUID.
+  QRVMetadataRef metadataWithContainerIdentity(const QRVContainerIdentityRef& containerIdentity, QRVError* error);
+  // Every live (or transient) container of a class for the caller's user
+  // identity.
+  std::optional<std::vector<QRVMetadataRef>> containersWithClass(QRVContainerClass containerClass, bool transient,
+                                                                 QRVError* error);
+  // Creates the container's default subdirectories again (and, for system
+  // containers, restores their ACLs).
+  bool recreateDefaultStructureWithContainerIdentity(const QRVContainerIdentityRef& containerIdentity,
+                                                     QRVError* error);
+
+  // Whether the caller's lookup entitlement lists `identifier` for the class.
+  bool isEntitledForLookupWithClass(QRVContainerClass containerClass, const std::string& identifier);
+  // The identifiers the lookup entitlement grants for a class (memoised).
+  const std::set<std::string>* _lookupForContainerClass(QRVContainerClass containerClass);
+  bool _createTopLevelContainerDirectory(const std::string& url, QRVContainerClass containerClass, uid_t owner,
+                                         QRVError* error);
+  bool _createSubDirectories(const std::string& url, const QRVMetadata& metadata, QRVError* error);
+  uint32_t _dataProtectionClassForContainerMetadata(const QRVMetadata& metadata);
 
   // ---- Death row ----
   // Removed containers are first renamed into a unique directory under the
@@ -86,4 +125,7 @@ class QRVClientConnection {
   const std::optional<QRVPlist::Array> entitledWipeIdentifiers_;
   const std::shared_ptr<QRVCommandQueue> commandQueue_;
   const std::shared_ptr<QRVServices> services_;
+
+  std::mutex lookupMemoMutex_;
+  std::map<std::string, std::set<std::string>> lookupMemo_;  // GUARDED_BY(lookupMemoMutex_)
 };

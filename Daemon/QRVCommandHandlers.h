@@ -6,3 +6,5 @@
 
 void QRVHandleRetryTest(const QRVPlist& request, const std::shared_ptr<QRVReply>& reply,
                         QRVClientConnection& connection, uint64_t* result);
+void QRVHandleSetTestLock(const QRVPlist& request, const std::shared_ptr<QRVReply>& reply,
+                          QRVClientConnection& connection, uint64_t* result);

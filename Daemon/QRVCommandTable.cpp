@@ -1,6 +1,7 @@
 #include "QRVCommandTable.h"
 
 #include "QRVCommandHandlers.h"
+#include "QRVContainerHandlers.h"
 
 namespace {
 
@@ -8,41 +9,41 @@ constexpr bool R = true, A = true, L = true, _ = false;
 
 // clang-format off
 const QRVCommandTable kTable = {{
-    // command, handler, entitlement,                      replies, allowed w/o, lookup
-    { 0, nullptr, kEntitlementAllowed,                     R, A, L},  // createOrLookupContainer
-    { 1, nullptr, kEntitlementAllowed,                     R, _, L},  // containersWithClass
-    { 2, nullptr, kEntitlementAllowed,                     R, _, _},  // replaceContainer
-    { 3, nullptr, kEntitlementAllowed,                     R, _, _},  // stageContainerForDelete
+    // command, handler, entitlement, repliesOnReturn, allowedWithoutEntitlement, honoursLookup
+    { 0, QRVHandleCreateOrLookupContainer,  kEntitlementAllowed,                R, A, L},  // createOrLookupContainer
+    { 1, QRVHandleContainersWithClass,      kEntitlementAllowed,                R, _, L},  // containersWithClass
+    { 2, nullptr,                           kEntitlementAllowed,                R, _, _},  // replaceContainer
+    { 3, nullptr,                           kEntitlementAllowed,                R, _, _},  // stageContainerForDelete
     // Emptying death row is granted by the user-managed-assets right: the
     // clients that manage assets are the ones that need space back at once.
-    { 4, nullptr, kEntitlementUserManagedAssets,           _, _, _},  // deleteContainersOnDeathRow
-    { 5, nullptr, kEntitlementAllowed,                     R, _, _},  // setInfoValue
-    { 6, nullptr, kEntitlementAllowed,                     R, _, _},  // infoValueForKey
-    { 7, nullptr, kEntitlementAllowed,                     R, _, _},  // containerMetadata
-    { 8, nullptr, kEntitlementAllowed,                     R, _, _},  // recreateDefaultStructure
-    { 9, nullptr, kEntitlementAllowed,                     R, _, _},  // regenerateDirectoryUUID
-    {10, nullptr, kEntitlementAllowed,                     R, _, _},  // deleteContainer
-    {11, nullptr, kEntitlementWipeContainer,               R, _, _},  // wipeContainerContent
-    {12, nullptr, kEntitlementDeleteContainerContent,      R, _, _},  // deleteContainerContent
-    {13, nullptr, kEntitlementAllowed,                     R, A, L},  // createOrLookupGroupContainers
-    {14, nullptr, kEntitlementAllowed,                     R, _, L},  // groupContainerIdentifiersForOwner
-    {15, nullptr, kEntitlementAllowed,                     R, A, L},  // lookupSystemContainer
-    {16, nullptr, kEntitlementAllowed,                     R, A, L},  // groupContainersForOwner
-    {17, nullptr, kEntitlementAllowed,                     R, A, L},  // systemGroupContainerPath
-    {18, nullptr, kEntitlementAllowed,                     R, _, _},  // processCodeSigningInfo
-    {19, nullptr, kEntitlementAllowed,                     R, _, _},  // codeSigningInfoForIdentifier
-    {20, nullptr, kEntitlementAllowed,                     R, _, _},  // invalidateCodeSigningInfoForAppsWithoutBundleContainer
-    {21, nullptr, kEntitlementAllowed,                     _, _, _},  // setDataProtection
-    {22, nullptr, kEntitlementAllowed,                     R, _, _},  // recreateDefaultStructureAgain
-    {23, nullptr, kEntitlementAllowed,                     R, _, L},  // diskUsage
-    {24, nullptr, kEntitlementDataMigration,               R, _, _},  // performDataMigration
-    {25, QRVHandleRetryTest, kEntitlementTestability,               R, _, _},  // retryTest
-    {26, nullptr, kEntitlementStageSharedContent,          R, _, _},  // stageSharedContent
-    {27, nullptr, kEntitlementAllowed,                     R, _, _},  // retiredCommand: always invalid
-    {28, nullptr, kEntitlementUserManagedAssets,           R, A, _},  // userManagedAssetsPath
-    {29, nullptr, kEntitlementUserManagedAssets,           R, _, _},  // deleteUserManagedAsset
-    {30, nullptr, kEntitlementAllowed,                     R, _, _},  // performPerUserDataMigration
-    {31, nullptr, kEntitlementTestability,                 R, _, _},  // setTestLock
+    { 4, nullptr,                           kEntitlementUserManagedAssets,      _, _, _},  // deleteContainersOnDeathRow
+    { 5, nullptr,                           kEntitlementAllowed,                R, _, _},  // setInfoValue
+    { 6, nullptr,                           kEntitlementAllowed,                R, _, _},  // infoValueForKey
+    { 7, QRVHandleContainerMetadata,        kEntitlementAllowed,                R, _, _},  // containerMetadata
+    { 8, QRVHandleRecreateDefaultStructure, kEntitlementAllowed,                R, _, _},  // recreateDefaultStructure
+    { 9, nullptr,                           kEntitlementAllowed,                R, _, _},  // regenerateDirectoryUUID
+    {10, nullptr,                           kEntitlementAllowed,                R, _, _},  // deleteContainer
+    {11, nullptr,                           kEntitlementWipeContainer,          R, _, _},  // wipeContainerContent
+    {12, nullptr,                           kEntitlementDeleteContainerContent, R, _, _},  // deleteContainerContent
+    {13, nullptr,                           kEntitlementAllowed,                R, A, L},  // createOrLookupGroupContainers
+    {14, nullptr,                           kEntitlementAllowed,                R, _, L},  // groupContainerIdentifiersForOwner
+    {15, nullptr,                           kEntitlementAllowed,                R, A, L},  // lookupSystemContainer
+    {16, nullptr,                           kEntitlementAllowed,                R, A, L},  // groupContainersForOwner
+    {17, nullptr,                           kEntitlementAllowed,                R, A, L},  // systemGroupContainerPath
+    {18, nullptr,                           kEntitlementAllowed,                R, _, _},  // processCodeSigningInfo
+    {19, nullptr,                           kEntitlementAllowed,                R, _, _},  // codeSigningInfoForIdentifier
+    {20, nullptr,                           kEntitlementAllowed,                R, _, _},  // invalidateCodeSigningInfoForAppsWithoutBundleContainer
+    {21, nullptr,                           kEntitlementAllowed,                _, _, _},  // setDataProtection
+    {22, QRVHandleRecreateDefaultStructure, kEntitlementAllowed,                R, _, _},  // recreateDefaultStructureAgain
+    {23, nullptr,                           kEntitlementAllowed,                R, _, L},  // diskUsage
+    {24, nullptr,                           kEntitlementDataMigration,          R, _, _},  // performDataMigration
+    {25, QRVHandleRetryTest,                kEntitlementTestability,            R, _, _},  // retryTest
+    {26, nullptr,                           kEntitlementStageSharedContent,     R, _, _},  // stageSharedContent
+    {27, nullptr,                           kEntitlementAllowed,                R, _, _},  // retiredCommand: always invalid
+    {28, nullptr,                           kEntitlementUserManagedAssets,      R, A, _},  // userManagedAssetsPath
+    {29, nullptr,                           kEntitlementUserManagedAssets,      R, _, _},  // deleteUserManagedAsset
+    {30, nullptr,                           kEntitlementAllowed,                R, _, _},  // performPerUserDataMigration
+    {31, QRVHandleSetTestLock,              kEntitlementTestability,            R, _, _},  // setTestLock
 }};
 // clang-format on
 

@@ -26,16 +26,30 @@ std::string demangle(const char* name) {
 
 }  // namespace
 
-std::string QRVUncaughtExceptionText(std::exception_ptr exception, const char* threadName) {
-  std::string name, reason;
+namespace {
+
+void describe(std::exception_ptr exception, std::string* name, std::string* reason) {
   try {
     std::rethrow_exception(exception);
   } catch (const std::exception& e) {
-    name = demangle(typeid(e).name());
-    reason = e.what();
+    *name = demangle(typeid(e).name());
+    *reason = e.what();
   } catch (...) {
-    if (std::type_info* t = abi::__cxa_current_exception_type()) name = demangle(t->name());
+    if (std::type_info* t = abi::__cxa_current_exception_type()) *name = demangle(t->name());
   }
+}
+
+}  // namespace
+
+std::string QRVExceptionDescription(std::exception_ptr exception) {
+  std::string name, reason;
+  describe(exception, &name, &reason);
+  return name.empty() ? reason : name + ": " + reason;
+}
+
+std::string QRVUncaughtExceptionText(std::exception_ptr exception, const char* threadName) {
+  std::string name, reason;
+  describe(exception, &name, &reason);
   std::string text = "** INTERNAL ERROR: Uncaught Exception **\nException: ";
   if (threadName && *threadName) text += std::string("<") + threadName + "> ";
   if (!name.empty()) text += name + ": ";

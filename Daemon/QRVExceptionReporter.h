@@ -12,6 +12,9 @@
 // "** INTERNAL ERROR: Uncaught Exception **\nException: <thread> name: reason\nStack:\n..."
 std::string QRVUncaughtExceptionText(std::exception_ptr exception, const char* threadName);
 
+// "name: reason" of an exception, for log lines and error messages.
+std::string QRVExceptionDescription(std::exception_ptr exception);
+
 // The message recorded by the last report (in a core dump: the symbol
 // gQRVCrashMessage).
 extern "C" const char* gQRVCrashMessage;

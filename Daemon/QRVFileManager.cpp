@@ -941,6 +941,63 @@ bool QRVFileManager::writeFileAtomically(const std::string& path, const std::vec
   return true;
 }
 
+bool QRVFileManager::readRegularFileAtURL(const std::string& path, size_t maxLength, std::vector<uint8_t>* contents,
+                                          QRVError* error) {
+  int directory = open(parentDirectory(path).c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
+  if (directory < 0)
+    return QRVFail(error, QRV_POSIX_ERROR_QUIET(errno, "Failed to open the directory of {}: {}", path, strerror(errno)));
+  int fd = openItem(directory, lastPathComponent(path).c_str());
+  int e = fd < 0 ? errno : 0;
+  close(directory);
+  if (fd < 0) return QRVFail(error, QRV_POSIX_ERROR_QUIET(e, "Failed to open {}: {}", path, strerror(e)));
+  struct stat st;
+  if (fstat(fd, &st) != 0) e = errno;
+  else if (!S_ISREG(st.st_mode)) e = EINVAL;
+  else if (static_cast<uint64_t>(st.st_size) > maxLength) e = EFBIG;
+  if (e) {
+    close(fd);
+    return QRVFail(error, QRV_POSIX_ERROR_QUIET(e, "Refusing to read {}: {}", path, strerror(e)));
+  }
+  contents->clear();
+  contents->reserve(static_cast<size_t>(st.st_size));
+  uint8_t buf[16384];
+  for (;;) {
+    ssize_t n = read(fd, buf, sizeof buf);
+    if (n < 0 && errno == EINTR) continue;
+    if (n < 0) {
+      e = errno;
+      close(fd);
+      return QRVFail(error, QRV_POSIX_ERROR(e, "Failed to read {}: {}", path, strerror(e)));
+    }
+    if (n == 0) break;
+    // The file may grow while it is read.
+    if (contents->size() + static_cast<size_t>(n) > maxLength) {
+      close(fd);
+      contents->clear();
+      return QRVFail(error, QRV_POSIX_ERROR_QUIET(EFBIG, "Refusing to read {}: {}", path, strerror(EFBIG)));
+    }
+    contents->insert(contents->end(), buf, buf + n);
+  }
+  close(fd);
+  return true;
+}
+
+bool QRVFileManager::writeFileAtURL(const std::string& path, const std::vector<uint8_t>& contents, mode_t mode,
+                                    QRVError* error) {
+  if (unlink(path.c_str()) != 0 && errno != ENOENT)
+    return QRVFail(error, QRV_POSIX_ERROR(errno, "Failed to remove {}: {}", path, strerror(errno)));
+  int fd = open(path.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, mode);
+  if (fd < 0) return QRVFail(error, QRV_POSIX_ERROR(errno, "Failed to create {}: {}", path, strerror(errno)));
+  bool written = writeAll(fd, contents) && fchmod(fd, mode) == 0 && fsync(fd) == 0;
+  int e = written ? 0 : errno;
+  if (close(fd) != 0 && !e) e = errno;
+  if (e) {
+    unlink(path.c_str());
+    return QRVFail(error, QRV_POSIX_ERROR(e, "Failed to write {}: {}", path, strerror(e)));
+  }
+  return true;
+}
+
 bool QRVFileManager::removeFileAtURL(const std::string& path, QRVError* error) {
   if (unlink(path.c_str()) == 0 || errno == ENOENT) return true;
   return QRVFail(error, QRV_POSIX_ERROR(errno, "Failed to remove {}: {}", path, strerror(errno)));

@@ -220,6 +220,18 @@ class QRVFileManager {
   bool writeFileAtomically(const std::string& path, const std::vector<uint8_t>& contents, mode_t mode, QRVError* error);
   // Removes a file; a missing file is success.
   bool removeFileAtURL(const std::string& path, QRVError* error);
+  // Reads a file that someone else may have planted, without trusting it:
+  // neither the file nor the directory holding it may be a symbolic link
+  // (ELOOP), anything but a regular file is refused without blocking on it
+  // (a fifo or a device: EINVAL), and a file larger than `maxLength` bytes
+  // fails with EFBIG instead of filling memory. Refusals are not logged.
+  bool readRegularFileAtURL(const std::string& path, size_t maxLength, std::vector<uint8_t>* contents,
+                            QRVError* error);
+  // Writes `contents` as a new file at `path` with `mode` and flushes it to
+  // disk. Whatever was at `path` is removed first, so a link or hard link
+  // planted there is never written through. Not atomic: for a temporary file
+  // that is renamed into place afterwards.
+  bool writeFileAtURL(const std::string& path, const std::vector<uint8_t>& contents, mode_t mode, QRVError* error);
 
  private:
   bool _moveItemAtURL(const std::string& url, const std::string& toURL, bool failIfSrcMissing, QRVError* error);

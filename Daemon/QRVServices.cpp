@@ -24,6 +24,14 @@ std::shared_ptr<QRVServices> QRVServices::make(const std::string& root, QRVPlatf
     return self->globalConfiguration->pathUnderRoot(path);
   };
   s->userIdentityCache = std::make_shared<QRVUserIdentityCache>(s->platform.personas, std::move(cacheOptions));
+  // The code-signing mapping, the data-protection manager and the well-known
+  // table are not connected yet: the seams that know nothing stand in.
+  s->codeSigning = std::make_shared<QRVNoCodeSigningQueries>();
+  s->dataProtection = std::make_shared<QRVNoDataProtectionQueries>();
+  s->wellKnownNames = std::make_shared<QRVNoWellKnownNames>();
+  s->pluginParents = std::make_shared<QRVNoPluginParentResolver>();
+  s->containerCache = std::make_shared<QRVContainerCache>(s->fileManager, s->globalConfiguration, s->userIdentityCache,
+                                                          s->platform.sandbox, s->pluginParents, s->wellKnownNames);
   return s;
 }
 

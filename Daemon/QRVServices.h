@@ -5,6 +5,9 @@
 #include <functional>
 #include <memory>
 
+#include "QRVContainerCache.h"
+#include "QRVContainerCacheSeams.h"
+#include "QRVContainerOperationSeams.h"
 #include "QRVFileManager.h"
 #include "QRVGlobalConfiguration.h"
 #include "QRVPlatform.h"
@@ -17,6 +20,8 @@ struct QRVServices {
   std::shared_ptr<QRVFileManager> fileManager;
   std::shared_ptr<QRVGlobalConfiguration> globalConfiguration;
   std::shared_ptr<QRVUserIdentityCache> userIdentityCache;
+  // The index of the containers on disk.
+  std::shared_ptr<QRVContainerCache> containerCache;
   // Shared by every client connection for its asynchronous work.
   std::shared_ptr<QRVSerialQueue> backgroundQueue;
   // Empties death row, at background priority.
@@ -25,6 +30,13 @@ struct QRVServices {
   std::shared_ptr<QRVSerialQueue> lockStateQueue;
   // Held and blocking points driven by the testability command.
   std::shared_ptr<QRVTestLocks> testLocks;
+
+  // Components that arrive later, seen through the questions the container
+  // operations ask of them; until then these answer neutrally.
+  std::shared_ptr<QRVCodeSigningQueries> codeSigning;
+  std::shared_ptr<QRVDataProtectionQueries> dataProtection;
+  std::shared_ptr<QRVWellKnownNames> wellKnownNames;
+  std::shared_ptr<QRVPluginParentResolver> pluginParents;
 
   // Runs `job` on `queue` inside a keep-alive transaction, so the daemon is
   // not considered idle until it has finished.

@@ -138,7 +138,17 @@ class QRVFakeSandbox : public QRVSandbox {
                                             const QRVAuditToken&, int*) override {
     return extensionClass + ";" + path;
   }
-  bool registerContainerPath(const std::string&, const std::string&, uint32_t, QRVError*) override { return true; }
+  // Every item pushed, in order; `userStateResult` is what each push answers.
+  std::vector<QRVSandboxUserStateItem> userStateItems;
+  int userStateResult = 0;
+  int setUserStateItem(const QRVSandboxUserStateItem& item) override {
+    std::lock_guard<std::mutex> l(m_);
+    userStateItems.push_back(item);
+    return userStateResult;
+  }
+
+ private:
+  std::mutex m_;
 };
 
 class QRVFakeFeatureFlags : public QRVFeatureFlags {

@@ -22,7 +22,10 @@ QRVPlatform QRVPlatform::makeLinux(const std::string& root, const LinuxOptions& 
   options.writeStallTimeout = linuxOptions.writeStallTimeout;
   p.messages = std::make_shared<QRVLinuxMessageService>(options);
   p.trustStore = std::make_shared<QRVLinuxTrustStore>(under("/etc/quorva/clients.d"));
-  p.sandbox = std::make_shared<QRVLinuxSandbox>();
+  QRVLinuxSandbox::Options sandboxOptions;
+  sandboxOptions.keyPath = under("/run/quorva/extension.key");
+  sandboxOptions.registryPath = under("/run/quorva/sandbox.plist");
+  p.sandbox = std::make_shared<QRVLinuxSandbox>(sandboxOptions);
   p.lockState = std::make_shared<QRVLinuxLockStateService>(under("/run/quorva/lockstate"));
   p.notifications = std::make_shared<QRVLinuxNotificationService>(under("/run/quorva/notify"));
   p.personas = std::make_shared<QRVLinuxPersonaService>(under("/etc/quorva/personas.plist"),

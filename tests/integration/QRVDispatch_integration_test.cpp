@@ -112,10 +112,15 @@ TEST_F(DispatchIntegrationTest, CommandsAreGatedByTheCallersEntitlements) {
 }
 
 TEST_F(DispatchIntegrationTest, AbsentCommandIsCommandZero) {
-  // Command 0 is open to callers without entitlements, so it is not refused;
-  // its operation is not served yet, which answers "invalid command".
-  EXPECT_EQ(resultsAs(daemon_, kPlainUID, {QRVPlist::dictionary()}), "49");
-  EXPECT_TRUE(daemon_.logEventuallyContains("command=0, client=com.example.plain, error=49"));
+  // Without "Command" the request is a create-or-lookup: the caller gets its
+  // own container, and a request without an identifier is refused with 18.
+  QRVPlist create = QRVPlist::dictionary()
+                        .set("Identifier", QRVPlist::string("com.example.plain"))
+                        .set("ContainerClass", QRVPlist::uinteger(2))
+                        .set("CreateIfNecessary", QRVPlist::boolean(true));
+  EXPECT_EQ(resultsAs(daemon_, kPlainUID, {create, QRVPlist::dictionary()}), "1 18");
+  EXPECT_TRUE(daemon_.logEventuallyContains("command=0, client=com.example.plain, error=1"));
+  EXPECT_TRUE(daemon_.logEventuallyContains("command=0, client=com.example.plain, error=18"));
 }
 
 TEST_F(DispatchIntegrationTest, PipelinedRequestsAreAnsweredInOrder) {
