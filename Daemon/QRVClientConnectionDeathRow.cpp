@@ -2,11 +2,10 @@
 #include <cerrno>
 
 #include "QRVClientConnection.h"
+#include "QRVDictionaryAdditions.h"
 #include "QRVLog.h"
 
 namespace {
-
-std::string lastPathComponent(const std::string& path);
 
 // Deletes one item, or parks it in "/tmp" when it cannot be deleted. Shared
 // by the request path and the death-row queue, which outlives requests.
@@ -16,17 +15,10 @@ bool removeItemOrMoveToTemp(QRVServices& services, const std::string& url, QRVEr
   if (fm.removeItemAtURL(url, &underlying)) return true;
   if (underlying.isPOSIX() && underlying.code() == ENOENT) return true;
   QRVLogDebug("Couldn't remove, so moving item to /tmp: {} : {}", url, underlying.description());
-  std::string destination = services.globalConfiguration->pathUnderRoot("/tmp/") + lastPathComponent(url);
+  std::string destination = services.globalConfiguration->pathUnderRoot("/tmp/") + QRVLastPathComponent(url);
   if (!fm.moveItemAtURL(url, destination, &underlying))
     return QRVFail(error, QRV_ERROR_UNDERLYING(4, underlying, "Failed to move dir: {} to: {}", url, destination));
   return true;
-}
-
-std::string lastPathComponent(const std::string& path) {
-  std::string p = path;
-  while (p.size() > 1 && p.back() == '/') p.pop_back();
-  size_t slash = p.rfind('/');
-  return slash == std::string::npos ? p : p.substr(slash + 1);
 }
 
 }  // namespace
@@ -40,7 +32,7 @@ bool QRVClientConnection::_moveItemAtURLToDeathRow(const std::string& url, bool 
   std::optional<std::string> unique = fm.createTemporaryDirectoryInDirectoryURL(deathRow, &underlying);
   if (!unique)
     return QRVFail(error, QRV_ERROR_UNDERLYING(41, underlying, "Failed to create unique directory at: {}", deathRow));
-  std::string destination = *unique + "/" + lastPathComponent(url);
+  std::string destination = *unique + "/" + QRVLastPathComponent(url);
   // Files and directories move alike on Linux; `isDir` only names the kind.
   (void)isDir;
   if (!fm.moveItemAtURL(url, destination, &underlying)) {

@@ -3,6 +3,7 @@
 #include <exception>
 
 #include "QRVContainerCache.h"
+#include "QRVDictionaryAdditions.h"
 #include "QRVExceptionReporter.h"
 #include "QRVLocks.h"
 #include "QRVLog.h"
@@ -39,8 +40,8 @@ bool QRVCommandStageForDelete::stage(const QRVContainerIdentity& identity, QRVCo
   if (!metadata) return true;  // nothing of that name to take away
 
   const std::string& url = metadata->url();
-  std::string name = url.substr(url.find_last_of('/') + 1);
-  std::string destination = services_->globalConfiguration->deathrowDirectory() + "/" + name;
+  std::string destination =
+      QRVPathByAppendingComponent(services_->globalConfiguration->deathrowDirectory(), QRVLastPathComponent(url));
   if (QRVContainerClassIsBundle(identity.containerClass())) {
     uint64_t code = services_->codeSigning->removeCodeSigningDictionariesForIdentifierAndItsChildren(
         identity.identifier(), queue);

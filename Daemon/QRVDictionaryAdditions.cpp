@@ -20,6 +20,18 @@ std::optional<QRVPlist> QRV_dictionaryWithContentsOfURL(QRVFileManager& fileMana
   return plist;
 }
 
+std::string QRVPathByAppendingComponent(const std::string& directory, const std::string& component) {
+  if (directory.empty()) return component;
+  return directory.back() == '/' ? directory + component : directory + "/" + component;
+}
+
+std::string QRVLastPathComponent(const std::string& path) {
+  std::string p = path;
+  while (p.size() > 1 && p.back() == '/') p.pop_back();
+  size_t slash = p.rfind('/');
+  return slash == std::string::npos ? p : p.substr(slash + 1);
+}
+
 bool QRVContainsDotDotPathComponents(std::string_view path) {
   size_t start = 0;
   while (start <= path.size()) {

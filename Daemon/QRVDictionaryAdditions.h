@@ -22,6 +22,11 @@ bool QRV_writeToURL(QRVFileManager& fileManager, const QRVPlist& dictionary, con
 std::optional<QRVPlist> QRV_dictionaryWithContentsOfURL(QRVFileManager& fileManager, const std::string& path,
                                                         QRVError* error);
 
+// `directory` + "/" + `component`, without doubling a trailing slash.
+std::string QRVPathByAppendingComponent(const std::string& directory, const std::string& component);
+// The last component of `path`, ignoring trailing slashes.
+std::string QRVLastPathComponent(const std::string& path);
+
 // True when a component of `path` is exactly "..": such a relative path
 // could climb out of the directory it is meant for.
 bool QRVContainsDotDotPathComponents(std::string_view path);

@@ -1,13 +1,11 @@
 #include "QRVGlobalConfiguration.h"
 
+#include "QRVDictionaryAdditions.h"
 #include "QRVLog.h"
 
 namespace {
 
-std::string join(const std::string& a, const std::string& b) {
-  if (a.empty()) return b;
-  return a.back() == '/' ? a + b : a + "/" + b;
-}
+std::string join(const std::string& a, const std::string& b) { return QRVPathByAppendingComponent(a, b); }
 
 }  // namespace
 
