@@ -38,7 +38,12 @@ void QRVClientConnection::rebootQuorvaSetup() {
 }
 
 void QRVClientConnection::quorvaSetup() {
-  QRVLogNotice("boot set-up does nothing yet: no replace recovery or code-signing reconciliation is built");
+  // An interrupted replace is finished or rolled back before any request can
+  // see the containers involved.
+  QRVError error;
+  if (!_recoverFromReplaceOperationsWithError(&error))
+    QRVLogError("Failed recovering from replace operations: {}", error.description());
+  QRVLogNotice("boot set-up: no code-signing reconciliation is built yet");
 }
 
 void QRVClientConnection::rebootQuorvaCleanupWithCompletion(std::function<void()> completion) {

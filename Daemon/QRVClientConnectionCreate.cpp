@@ -7,6 +7,7 @@
 
 #include "QRVClientConnection.h"
 #include "QRVContainerCache.h"
+#include "QRVCrashPoints.h"
 #include "QRVExceptionReporter.h"
 #include "QRVLocks.h"
 #include "QRVLog.h"
@@ -21,7 +22,6 @@ const char* lookupKeyForContainerClass(QRVContainerClass c) {
   return c < sizeof kKeys / sizeof kKeys[0] ? kKeys[c] : nullptr;
 }
 
-bool isNotFound(const QRVError& e) { return e.domain() == QRVError::kDomain && e.code() == QRVContainerCache::kNotFound; }
 
 // The data-protection class asked for by the installer in the container's
 // info values.
@@ -130,7 +130,7 @@ QRVMetadataRef QRVClientConnection::createOrLookupContainerWithContainerIdentity
       QRVError lookupError;
       QRVMetadataRef found = cache.containerForContainerIdentity(*containerIdentity, false, true, &lookupError);
       if (found) return found->withExisted(true);
-      if (!isNotFound(lookupError)) {
+      if (!QRVContainerCache::isNotFoundError(lookupError)) {
         QRVFail(error, lookupError);
         return nullptr;
       }
@@ -153,7 +153,7 @@ QRVMetadataRef QRVClientConnection::createOrLookupContainerWithContainerIdentity
         QRVFail(error, QRV_ERROR_UNDERLYING(5, moveError, "Failed to remove transient container at {}", found->url()));
         return nullptr;
       }
-    } else if (!isNotFound(lookupError)) {
+    } else if (!QRVContainerCache::isNotFoundError(lookupError)) {
       QRVFail(error, lookupError);
       return nullptr;
     }
@@ -171,6 +171,7 @@ QRVMetadataRef QRVClientConnection::createOrLookupContainerWithContainerIdentity
                                           step.description()));
       return nullptr;
     }
+    QRVCrashPoint(*services_, "create.staged");
     QRVConcreteContainerIdentityRef concrete =
         QRVConcreteContainerIdentity::containerIdentityWithUUID(uuid, userIdentity, identifier, containerClass, &step);
     if (!concrete) {
@@ -184,6 +185,7 @@ QRVMetadataRef QRVClientConnection::createOrLookupContainerWithContainerIdentity
       QRVFail(error, step);
       return nullptr;
     }
+    QRVCrashPoint(*services_, "create.metadata-written");
 
     std::optional<std::string> parent = config.containerDirectoryURLForUserIdentity(userIdentity, containerClass,
                                                                                     transient);
@@ -204,6 +206,7 @@ QRVMetadataRef QRVClientConnection::createOrLookupContainerWithContainerIdentity
       QRVFail(error, moveError);
       return nullptr;
     }
+    QRVCrashPoint(*services_, "create.live");
     // With fast sizing, the size accounting of the new container starts now.
     if (services_->platform.featureFlags->isEnabled("quorvad", "fast_container_sizing")) fm.fastDiskUsageForURL(live);
 

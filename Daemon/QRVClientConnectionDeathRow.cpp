@@ -2,6 +2,7 @@
 #include <cerrno>
 
 #include "QRVClientConnection.h"
+#include "QRVCrashPoints.h"
 #include "QRVDictionaryAdditions.h"
 #include "QRVLog.h"
 
@@ -55,7 +56,10 @@ void QRVClientConnection::deleteContainersOnDeathRowWithCompletion(std::function
     if (!items) {
       QRVLogError("Failed to list death row at {}: {}", deathRow, error.description());
     } else {
-      for (const std::string& item : *items) removeItemOrMoveToTemp(*services, item, nullptr);
+      for (const std::string& item : *items) {
+        removeItemOrMoveToTemp(*services, item, nullptr);
+        QRVCrashPoint(*services, "deathrow.item-removed");
+      }
     }
     if (completion) completion();
   });

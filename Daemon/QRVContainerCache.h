@@ -50,6 +50,11 @@ class QRVContainerCache {
   static constexpr uint64_t kRemoveFailed = 46;
   static constexpr uint64_t kInvalidURL = 47;
 
+  // Whether `error` is the cache's "no such container", an expected outcome.
+  static bool isNotFoundError(const QRVError& error) {
+    return error.domain() == QRVError::kDomain && error.code() == kNotFound;
+  }
+
   // Null seams are replaced by the defaults that know nothing.
   QRVContainerCache(std::shared_ptr<QRVFileManager> fileManager,
                     std::shared_ptr<QRVGlobalConfiguration> globalConfiguration,

@@ -7,6 +7,7 @@
 #pragma once
 
 #include <string>
+#include <vector>
 
 class QRVCommandQueue;
 
@@ -47,4 +48,19 @@ class QRVDataProtectionQueries {
 class QRVNoDataProtectionQueries : public QRVDataProtectionQueries {
  public:
   uint32_t intendedDataProtectionClassBasedOnEntitlementsForIdentifier(const std::string&) override { return 0; }
+};
+
+class QRVSystemGroupQueries {
+ public:
+  virtual ~QRVSystemGroupQueries() = default;
+  // The system group container identifiers the code signing of `identifier`
+  // lets it use.
+  virtual std::vector<std::string> systemGroupIdentifiersForIdentifier(const std::string& identifier) = 0;
+};
+
+// Grants no system group, so staging shared content is refused (55) until
+// the code-signing mapping answers for real.
+class QRVNoSystemGroupQueries : public QRVSystemGroupQueries {
+ public:
+  std::vector<std::string> systemGroupIdentifiersForIdentifier(const std::string&) override { return {}; }
 };

@@ -313,6 +313,25 @@ bool QRVFileManager::itemExistsAtURL(const std::string& url) {
   return false;
 }
 
+bool QRVFileManager::directoryExistsAtURL(const std::string& url) {
+  struct stat st;
+  return lstat(url.c_str(), &st) == 0 && S_ISDIR(st.st_mode);
+}
+
+bool QRVFileManager::setOwnerAndModeOfDirectoryAtURL(const std::string& url, uid_t uid, gid_t gid, mode_t mode,
+                                                     QRVError* error) {
+  int fd = open(url.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
+  if (fd < 0) return QRVFail(error, QRV_POSIX_ERROR(errno, "open of {} failed: {}", url, errnoText(errno)));
+  bool ok = true;
+  if (fchown(fd, uid, gid) != 0) {
+    ok = QRVFail(error, QRV_POSIX_ERROR(errno, "Failed to chown({},{}) {}: {}", uid, gid, url, errnoText(errno)));
+  } else if (fchmod(fd, mode) != 0) {
+    ok = QRVFail(error, QRV_POSIX_ERROR(errno, "Failed to chmod({:o}) {}: {}", mode, url, errnoText(errno)));
+  }
+  close(fd);
+  return ok;
+}
+
 bool QRVFileManager::itemDoesNotExistAtURL(const std::string& url) {
   struct stat st;
   if (lstat(url.c_str(), &st) == 0) return false;

@@ -92,6 +92,12 @@ class QRVFileManager {
   // logged and make both false.
   bool itemExistsAtURL(const std::string& url);
   bool itemDoesNotExistAtURL(const std::string& url);
+  // True when `url` itself (not a link to one) is a directory.
+  bool directoryExistsAtURL(const std::string& url);
+  // Gives the directory `url` to uid:gid with `mode`, through a descriptor
+  // opened without following links, so that a link put in its place in the
+  // meantime is refused (ELOOP/ENOTDIR) instead of followed.
+  bool setOwnerAndModeOfDirectoryAtURL(const std::string& url, uid_t uid, gid_t gid, mode_t mode, QRVError* error);
 
   // ---- Listing and traversal ----
 

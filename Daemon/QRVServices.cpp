@@ -30,6 +30,7 @@ std::shared_ptr<QRVServices> QRVServices::make(const std::string& root, QRVPlatf
   s->dataProtection = std::make_shared<QRVNoDataProtectionQueries>();
   s->wellKnownNames = std::make_shared<QRVNoWellKnownNames>();
   s->pluginParents = std::make_shared<QRVNoPluginParentResolver>();
+  s->systemGroups = std::make_shared<QRVNoSystemGroupQueries>();
   s->containerCache = std::make_shared<QRVContainerCache>(s->fileManager, s->globalConfiguration, s->userIdentityCache,
                                                           s->platform.sandbox, s->pluginParents, s->wellKnownNames);
   return s;

@@ -37,6 +37,8 @@ struct QRVServices {
   std::shared_ptr<QRVDataProtectionQueries> dataProtection;
   std::shared_ptr<QRVWellKnownNames> wellKnownNames;
   std::shared_ptr<QRVPluginParentResolver> pluginParents;
+  // Which system group containers an identifier may stage shared content into.
+  std::shared_ptr<QRVSystemGroupQueries> systemGroups;
 
   // Runs `job` on `queue` inside a keep-alive transaction, so the daemon is
   // not considered idle until it has finished.

@@ -7,6 +7,7 @@
 #include <string>
 
 #include "QRVAccounts.h"
+#include "QRVApplicationTermination.h"
 #include "QRVFeatureFlags.h"
 #include "QRVFileSystemExtras.h"
 #include "QRVFirstBootMarker.h"
@@ -30,10 +31,14 @@ struct QRVPlatform {
   std::shared_ptr<QRVAccounts> accounts;
   std::shared_ptr<QRVFeatureFlags> featureFlags;
   std::shared_ptr<QRVFileSystemExtras> fileSystem;
+  std::shared_ptr<QRVApplicationTermination> applicationTermination;
 
   struct LinuxOptions {
     // How long a client may leave its replies unread before it is cut off.
     std::chrono::milliseconds writeStallTimeout{30'000};
+    // The slice under which applications run, one "app-<identifier>.scope"
+    // each; an absolute path, taken under the daemon's root.
+    std::string applicationSlice = "/sys/fs/cgroup/quorva-apps.slice";
   };
   // The Linux services for a daemon whose paths all lie under `root`.
   static QRVPlatform makeLinux(const std::string& root, const LinuxOptions& options);

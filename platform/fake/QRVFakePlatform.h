@@ -8,6 +8,7 @@
 #include <vector>
 
 #include "QRVAccounts.h"
+#include "QRVApplicationTermination.h"
 #include "QRVFeatureFlags.h"
 #include "QRVFirstBootMarker.h"
 #include "QRVLockStateService.h"
@@ -183,4 +184,29 @@ class QRVFakePersonaService : public QRVPersonaService {
     list = std::move(personas);
     if (onChange) onChange();
   }
+};
+
+// Records which applications were stopped and how many assertions are held.
+class QRVFakeApplicationTermination : public QRVApplicationTermination {
+ public:
+  class Held : public Assertion {
+   public:
+    explicit Held(QRVFakeApplicationTermination& owner) : owner_(owner) { owner_.held++; }
+    ~Held() override { owner_.held--; }
+
+   private:
+    QRVFakeApplicationTermination& owner_;
+  };
+  std::unique_ptr<Assertion> terminate(const std::string& identifier, const std::string& reason,
+                                       QRVError* error) override {
+    if (refuse) {
+      QRVFail(error, QRV_ERROR(1, "refused"));
+      return nullptr;
+    }
+    terminated.push_back(identifier + ":" + reason);
+    return std::make_unique<Held>(*this);
+  }
+  bool refuse = false;
+  int held = 0;
+  std::vector<std::string> terminated;
 };

@@ -1,5 +1,6 @@
 #include "QRVPlatform.h"
 #include "linux/QRVLinuxAccounts.h"
+#include "linux/QRVLinuxApplicationTermination.h"
 #include "linux/QRVLinuxFeatureFlags.h"
 #include "linux/QRVLinuxFileSystemExtras.h"
 #include "linux/QRVLinuxFirstBootMarker.h"
@@ -35,5 +36,6 @@ QRVPlatform QRVPlatform::makeLinux(const std::string& root, const LinuxOptions& 
   p.accounts = std::make_shared<QRVLinuxAccounts>(under("/etc/passwd"), under("/etc/group"));
   p.featureFlags = std::make_shared<QRVLinuxFeatureFlags>(under("/etc/quorva/features.plist"));
   p.fileSystem = std::make_shared<QRVLinuxFileSystemExtras>(p.lockState);
+  p.applicationTermination = std::make_shared<QRVLinuxApplicationTermination>(under(linuxOptions.applicationSlice));
   return p;
 }

@@ -15,6 +15,7 @@
 #include <sstream>
 #include <thread>
 
+#include "QRVClient.h"
 #include "linux/QRVLinuxFirstBootMarker.h"
 
 QRVDaemonProcess::QRVDaemonProcess() {
@@ -74,9 +75,18 @@ std::chrono::milliseconds QRVDaemonProcess::start(const std::vector<std::string>
     execv(argv[0], argv.data());
     _exit(127);
   }
-  // The socket is bound before start-up runs; the first answer comes after.
-  for (int i = 0; i < 1000 && !answers(socketPath()); i++) std::this_thread::sleep_for(std::chrono::milliseconds(5));
-  logEventuallyContains("kernel upcall server");
+  // The socket is bound before start-up runs, but the first answer comes
+  // only after it: wait for one.
+  for (int i = 0; i < 2000; i++) {
+    if (answers(socketPath())) {
+      QRVClientError error;
+      auto client = QRVClient::connectToSocket(socketPath(), &error);
+      if (client && client->sendRequest(QRVPlist::dictionary().set("Command", QRVPlist::uinteger(32)),
+                                        std::chrono::seconds(10), &error))
+        break;
+    }
+    std::this_thread::sleep_for(std::chrono::milliseconds(5));
+  }
   return std::chrono::duration_cast<std::chrono::milliseconds>(std::chrono::steady_clock::now() - begin);
 }
 

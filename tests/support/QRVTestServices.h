@@ -55,6 +55,8 @@ struct QRVTestServices {
   std::shared_ptr<QRVFakeAccounts> accounts = std::make_shared<QRVFakeAccounts>();
   std::shared_ptr<QRVFakeFeatureFlags> featureFlags = std::make_shared<QRVFakeFeatureFlags>();
   std::shared_ptr<QRVFakePersonaService> personas = std::make_shared<QRVFakePersonaService>();
+  std::shared_ptr<QRVFakeApplicationTermination> applicationTermination =
+      std::make_shared<QRVFakeApplicationTermination>();
   // The real file system under the fake lock state; classes are kept in memory
   // when the tests cannot write trusted extended attributes (not root).
   std::shared_ptr<QRVFakeFileSystemExtras> fileSystem = std::make_shared<QRVFakeFileSystemExtras>(
@@ -74,6 +76,7 @@ struct QRVTestServices {
     p.featureFlags = featureFlags;
     p.personas = personas;
     p.fileSystem = fileSystem;
+    p.applicationTermination = applicationTermination;
     fileSystem->setInMemoryProtectionClasses(geteuid() != 0);
     accounts->accounts = {{"root", 0, 0, "/private/var/root"},
                           {"installer", 33, 33, "/private/var/installer"},
