@@ -12,6 +12,7 @@
 #include <vector>
 
 #include "QRVClient.h"
+#include "QRVContainerClient.h"
 #include "QRVProtocol.h"
 #include "QRVReplyFormat.h"
 #include "QRVRequestArguments.h"
@@ -147,6 +148,210 @@ std::optional<QRVPlist> buildRaw(Words& words, Options& options, std::string* er
   return QRVRequestArguments::buildRequest(*command, arguments, error);
 }
 
+
+// --- typed subcommands ----------------------------------------------------
+
+// Everything the typed subcommands take. Each subcommand names the options
+// it accepts, so a misplaced option is a usage error rather than ignored.
+struct Typed {
+  QRVContainerRef container;
+  QRVContainerRef replacement;  // replace: the --new-* side
+  bool haveId = false, haveClass = false, haveNewId = false, haveNewClass = false;
+  bool create = false, transient = false, info = false, relative = false;
+  std::optional<bool> enable;
+  std::optional<std::string> key, path, dest;
+  std::optional<QRVPlist> value;
+  std::optional<uint64_t> lock, crashes;
+};
+
+bool parseUUID(const std::string& text, QRVUUIDBytes* out, std::string* error) {
+  // Also the 32 bare hex digits --json prints for a UUID, so one call's
+  // output can feed the next.
+  std::string why;
+  auto parsed = QRVRequestArguments::parseArgument((text.size() == 32 ? "U:data=" : "U:uuid=") + text, &why);
+  if (!parsed || parsed->second.dataValue().size() != 16) {
+    *error = fmt::format("\"{}\" is not a UUID (8-4-4-4-12 hex digits)", text);
+    return false;
+  }
+  const auto& bytes = parsed->second.dataValue();
+  std::copy(bytes.begin(), bytes.end(), out->begin());
+  return true;
+}
+
+bool parseNumber(std::string_view option, const std::string& text, uint64_t* out, std::string* error) {
+  auto n = QRVRequestArguments::parseUnsigned(text);
+  if (!n) *error = fmt::format("{} needs a number, not \"{}\"", option, text);
+  else *out = *n;
+  return n.has_value();
+}
+
+// Reads the subcommand's options. `allowed` is the space-separated list of
+// the options it accepts besides the common ones.
+bool parseTyped(Words& words, Options& options, std::string_view allowed, Typed* t, std::string* error) {
+  auto accepts = [&](std::string_view name) {
+    for (size_t at = allowed.find(name); at != std::string_view::npos; at = allowed.find(name, at + 1))
+      if ((at == 0 || allowed[at - 1] == ' ') &&
+          (at + name.size() == allowed.size() || allowed[at + name.size()] == ' '))
+        return true;
+    return false;
+  };
+  static constexpr std::string_view kFlags[] = {"--create", "--transient", "--info", "--relative", "--enable",
+                                                "--disable"};
+  static constexpr std::string_view kValued[] = {"--id", "--class", "--persona", "--uuid", "--new-id", "--new-class",
+                                                 "--new-persona", "--new-uuid", "--key", "--value", "--path",
+                                                 "--dest", "--lock", "--crashes"};
+  while (!words.empty()) {
+    if (takeCommonOption(words, options, error)) {
+      if (!error->empty()) return false;
+      continue;
+    }
+    std::string_view word = words.peek();
+    bool matched = false;
+    for (std::string_view flag : kFlags) {
+      if (word != flag || !accepts(flag)) continue;
+      words.take();
+      matched = true;
+      if (flag == "--create") t->create = true;
+      if (flag == "--transient") t->transient = true;
+      if (flag == "--info") t->info = true;
+      if (flag == "--relative") t->relative = true;
+      if (flag == "--enable") t->enable = true;
+      if (flag == "--disable") t->enable = false;
+      break;
+    }
+    if (matched) continue;
+    for (std::string_view name : kValued) {
+      std::string v;
+      if (!accepts(name) || !takeOptionValue(words, name, &v, error)) continue;
+      if (!error->empty()) return false;
+      matched = true;
+      bool good = true;
+      uint64_t n = 0;
+      if (name == "--id") t->container.identifier = v, t->haveId = true;
+      if (name == "--new-id") t->replacement.identifier = v, t->haveNewId = true;
+      if (name == "--persona") t->container.persona = v;
+      if (name == "--new-persona") t->replacement.persona = v;
+      if (name == "--class" && (good = parseNumber(name, v, &n, error))) t->container.containerClass = n, t->haveClass = true;
+      if (name == "--new-class" && (good = parseNumber(name, v, &n, error)))
+        t->replacement.containerClass = n, t->haveNewClass = true;
+      if (name == "--uuid" && (good = parseUUID(v, &t->container.uuid.emplace(), error))) {}
+      if (name == "--new-uuid" && (good = parseUUID(v, &t->replacement.uuid.emplace(), error))) {}
+      if (name == "--key") t->key = v;
+      if (name == "--path") t->path = v;
+      if (name == "--dest") t->dest = v;
+      if (name == "--lock" && (good = parseNumber(name, v, &n, error))) t->lock = n;
+      if (name == "--crashes" && (good = parseNumber(name, v, &n, error))) t->crashes = n;
+      if (name == "--value") {
+        // "--value TEXT" guesses the type as KEY=VALUE words do; a value
+        // starting with ':' spells it out ("--value :uint=5").
+        auto parsed = QRVRequestArguments::parseArgument(v.starts_with(":") ? "Value" + v : "Value=" + v, error);
+        if ((good = parsed.has_value())) t->value = parsed->second;
+      }
+      if (!good) return false;
+      break;
+    }
+    if (matched) continue;
+    *error = word.starts_with("-") ? fmt::format("unknown option {}", word)
+                                   : fmt::format("unexpected argument \"{}\"", word);
+    return false;
+  }
+  return true;
+}
+
+bool require(bool present, std::string_view what, std::string* error) {
+  if (!present) *error = fmt::format("{} is required", what);
+  return present;
+}
+
+namespace R = QRVContainerRequests;
+
+// One typed subcommand: its accepted options and how they become a request.
+#define QRV_TYPED(function, allowed, body)                                                    \
+  std::optional<QRVPlist> function(Words& words, Options& options, std::string* error) {      \
+    Typed t;                                                                                  \
+    if (!parseTyped(words, options, allowed, &t, error)) return std::nullopt;                 \
+    body                                                                                      \
+  }
+
+QRV_TYPED(buildLookup, "--id --class --persona --create --transient", {
+  if (!require(t.haveId, "--id", error) || !require(t.haveClass, "--class", error)) return std::nullopt;
+  return R::createOrLookupContainer(t.container, t.create, t.transient);
+})
+QRV_TYPED(buildList, "--class --transient", {
+  if (!require(t.haveClass, "--class", error)) return std::nullopt;
+  return R::containersWithClass(t.container.containerClass, t.transient);
+})
+QRV_TYPED(buildReplace, "--id --class --persona --uuid --new-id --new-class --new-persona --new-uuid", {
+  if (!require(t.haveId && t.haveClass, "--id and --class", error) ||
+      !require(t.haveNewId && t.haveNewClass, "--new-id and --new-class", error))
+    return std::nullopt;
+  return R::replaceContainer(t.container, t.replacement);
+})
+QRV_TYPED(buildMetadata, "--id --class --persona --uuid --info", {
+  if (!require(t.haveId && t.haveClass && t.container.uuid, "--id, --class and --uuid", error)) return std::nullopt;
+  return R::containerMetadata(t.container, t.info);
+})
+QRV_TYPED(buildInfoGet, "--id --class --persona --uuid --key", {
+  if (!require(t.haveId && t.haveClass && t.container.uuid && t.key, "--id, --class, --uuid and --key", error))
+    return std::nullopt;
+  return R::infoValueForKey(t.container, *t.key);
+})
+QRV_TYPED(buildInfoSet, "--id --class --persona --uuid --key --value", {
+  if (!require(t.haveId && t.haveClass && t.container.uuid && t.key && t.value,
+               "--id, --class, --uuid, --key and --value", error))
+    return std::nullopt;
+  return R::setInfoValue(t.container, *t.key, *t.value);
+})
+QRV_TYPED(buildDelete, "--id --class --persona --transient", {
+  if (!require(t.haveId && t.haveClass, "--id and --class", error)) return std::nullopt;
+  return R::deleteContainer(t.container, t.transient);
+})
+QRV_TYPED(buildWipe, "--id --persona", {
+  if (!require(t.haveId, "--id", error)) return std::nullopt;
+  return R::wipeContainerContent(t.container);
+})
+QRV_TYPED(buildDiskUsage, "--id --class --persona --uuid", {
+  if (!require(t.haveId && t.haveClass && t.container.uuid, "--id, --class and --uuid", error)) return std::nullopt;
+  return R::diskUsage(t.container);
+})
+QRV_TYPED(buildAssetsPath, "--id --persona --relative --create", {
+  if (!require(t.haveId, "--id", error)) return std::nullopt;
+  return R::userManagedAssetsPath(t.container.identifier, t.container.persona, t.relative, t.create);
+})
+QRV_TYPED(buildAssetsDelete, "--id --persona --path", {
+  if (!require(t.haveId && t.path, "--id and --path", error)) return std::nullopt;
+  return R::deleteUserManagedAsset(t.container.identifier, t.container.persona, *t.path);
+})
+QRV_TYPED(buildStageDelete, "--id --class --persona --uuid", {
+  if (!require(t.haveId && t.haveClass && t.container.uuid, "--id, --class and --uuid", error)) return std::nullopt;
+  return R::stageContainersForDelete(
+      {{t.container.identifier, t.container.containerClass, *t.container.uuid, t.container.persona.value_or("")}});
+})
+QRV_TYPED(buildRecreate, "--id --class --persona --uuid", {
+  if (!require(t.haveId && t.haveClass && t.container.uuid, "--id, --class and --uuid", error)) return std::nullopt;
+  return R::recreateDefaultStructure(t.container);
+})
+QRV_TYPED(buildRegenerateUUID, "--id --class --persona --uuid", {
+  if (!require(t.haveId && t.haveClass && t.container.uuid, "--id, --class and --uuid", error)) return std::nullopt;
+  return R::regenerateDirectoryUUID(t.container);
+})
+QRV_TYPED(buildDeleteContent, "--id --class --persona", {
+  if (!require(t.haveId && t.haveClass, "--id and --class", error)) return std::nullopt;
+  return R::deleteContainerContent(t.container);
+})
+QRV_TYPED(buildStageShared, "--id --path --dest", {
+  if (!require(t.haveId && t.path && t.dest, "--id, --path and --dest", error)) return std::nullopt;
+  return R::stageSharedContent(t.container.identifier, *t.path, *t.dest);
+})
+QRV_TYPED(buildRetryTest, "--crashes", { return R::retryTest(t.crashes.value_or(0)); })
+QRV_TYPED(buildEmptyDeathRow, "", { return R::deleteContainersOnDeathRow(); })
+QRV_TYPED(buildSetTestLock, "--lock --enable --disable", {
+  if (!require(t.lock && t.enable, "--lock and --enable or --disable", error)) return std::nullopt;
+  return R::setTestLock(*t.lock, *t.enable);
+})
+
+#undef QRV_TYPED
+
 struct Subcommand {
   std::string_view name;
   std::string_view synopsis;
@@ -184,6 +389,47 @@ Example:
       CreateIfNecessary=true
 )",
      buildRaw},
+    {"lookup", "lookup --id ID --class N [--persona S] [--create] [--transient]",
+     "Looks up the container of ID in class N, creating it with --create.\nPrints its path, UUID and whether it existed.\n",
+     buildLookup},
+    {"list", "list --class N [--transient]", "Lists the containers of class N (identifiers, UUIDs, personas).\n",
+     buildList},
+    {"metadata", "metadata --id ID --class N --uuid UUID [--persona S] [--info]",
+     "UUID is 8-4-4-4-12 hex digits or the 32 digits --json prints.\nPrints a container's path and whether it is transient; --info adds its info dictionary.\n", buildMetadata},
+    {"info-get", "info-get --id ID --class N --uuid UUID --key K [--persona S]",
+     "Prints the value stored under K in a container's info.\n", buildInfoGet},
+    {"info-set", "info-set --id ID --class N --uuid UUID --key K --value V [--persona S]",
+     "Stores V under K in a container's info. V is typed as KEY=VALUE words are\n(see raw --help); "
+     "\":TYPE=V\" spells the type out, for example --value :uint=5.\n",
+     buildInfoSet},
+    {"delete", "delete --id ID --class N [--persona S] [--transient]", "Deletes the container of ID in class N.\n",
+     buildDelete},
+    {"wipe", "wipe --id ID [--persona S]", "Deletes the content of ID's plug-in data container.\n", buildWipe},
+    {"replace",
+     "replace --id ID --class N [--uuid U] --new-id ID --new-class N [--new-uuid U] [--persona S] [--new-persona S]",
+     "Replaces a container with another one.\n", buildReplace},
+    {"disk-usage", "disk-usage --id ID --class N --uuid UUID [--persona S]",
+     "Prints the bytes a container uses.\n", buildDiskUsage},
+    {"assets-path", "assets-path --id ID [--persona S] [--relative] [--create]",
+     "Prints the user-managed assets directory of ID's application data container.\n", buildAssetsPath},
+    {"assets-delete", "assets-delete --id ID --path P [--persona S]",
+     "Deletes the user-managed asset P of ID.\n", buildAssetsDelete},
+    {"stage-delete", "stage-delete --id ID --class N --uuid UUID [--persona S]",
+     "Stages a container for deletion (see empty-death-row).\n", buildStageDelete},
+    {"recreate", "recreate --id ID --class N --uuid UUID [--persona S]",
+     "Recreates a container's default directory structure.\n", buildRecreate},
+    {"regenerate-uuid", "regenerate-uuid --id ID --class N --uuid UUID [--persona S]",
+     "Gives a container's directory a new UUID.\n", buildRegenerateUUID},
+    {"delete-content", "delete-content --id ID --class N [--persona S]",
+     "Deletes the content of a data container, keeping the container.\n", buildDeleteContent},
+    {"stage-shared", "stage-shared --id ID --path SOURCE --dest DEST",
+     "Stages SOURCE as shared content of ID under DEST; prints where it went.\n", buildStageShared},
+    {"retry-test", "retry-test [--crashes N]", "Runs the retry test with N crashes (internal builds only).\n",
+     buildRetryTest},
+    {"empty-death-row", "empty-death-row",
+     "Deletes the containers staged for deletion; answers when that is done.\n", buildEmptyDeathRow},
+    {"set-test-lock", "set-test-lock --lock N (--enable | --disable)",
+     "Holds or releases test lock N (internal builds only).\n", buildSetTestLock},
 };
 
 const Subcommand* findSubcommand(std::string_view name) {
