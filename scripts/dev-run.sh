@@ -17,6 +17,6 @@ if [ "$(id -u)" -ne 0 ]; then
   echo "note: quorvad is meant to run as root; as $(id -un) it cannot hand containers to their owners" >&2
 fi
 echo "quorvad on root $root" >&2
-echo "  talk to it:  build/client/quorvactl --root $root raw --command 25 NumRetryCrashes=0" >&2
+echo "  talk to it:  build/client/quorvactl --root $root lookup --id com.example.demo --class 2 --create" >&2
 echo "  its log:     $root/private/var/root/Library/Logs/Quorva/quorvad.log" >&2
 exec build/Daemon/quorvad --root "$root" "$@"
