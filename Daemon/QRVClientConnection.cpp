@@ -54,10 +54,38 @@ void QRVClientConnection::rebootQuorvaCleanupWithCompletion(std::function<void()
 }
 
 void QRVClientConnection::quorvaCleanupWithCompletion(std::function<void()> completion) {
-  services_->backgroundQueue->async([completion = std::move(completion)] {
-    QRVLogNotice("boot cleanup does nothing yet: staging and death row are not emptied");
-    if (completion) completion();
-  });
+  // What lies in staging now was left by an earlier run: collect it here, at
+  // start-up, before any request can build something new there.
+  QRVFileManager& fm = *services_->fileManager;
+  QRVGlobalConfiguration& config = *services_->globalConfiguration;
+  std::vector<std::string> leftovers;
+  auto collect = [&](const std::string& staging, const char* failure) {
+    QRVError error;
+    std::optional<std::vector<std::string>> items = fm.urlsForItemsInDirectoryAtURL(staging, &error);
+    if (items)
+      leftovers.insert(leftovers.end(), items->begin(), items->end());
+    else if (!(error.isPOSIX() && error.code() == ENOENT))
+      QRVLogError(fmt::runtime(failure), staging, error.description());
+  };
+  collect(config.stagingDirectory(), "Failed to get items at global staging URL: {} : {}");
+  services_->userIdentityCache->forEachAccessibleUserIdentitySynchronouslyExecuteBlock(
+      [&](const QRVUserIdentityRef& user) {
+        collect(config.stagingDirectoryURLForUserIdentity(user, QRVContainerClassAppData),
+                "Failed to get items at per-user staging URL: {} : {}");
+      });
+
+  // The work outlives this call; it runs as the daemon's own connection.
+  std::shared_ptr<QRVClientConnection> worker = makeSharedClientConnection(services_);
+  services_->backgroundQueue->async(
+      [worker, leftovers = std::move(leftovers), completion = std::move(completion)] {
+        for (const std::string& item : leftovers) {
+          QRVError error;
+          if (!worker->_moveItemAtURLToDeathRow(item, true, false, &error))
+            QRVLogError("Failed to move staging leftover {} to death row: {}", item, error.description());
+        }
+        worker->deleteContainersOnDeathRowWithCompletion(nullptr);
+        if (completion) completion();
+      });
 }
 
 bool QRVClientConnection::retryTestWithNumCrashes(uint64_t numCrashes, QRVError* error) {

@@ -341,5 +341,13 @@ TEST(DeleteCrashIntegrationTest, ACreationKilledAtAnyStepLeavesAWholeContainerOr
       EXPECT_EQ(found[0].code, 21u);
       EXPECT_EQ(live, 0u);
     }
+    // The start-up cleanup sends staging leftovers to death row, which is
+    // then emptied.
+    const std::string staging = daemon.root() + "/private/var/mobile/Containers/Staging";
+    const std::string deathRow = daemon.root() + "/private/var/root/Library/Caches/com.kelva.quorvad/Dead";
+    for (int i = 0; i < 500 && !(fs::is_empty(staging) && (!fs::exists(deathRow) || fs::is_empty(deathRow))); i++)
+      usleep(10'000);
+    EXPECT_TRUE(fs::is_empty(staging));
+    EXPECT_TRUE(!fs::exists(deathRow) || fs::is_empty(deathRow));
   }
 }

@@ -100,4 +100,21 @@ TEST_F(DeathRowTest, FailureToMakeAPlaceOnDeathRowIs41) {
   EXPECT_TRUE(fs::exists(item));
 }
 
+TEST_F(DeathRowTest, StartUpCleanupEmptiesEveryStagingDirectory) {
+  QRVGlobalConfiguration& config = *env_.services->globalConfiguration;
+  auto user = env_.services->userIdentityCache->defaultUserIdentity();
+  std::string global = config.stagingDirectory(), perUser = config.stagingDirectoryURLForUserIdentity(user, 2);
+  fs::create_directories(global + "/half-built/Library");
+  fs::create_directories(perUser + "/another");
+  std::ofstream(perUser + "/temp_metadata-x.plist") << "x";
+  std::promise<void> done;
+  connection_->quorvaCleanupWithCompletion([&] { done.set_value(); });
+  ASSERT_EQ(done.get_future().wait_for(std::chrono::seconds(10)), std::future_status::ready);
+  EXPECT_TRUE(fs::is_empty(global));
+  EXPECT_TRUE(fs::is_empty(perUser));
+  // And what went to death row is deleted in the background.
+  for (int i = 0; i < 500 && itemsOnDeathRow() > 0; i++) std::this_thread::sleep_for(std::chrono::milliseconds(5));
+  EXPECT_EQ(itemsOnDeathRow(), 0u);
+}
+
 }  // namespace
