@@ -6,15 +6,15 @@
 #include <thread>
 
 #include "QRVLog.h"
+#include "support/QRVEventually.h"
 #include "support/QRVTestServices.h"
 
 namespace {
 
-// Waits up to a few seconds for `done`; the cleanups run on their own queue.
+// The cleanups run on their own queue.
 template <typename Pred>
 bool eventually(Pred done) {
-  for (int i = 0; i < 500 && !done(); i++) std::this_thread::sleep_for(std::chrono::milliseconds(10));
-  return done();
+  return QRVEventually(done);
 }
 
 class DaemonTest : public testing::Test {

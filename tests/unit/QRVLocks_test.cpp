@@ -11,6 +11,7 @@
 #include <sstream>
 #include <thread>
 
+#include "support/QRVEventually.h"
 #include "support/QRVTestServices.h"
 
 namespace {
@@ -18,12 +19,7 @@ namespace {
 using namespace std::chrono_literals;
 
 bool waitUntil(const std::function<bool()>& condition, std::chrono::milliseconds timeout = 5s) {
-  auto deadline = std::chrono::steady_clock::now() + timeout;
-  while (!condition()) {
-    if (std::chrono::steady_clock::now() > deadline) return false;
-    std::this_thread::sleep_for(1ms);
-  }
-  return true;
+  return QRVEventually(condition, timeout);
 }
 
 // A lock call made on a thread of its own; the lock it takes is released

@@ -12,6 +12,7 @@
 #include "QRVLocks.h"
 #include "QRVRelayDispatcher.h"
 #include "support/QRVTestConnection.h"
+#include "support/QRVEventually.h"
 #include "support/QRVTestServices.h"
 
 namespace {
@@ -19,12 +20,7 @@ namespace {
 using namespace std::chrono_literals;
 
 bool waitUntil(const std::function<bool()>& condition, std::chrono::milliseconds timeout = 5s) {
-  auto deadline = std::chrono::steady_clock::now() + timeout;
-  while (!condition()) {
-    if (std::chrono::steady_clock::now() > deadline) return false;
-    std::this_thread::sleep_for(1ms);
-  }
-  return true;
+  return QRVEventually(condition, timeout);
 }
 
 // Runs `work` on its own thread and tells when it has returned.
