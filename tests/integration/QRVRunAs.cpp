@@ -8,6 +8,10 @@
 
 #include <chrono>
 
+#include "QRVClient.h"
+#include "QRVDaemonProcess.h"
+#include "QRVPlist.h"
+
 std::optional<std::string> QRVRunAs(uid_t uid, gid_t gid, const std::function<std::string()>& body,
                                     int timeoutSeconds) {
   int fds[2];
@@ -46,4 +50,25 @@ std::optional<std::string> QRVRunAs(uid_t uid, gid_t gid, const std::function<st
   waitpid(pid, &status, 0);
   if (!WIFEXITED(status) || WEXITSTATUS(status) != 0) return std::nullopt;
   return out;
+}
+
+std::vector<QRVPlist> QRVRepliesAs(const QRVDaemonProcess& daemon, uid_t uid, const std::vector<QRVPlist>& requests) {
+  // The child hands its replies back as one binary property list.
+  std::optional<std::string> out = QRVRunAs(uid, uid, [&] {
+    QRVPlist::Array replies;
+    QRVClientError error;
+    std::optional<QRVClient> client = QRVClient::connect(daemon.root(), &error);
+    for (const QRVPlist& request : requests) {
+      std::optional<QRVPlist> reply =
+          client ? client->sendRequest(request, std::chrono::seconds(10), &error) : std::nullopt;
+      replies.push_back(reply.value_or(QRVPlist::dictionary()));
+    }
+    QRVPlist::Bytes bytes = QRVPlist::array(std::move(replies)).toBinary();
+    return std::string(bytes.begin(), bytes.end());
+  });
+  std::optional<QRVPlist> parsed =
+      out ? QRVPlist::fromBinary(reinterpret_cast<const uint8_t*>(out->data()), out->size()) : std::nullopt;
+  std::vector<QRVPlist> replies = parsed && parsed->isArray() ? parsed->arrayValue() : QRVPlist::Array();
+  replies.resize(requests.size(), QRVPlist::dictionary());
+  return replies;
 }

@@ -1,0 +1,269 @@
+// Stops the real daemon dead (as a power loss would) at each step of creating
+// a container, replacing or wiping one and emptying death row, restarts it,
+// and checks what the next start leaves: whole containers or none, no journal,
+// empty staging and death row, and nothing else in the root changed.
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+#include <functional>
+#include <map>
+
+#include "QRVClient.h"
+#include "QRVDaemonProcess.h"
+#include "support/QRVEventually.h"
+#include "QRVRunAs.h"
+
+namespace fs = std::filesystem;
+
+namespace {
+
+constexpr uid_t kInstallerUID = 2102;  // "allowed": unrestricted
+
+constexpr const char* kMetadataFile = ".com.kelva.quorva.metadata.plist";
+constexpr const char* kDataClassDirectory = "/private/var/mobile/Containers/Data/Application";
+constexpr const char* kTransientDirectory = "/private/var/mobile/Containers/Temp";
+constexpr const char* kUserStaging = "/private/var/mobile/Containers/Staging";
+constexpr const char* kCaches = "/private/var/root/Library/Caches/com.kelva.quorvad";
+constexpr const char* kReplaceDirectory = "/private/var/root/Library/Quorva/Replace";
+
+QRVPlist command(uint64_t number) { return QRVPlist::dictionary().set("Command", QRVPlist::uinteger(number)); }
+
+QRVPlist createRequest(const std::string& identifier, bool createIfNecessary = true, bool transient = false) {
+  return command(0)
+      .set("Identifier", QRVPlist::string(identifier))
+      .set("ContainerClass", QRVPlist::uinteger(2))
+      .set("CreateIfNecessary", QRVPlist::boolean(createIfNecessary))
+      .set("Transient", QRVPlist::boolean(transient));
+}
+
+void writeText(const std::string& path, const std::string& text) { std::ofstream(path) << text; }
+
+bool isEmptyOrAbsent(const std::string& path) { return !fs::exists(path) || fs::is_empty(path); }
+
+// Everything under the root that a crash and the recovery must leave alone:
+// relative path -> kind, mode, owner and, for files, the contents.
+using Snapshot = std::map<std::string, std::string>;
+
+Snapshot snapshotOf(const std::string& root, const std::vector<std::string>& skipped) {
+  // What the daemon rightly changes on every start (its socket, its log) and
+  // where crashed work may linger (staging, death row, the journals).
+  std::vector<std::string> skip = {"/run", "/private/var/root/Library/Logs", kUserStaging, kCaches,
+                                   kReplaceDirectory};
+  skip.insert(skip.end(), skipped.begin(), skipped.end());
+  Snapshot snapshot;
+  for (auto it = fs::recursive_directory_iterator(root); it != fs::recursive_directory_iterator(); ++it) {
+    std::string relative = it->path().string().substr(root.size());
+    if (std::any_of(skip.begin(), skip.end(), [&](const std::string& s) { return relative.rfind(s, 0) == 0; })) {
+      if (it->is_directory() && !it->is_symlink()) it.disable_recursion_pending();
+      continue;
+    }
+    struct stat st {};
+    lstat(it->path().c_str(), &st);
+    std::string entry = std::to_string(st.st_mode) + " " + std::to_string(st.st_uid) + ":" + std::to_string(st.st_gid);
+    if (S_ISREG(st.st_mode)) {
+      std::ifstream in(it->path(), std::ios::binary);
+      entry += " " + std::to_string(std::hash<std::string>()(std::string(std::istreambuf_iterator<char>(in), {})));
+    }
+    snapshot[relative] = entry;
+  }
+  return snapshot;
+}
+
+// The entries that differ, one per line, for a readable failure.
+std::string differences(const Snapshot& before, const Snapshot& after) {
+  std::string out;
+  for (const auto& [path, entry] : before) {
+    auto it = after.find(path);
+    if (it == after.end()) out += "gone: " + path + "\n";
+    else if (it->second != entry) out += "changed: " + path + "\n";
+  }
+  for (const auto& [path, entry] : after)
+    if (!before.count(path)) out += "new: " + path + "\n";
+  return out;
+}
+
+// A daemon on a fresh root that trusts the installer with every command.
+void trustInstaller(QRVDaemonProcess& daemon) {
+  daemon.trustUID(kInstallerUID, "com.example.installer",
+                  QRVPlist::dictionary().set("com.kelva.private.Quorva.allowed", QRVPlist::boolean(true)));
+}
+
+// Starts the daemon armed to stop dead when it reaches `point`.
+void startArmed(QRVDaemonProcess& daemon, const char* point) {
+  setenv("QUORVAD_CRASH_AT", point, 1);
+  daemon.start();
+  unsetenv("QUORVAD_CRASH_AT");
+}
+
+// Sends `request` to an armed daemon and checks that it stopped dead: no
+// reply, exit status 70.
+void expectStoppedDeadBy(QRVDaemonProcess& daemon, const QRVPlist& request) {
+  QRVPlist reply = QRVRepliesAs(daemon, kInstallerUID, {request})[0];
+  EXPECT_EQ(QRVClient::resultCode(reply), 0u) << "the daemon answered instead of stopping";
+  std::optional<int> status = daemon.waitForExit(std::chrono::seconds(5));
+  ASSERT_TRUE(status.has_value());
+  EXPECT_TRUE(WIFEXITED(*status) && WEXITSTATUS(*status) == 70);
+}
+
+// Restarts the daemon after a crash and waits until the start-up cleanup has
+// emptied staging and death row.
+void restartAndExpectCleanedUp(QRVDaemonProcess& daemon) {
+  daemon.start();
+  const std::string root = daemon.root();
+  EXPECT_TRUE(QRVEventually([&] {
+    return isEmptyOrAbsent(root + kUserStaging) && isEmptyOrAbsent(root + kCaches + "/Staging") &&
+           isEmptyOrAbsent(root + kCaches + "/Dead");
+  })) << "staging or death row still holds something";
+  EXPECT_TRUE(isEmptyOrAbsent(root + kReplaceDirectory)) << "a replace journal survived the recovery";
+}
+
+}  // namespace
+
+// Each step of a replace (command 2), and of a wipe (command 12, a replace
+// that keeps the UUID): exactly one whole container is live afterwards.
+TEST(CrashIntegrationTest, AReplaceKilledAtAnyStepLeavesOneWholeContainer) {
+  if (geteuid() != 0) GTEST_SKIP() << "needs root: clients run under other uids";
+  for (const char* point : {"replace.journal-written", "replace.old-parked", "replace.new-placed",
+                            "replace.cache-updated", "replace.staging-removed"}) {
+    for (bool wipe : {false, true}) {
+      SCOPED_TRACE(std::string(point) + (wipe ? " (wipe)" : " (replace)"));
+      QRVDaemonProcess daemon;
+      trustInstaller(daemon);
+      daemon.start();
+      std::vector<QRVPlist> made = QRVRepliesAs(
+          daemon, kInstallerUID,
+          {createRequest("com.example.r"), createRequest("com.example.r", true, true), createRequest("com.example.o")});
+      for (const QRVPlist& reply : made) ASSERT_EQ(QRVClient::resultCode(reply), 1u);
+      const std::string oldPath = made[0].stringForKey("ReplyPath"), newPath = made[1].stringForKey("ReplyPath");
+      const QRVPlist::Bytes oldUUID = made[0].dataForKey("ReplyUUID"), newUUID = made[1].dataForKey("ReplyUUID");
+      writeText(oldPath + "/old.txt", "old");
+      writeText(newPath + "/new.txt", "new");
+      writeText(made[2].stringForKey("ReplyPath") + "/other.txt", "other");
+      daemon.stop();
+      // The two containers of the swap, and in a wipe the transient tree:
+      // a wipe stopped before its swap leaves the fresh transient container
+      // it made, whole, for the next boot's cleanup of transient containers.
+      std::vector<std::string> involved = {oldPath.substr(daemon.root().size()),
+                                           newPath.substr(daemon.root().size())};
+      if (wipe) involved.push_back(kTransientDirectory);
+      const Snapshot before = snapshotOf(daemon.root(), involved);
+
+      startArmed(daemon, point);
+      expectStoppedDeadBy(daemon,
+              wipe ? command(12)
+                          .set("Identifier", QRVPlist::string("com.example.r"))
+                          .set("ContainerClass", QRVPlist::uinteger(2))
+                    : command(2)
+                          .set("OldIdentifier", QRVPlist::string("com.example.r"))
+                          .set("OldContainerClass", QRVPlist::uinteger(2))
+                          .set("OldContainerUUID", QRVPlist::data(oldUUID))
+                          .set("NewIdentifier", QRVPlist::string("com.example.r"))
+                          .set("NewContainerClass", QRVPlist::uinteger(2))
+                          .set("NewContainerUUID", QRVPlist::data(newUUID)));
+      restartAndExpectCleanedUp(daemon);
+
+      QRVPlist found = QRVRepliesAs(daemon, kInstallerUID, {createRequest("com.example.r", false)})[0];
+      ASSERT_EQ(QRVClient::resultCode(found), 1u);
+      const std::string live = found.stringForKey("ReplyPath");
+      const bool isOld = fs::exists(live + "/old.txt");
+      const bool isNew = wipe ? !isOld : fs::exists(live + "/new.txt");
+      EXPECT_NE(isOld, isNew) << live;
+      EXPECT_TRUE(fs::exists(live + "/" + kMetadataFile));
+      if (isOld || wipe) {
+        EXPECT_EQ(live, oldPath);
+        EXPECT_EQ(found.dataForKey("ReplyUUID"), oldUUID);
+      } else {
+        EXPECT_EQ(found.dataForKey("ReplyUUID"), newUUID);
+        EXPECT_FALSE(fs::exists(oldPath));
+      }
+      // One container of the replaced identifier and the bystander: no
+      // half-moved copy lies anywhere in the class directory.
+      size_t containers = 0;
+      for (const auto& entry : fs::directory_iterator(daemon.root() + kDataClassDirectory)) {
+        EXPECT_TRUE(fs::exists(entry.path() / kMetadataFile)) << entry.path();
+        containers++;
+      }
+      EXPECT_EQ(containers, 2u);
+      involved.push_back(live.substr(daemon.root().size()));
+      EXPECT_EQ(differences(before, snapshotOf(daemon.root(), involved)), "");
+    }
+  }
+}
+
+// Each step of creating a container: it is whole and live, or not there.
+TEST(CrashIntegrationTest, ACreationKilledAtAnyStepLeavesAWholeContainerOrNone) {
+  if (geteuid() != 0) GTEST_SKIP() << "needs root: clients run under other uids";
+  for (const char* point : {"create.staged", "create.metadata-written", "create.live"}) {
+    SCOPED_TRACE(point);
+    QRVDaemonProcess daemon;
+    trustInstaller(daemon);
+    startArmed(daemon, point);
+    expectStoppedDeadBy(daemon, createRequest("com.example.c"));
+    restartAndExpectCleanedUp(daemon);
+
+    QRVPlist found = QRVRepliesAs(daemon, kInstallerUID, {createRequest("com.example.c", false)})[0];
+    size_t live = 0;
+    for (const auto& entry : fs::directory_iterator(daemon.root() + kDataClassDirectory)) {
+      live++;
+      EXPECT_TRUE(fs::exists(entry.path() / kMetadataFile)) << entry.path();
+    }
+    if (std::string(point) == "create.live") {
+      EXPECT_EQ(QRVClient::resultCode(found), 1u);
+      EXPECT_EQ(live, 1u);
+    } else {
+      // Only staging saw the half-built container.
+      EXPECT_EQ(QRVClient::resultCode(found), 21u);
+      EXPECT_EQ(live, 0u);
+    }
+  }
+}
+
+// Emptying death row stopped after its first item: the next start finishes
+// the job, and the container that was never staged is untouched.
+TEST(CrashIntegrationTest, DeathRowEmptyingKilledHalfwayIsFinishedAtTheNextStart) {
+  if (geteuid() != 0) GTEST_SKIP() << "needs root: clients run under other uids";
+  QRVDaemonProcess daemon;
+  trustInstaller(daemon);
+  // Death row is empty when this daemon starts, so its start-up cleanup
+  // passes no crash point; command 4 below does.
+  startArmed(daemon, "deathrow.item-removed");
+  std::vector<QRVPlist> made = QRVRepliesAs(
+      daemon, kInstallerUID, {createRequest("com.example.a"), createRequest("com.example.b"), createRequest("com.example.k")});
+  for (const QRVPlist& reply : made) ASSERT_EQ(QRVClient::resultCode(reply), 1u);
+  writeText(made[2].stringForKey("ReplyPath") + "/kept.txt", "kept");
+  QRVPlist::Array classes, uuids, identifiers, personas;
+  for (int i = 0; i < 2; i++) {
+    classes.push_back(QRVPlist::uinteger(2));
+    uuids.push_back(QRVPlist::data(made[i].dataForKey("ReplyUUID")));
+    identifiers.push_back(QRVPlist::string(i == 0 ? "com.example.a" : "com.example.b"));
+    personas.push_back(QRVPlist::string(""));
+  }
+  QRVPlist staged = QRVRepliesAs(daemon, kInstallerUID,
+                                 {command(3)
+                                      .set("ContainerClassesArray", QRVPlist::array(classes))
+                                      .set("UUIDsArray", QRVPlist::array(uuids))
+                                      .set("IdentifiersArray", QRVPlist::array(identifiers))
+                                      .set("PersonaUniqueStringsArray", QRVPlist::array(personas))})[0];
+  ASSERT_EQ(QRVClient::resultCode(staged), 1u);
+  const std::string deathRow = daemon.root() + kCaches + "/Dead";
+  ASSERT_EQ(std::distance(fs::directory_iterator(deathRow), fs::directory_iterator()), 2);
+  const Snapshot before = snapshotOf(daemon.root(), {});
+
+  expectStoppedDeadBy(daemon, command(4));
+  EXPECT_EQ(std::distance(fs::directory_iterator(deathRow), fs::directory_iterator()), 1)
+      << "the daemon should have stopped after the first item";
+
+  restartAndExpectCleanedUp(daemon);
+  std::vector<QRVPlist> found = QRVRepliesAs(
+      daemon, kInstallerUID,
+      {createRequest("com.example.a", false), createRequest("com.example.b", false), createRequest("com.example.k", false)});
+  EXPECT_EQ(QRVClient::resultCode(found[0]), 21u);
+  EXPECT_EQ(QRVClient::resultCode(found[1]), 21u);
+  EXPECT_EQ(QRVClient::resultCode(found[2]), 1u);
+  EXPECT_EQ(differences(before, snapshotOf(daemon.root(), {})), "");
+}
