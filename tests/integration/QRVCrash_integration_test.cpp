@@ -1,7 +1,9 @@
 // Stops the real daemon dead (as a power loss would) at each step of creating
 // a container, replacing or wiping one and emptying death row, restarts it,
 // and checks what the next start leaves: whole containers or none, no journal,
-// empty staging and death row, and nothing else in the root changed.
+// empty staging and death row, and nothing else in the root changed. Also
+// recovers replace journals written by hand in each state a replace can be
+// caught in.
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
@@ -266,4 +268,63 @@ TEST(CrashIntegrationTest, DeathRowEmptyingKilledHalfwayIsFinishedAtTheNextStart
   EXPECT_EQ(QRVClient::resultCode(found[1]), 21u);
   EXPECT_EQ(QRVClient::resultCode(found[2]), 1u);
   EXPECT_EQ(differences(before, snapshotOf(daemon.root(), {})), "");
+}
+
+// Journals written by hand in each state a replace can be caught in: the
+// next start finishes or rolls back each one, and the container it ends with
+// is whole, with its metadata.
+TEST(CrashIntegrationTest, HandWrittenJournalsOfEachStateAreRecoveredAtTheNextStart) {
+  if (geteuid() != 0) GTEST_SKIP() << "needs root: clients run under other uids";
+  enum State { kNotStarted, kOldInStaging, kNewAtDestination, kFinished };
+  for (State state : {kNotStarted, kOldInStaging, kNewAtDestination, kFinished}) {
+    SCOPED_TRACE(state);
+    QRVDaemonProcess daemon;
+    trustInstaller(daemon);
+    daemon.start();
+    std::vector<QRVPlist> made =
+        QRVRepliesAs(daemon, kInstallerUID, {createRequest("com.example.r"), createRequest("com.example.r", true, true)});
+    for (const QRVPlist& reply : made) ASSERT_EQ(QRVClient::resultCode(reply), 1u);
+    const std::string oldPath = made[0].stringForKey("ReplyPath"), newPath = made[1].stringForKey("ReplyPath");
+    writeText(oldPath + "/old.txt", "old");
+    writeText(newPath + "/new.txt", "new");
+    daemon.stop();
+
+    const std::string root = daemon.root();
+    const std::string staging = root + kUserStaging + "/0F4B8D0A-5D39-4C0E-9A43-1C1B2A3D4E5F";
+    const std::string destination = root + kDataClassDirectory + "/" + fs::path(newPath).filename().string();
+    if (state >= kOldInStaging) fs::rename(oldPath, staging);
+    if (state >= kNewAtDestination) fs::rename(newPath, destination);
+    if (state == kFinished) {
+      fs::remove_all(staging);
+    } else {
+      fs::create_directories(root + kReplaceDirectory);
+      QRVPlist::Bytes journal = QRVPlist::dictionary()
+                                    .set("QRVReplaceOperationOldURL", QRVPlist::string(oldPath))
+                                    .set("QRVReplaceOperationNewURL", QRVPlist::string(newPath))
+                                    .set("QRVReplaceOperationStagingURL", QRVPlist::string(staging))
+                                    .set("QRVReplaceOperationDestURL", QRVPlist::string(destination))
+                                    .toBinary();
+      std::ofstream(root + kReplaceDirectory + "/interrupted.plist", std::ios::binary)
+          .write(reinterpret_cast<const char*>(journal.data()), static_cast<std::streamsize>(journal.size()));
+    }
+
+    restartAndExpectCleanedUp(daemon);
+    QRVPlist found = QRVRepliesAs(daemon, kInstallerUID, {createRequest("com.example.r", false)})[0];
+    ASSERT_EQ(QRVClient::resultCode(found), 1u);
+    const std::string live = found.stringForKey("ReplyPath");
+    EXPECT_TRUE(fs::exists(live + "/" + kMetadataFile));
+    if (state <= kOldInStaging) {
+      EXPECT_EQ(live, oldPath);
+      EXPECT_TRUE(fs::exists(live + "/old.txt"));
+    } else {
+      EXPECT_EQ(live, destination);
+      EXPECT_TRUE(fs::exists(live + "/new.txt"));
+    }
+    size_t containers = 0;
+    for (const auto& entry : fs::directory_iterator(root + kDataClassDirectory)) {
+      EXPECT_TRUE(fs::exists(entry.path() / kMetadataFile)) << entry.path();
+      containers++;
+    }
+    EXPECT_EQ(containers, 1u);
+  }
 }
