@@ -1,5 +1,8 @@
 // Deleting, wiping and replacing containers through the running daemon.
+#include <fcntl.h>
 #include <gtest/gtest.h>
+#include <linux/fs.h>
+#include <sys/ioctl.h>
 #include <unistd.h>
 
 #include <filesystem>
@@ -33,6 +36,19 @@ void writeText(const std::string& path, const std::string& text) { std::ofstream
 std::string readText(const std::string& path) {
   std::ifstream in(path);
   return std::string(std::istreambuf_iterator<char>(in), {});
+}
+
+// Sets the immutable flag as an application's root-owned helper could;
+// false where the file system does not support it.
+bool setImmutable(const std::string& file) {
+  int fd = open(file.c_str(), O_RDONLY | O_CLOEXEC);
+  if (fd < 0) return false;
+  int flags = 0;
+  bool ok = ioctl(fd, FS_IOC_GETFLAGS, &flags) == 0;
+  flags |= FS_IMMUTABLE_FL;
+  ok = ok && ioctl(fd, FS_IOC_SETFLAGS, &flags) == 0;
+  close(fd);
+  return ok;
 }
 
 class DeleteIntegrationTest : public testing::Test {
@@ -93,13 +109,22 @@ TEST_F(DeleteIntegrationTest, WipeStageForDeleteAndDeleteContainer) {
   EXPECT_EQ(code(staged[1]), 1u);
   EXPECT_FALSE(fs::exists(b));
 
+  // A file the application made immutable does not keep its container
+  // alive, and nothing outside the container goes with it.
+  writeText(a + "/Documents/stuck.txt", "stuck");
+  const bool immutable = setImmutable(a + "/Documents/stuck.txt");
+  const std::string bystander = daemon_.root() + "/private/var/mobile/bystander.txt";
+  writeText(bystander, "still here");
+  fs::create_symlink(bystander, a + "/Documents/link-out");
+
   staged = QRVRepliesAs(daemon_, kInstallerUID, {stage(1), command(4)});
   EXPECT_EQ(code(staged[0]), 1u);
   EXPECT_FALSE(fs::exists(a));
   // Death row is empty once the reply to command 4 arrives.
   EXPECT_EQ(code(staged[1]), 1u);
   const std::string deathRow = daemon_.root() + "/private/var/root/Library/Caches/com.kelva.quorvad/Dead";
-  EXPECT_TRUE(!fs::exists(deathRow) || fs::is_empty(deathRow));
+  EXPECT_TRUE(!fs::exists(deathRow) || fs::is_empty(deathRow)) << (immutable ? "with an immutable file" : "");
+  EXPECT_EQ(readText(bystander), "still here");
 }
 
 TEST_F(DeleteIntegrationTest, ReplaceSwapsInTheNewContainer) {
