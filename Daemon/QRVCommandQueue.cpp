@@ -45,6 +45,13 @@ bool QRVCommandQueue::executeAllUntilExhaustedOrError(uint64_t* result) {
   }
   if (code == kExhausted) return true;
   if (result) *result = code;
+  // The commands after a failure belong to a request that has failed. They
+  // are destroyed outside the lock, which their destructors may want.
+  std::deque<std::shared_ptr<QRVCommand>> dropped;
+  {
+    std::lock_guard<std::mutex> lock(mutex_);
+    dropped.swap(commands_);
+  }
   return false;
 }
 

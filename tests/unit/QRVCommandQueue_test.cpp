@@ -29,39 +29,33 @@ class Step : public QRVCommand {
   std::function<void(QRVCommandQueue&)> also_;
 };
 
-TEST(CommandQueueTest, EmptyDrainLeavesTheResultAlone) {
+TEST(CommandQueueTest, DrainRunsInOrderIncludingLateCommandsAndStopsAtTheFirstFailure) {
   QRVCommandQueue queue;
-  uint64_t result = 12;  // a handler's own failure survives
+  uint64_t result = 12;  // an empty drain leaves a handler's own failure alone
   EXPECT_TRUE(queue.executeAllUntilExhaustedOrError(&result));
   EXPECT_EQ(result, 12u);
-  uint64_t code = 1;
-  EXPECT_FALSE(queue.executeNextCommandWithError(&code));
-  EXPECT_EQ(code, QRVCommandQueue::kExhausted);
-}
+  EXPECT_FALSE(queue.executeNextCommandWithError(&result));
+  EXPECT_EQ(result, QRVCommandQueue::kExhausted);
 
-TEST(CommandQueueTest, FirstFailureStopsTheDrainAndBecomesTheResult) {
+  // A command added while draining runs in the same drain, after those queued before it.
   std::vector<std::string> log;
-  QRVCommandQueue queue;
-  queue.insertCommand(std::make_shared<Step>(&log, "A"));
-  queue.insertCommand(std::make_shared<Step>(&log, "B", 28));
-  queue.insertCommand(std::make_shared<Step>(&log, "C"));
-  uint64_t result = 1;
-  EXPECT_FALSE(queue.executeAllUntilExhaustedOrError(&result));
-  EXPECT_EQ(result, 28u);
-  EXPECT_EQ(log, (std::vector<std::string>{"A", "B"}));
-}
-
-TEST(CommandQueueTest, CommandsAddedWhileDrainingRunInTheSameDrain) {
-  std::vector<std::string> log;
-  QRVCommandQueue queue;
   queue.insertCommand(std::make_shared<Step>(&log, "A", 0, [&](QRVCommandQueue& q) {
     q.insertCommand(std::make_shared<Step>(&log, "A2"));
   }));
   queue.insertCommand(std::make_shared<Step>(&log, "B"));
-  uint64_t result = 1;
+  result = 1;
   EXPECT_TRUE(queue.executeAllUntilExhaustedOrError(&result));
   EXPECT_EQ(result, 1u);
   EXPECT_EQ(log, (std::vector<std::string>{"A", "B", "A2"}));
+
+  log.clear();
+  queue.insertCommand(std::make_shared<Step>(&log, "C"));
+  queue.insertCommand(std::make_shared<Step>(&log, "D", 28));
+  queue.insertCommand(std::make_shared<Step>(&log, "E"));
+  EXPECT_FALSE(queue.executeAllUntilExhaustedOrError(&result));
+  EXPECT_EQ(result, 28u);
+  EXPECT_EQ(log, (std::vector<std::string>{"C", "D"}));
+  // What came after the failure is dropped, not left to run in a later drain.
   EXPECT_EQ(queue.pendingCount(), 0u);
 }
 
