@@ -5,7 +5,6 @@
 #include <unistd.h>
 
 #include <regex>
-#include <set>
 
 #include "QRVClient.h"
 #include "QRVDaemonProcess.h"
@@ -19,23 +18,6 @@ std::string selfExecutable() {
   char buf[4096];
   ssize_t n = readlink("/proc/self/exe", buf, sizeof buf - 1);
   return n > 0 ? std::string(buf, static_cast<size_t>(n)) : std::string();
-}
-
-// Sends `count` requests over one connection from a process running as uid;
-// returns the result codes.
-std::string ask(const QRVDaemonProcess& daemon, uid_t uid, uint64_t command, int count = 1) {
-  return QRVRunAs(uid, uid, [&] {
-           QRVClientError error;
-           auto client = QRVClient::connect(daemon.root(), &error);
-           if (!client) return std::string("connect-failed");
-           std::string codes;
-           for (int i = 0; i < count; i++) {
-             auto reply = client->sendRequest(request(command), std::chrono::seconds(10), &error);
-             codes += (codes.empty() ? "" : " ") + (reply ? std::to_string(QRVClient::resultCode(*reply)) : "x");
-           }
-           return codes;
-         })
-      .value_or("child-failed");
 }
 
 // The addresses of the identities logged for `identifier`, one per request.
@@ -72,9 +54,10 @@ TEST_F(ClientIdentityIntegrationTest, MatchedByExecutableAndByUID) {
                                   .set("Executable", QRVPlist::string("/nonexistent/tool"))
                                   .set("Entitlements", QRVPlist::dictionary()));
   daemon_.start();
-  EXPECT_EQ(ask(daemon_, 3001, 25), "1");
-  EXPECT_EQ(ask(daemon_, 3002, 25), "55");
-  EXPECT_EQ(ask(daemon_, 3003, 25), "55");
+  auto testCodeAs = [&](uid_t uid) { return QRVClient::resultCode(QRVRepliesAs(daemon_, uid, {request(25)})[0]); };
+  EXPECT_EQ(testCodeAs(3001), 1u);
+  EXPECT_EQ(testCodeAs(3002), 55u);
+  EXPECT_EQ(testCodeAs(3003), 55u);
   std::string log = daemon_.readLog();
   EXPECT_EQ(loggedIdentities(log, "com.example.tool").size(), 1u);
   EXPECT_EQ(loggedIdentities(log, "com.example.byuid").size(), 1u);
@@ -82,17 +65,19 @@ TEST_F(ClientIdentityIntegrationTest, MatchedByExecutableAndByUID) {
   EXPECT_NE(log.find("command=25, client=com.example.tool, error=1"), std::string::npos);
 
   // The trust store is re-read when it changes.
-  daemon_.trustUID(3003, "com.example.late", QRVPlist::dictionary().set("com.kelva.private.Quorva.testability",
-                                                                          QRVPlist::boolean(true)));
-  EXPECT_EQ(ask(daemon_, 3003, 25), "1");
+  daemon_.trustUID(3003, "com.example.late",
+                   QRVPlist::dictionary().set("com.kelva.private.Quorva.testability", QRVPlist::boolean(true)));
+  EXPECT_EQ(testCodeAs(3003), 1u);
 }
 
 TEST_F(ClientIdentityIntegrationTest, RestartedInstallerGetsAFreshIdentity) {
   daemon_.trustUID(3010, "com.kelva.verdaned",
                    QRVPlist::dictionary().set("com.kelva.private.Quorva.allowed", QRVPlist::boolean(true)));
   daemon_.start();
-  EXPECT_EQ(ask(daemon_, 3010, 32, 3), "49 49 49");  // one process, three requests
-  EXPECT_EQ(ask(daemon_, 3010, 32, 2), "49 49");     // a new process
+  // One process asks three times, then a new process twice.
+  for (size_t count : {3, 2})
+    for (const QRVPlist& reply : QRVRepliesAs(daemon_, 3010, std::vector<QRVPlist>(count, request(32))))
+      EXPECT_EQ(QRVClient::resultCode(reply), 49u);
   std::vector<std::string> ids = loggedIdentities(daemon_.readLog(), "com.kelva.verdaned");
   ASSERT_EQ(ids.size(), 5u);
   // The first process's requests share one identity; the restarted process

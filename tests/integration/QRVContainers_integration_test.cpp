@@ -4,7 +4,6 @@
 #include <unistd.h>
 
 #include <filesystem>
-#include <sstream>
 
 #include "QRVClient.h"
 #include "QRVDaemonProcess.h"
@@ -12,7 +11,7 @@
 
 namespace {
 
-constexpr uid_t kAppUID = 2101;      // "com.example.app", no entitlements
+constexpr uid_t kAppUID = 2101;        // "com.example.app", no entitlements
 constexpr uid_t kInstallerUID = 2102;  // "allowed"
 
 QRVPlist createRequest(const std::string& identifier, uint64_t containerClass, bool transient = false) {
@@ -22,40 +21,6 @@ QRVPlist createRequest(const std::string& identifier, uint64_t containerClass, b
       .set("ContainerClass", QRVPlist::uinteger(containerClass))
       .set("CreateIfNecessary", QRVPlist::boolean(true))
       .set("Transient", QRVPlist::boolean(transient));
-}
-
-// Sends the requests from a process of `uid`; each reply is rendered as
-// "code path existed uuid-hex" on its own line.
-std::vector<std::string> repliesAs(const QRVDaemonProcess& daemon, uid_t uid, const std::vector<QRVPlist>& requests) {
-  auto out = QRVRunAs(uid, uid, [&] {
-    QRVClientError error;
-    auto client = QRVClient::connect(daemon.root(), &error);
-    if (!client) return std::string("connect-failed\n");
-    std::ostringstream lines;
-    for (const QRVPlist& r : requests) {
-      auto reply = client->sendRequest(r, std::chrono::seconds(10), &error);
-      if (!reply) {
-        lines << "x\n";
-        continue;
-      }
-      lines << QRVClient::resultCode(*reply) << " " << reply->stringForKey("ReplyPath") << " "
-            << reply->boolForKey("ReplyExisted") << " ";
-      for (uint8_t b : reply->dataForKey("ReplyUUID")) lines << std::hex << static_cast<int>(b);
-      lines << std::dec << " " << reply->arrayForKey("ReplyIdsArray").size() << "\n";
-    }
-    return lines.str();
-  });
-  std::vector<std::string> result;
-  std::istringstream in(out.value_or("child-failed\n"));
-  for (std::string line; std::getline(in, line);) result.push_back(line);
-  return result;
-}
-
-std::vector<std::string> fields(const std::string& line) {
-  std::vector<std::string> f;
-  std::istringstream in(line);
-  for (std::string w; in >> w;) f.push_back(w);
-  return f;
 }
 
 class ContainersIntegrationTest : public testing::Test {
@@ -71,22 +36,21 @@ class ContainersIntegrationTest : public testing::Test {
 };
 
 TEST_F(ContainersIntegrationTest, AnApplicationGetsItsOwnDataContainer) {
-  auto replies = repliesAs(daemon_, kAppUID,
-                           {createRequest("com.example.app", 2), createRequest("com.example.app", 2),
-                            createRequest("com.example.other", 2)});
-  ASSERT_EQ(replies.size(), 3u);
-  auto first = fields(replies[0]), second = fields(replies[1]);
-  ASSERT_EQ(first.size(), 5u) << replies[0];
-  EXPECT_EQ(first[0], "1");
-  EXPECT_EQ(first[2], "0");  // created
-  EXPECT_EQ(second[2], "1");  // existed
-  EXPECT_EQ(second[1], first[1]);
-  EXPECT_EQ(second[3], first[3]);
-  EXPECT_EQ(fields(replies[2])[0], "55");
+  auto r = QRVRepliesAs(daemon_, kAppUID,
+                        {createRequest("com.example.app", 2), createRequest("com.example.app", 2),
+                         createRequest("com.example.other", 2)});
+  ASSERT_EQ(QRVClient::resultCode(r[0]), 1u) << r[0].description();
+  EXPECT_FALSE(r[0].boolForKey("ReplyExisted"));
+  EXPECT_TRUE(r[1].boolForKey("ReplyExisted"));
+  const std::string& path = r[0].stringForKey("ReplyPath");
+  EXPECT_EQ(r[1].stringForKey("ReplyPath"), path);
+  EXPECT_EQ(r[0].dataForKey("ReplyUUID").size(), 16u);
+  EXPECT_EQ(r[1].dataForKey("ReplyUUID"), r[0].dataForKey("ReplyUUID"));
+  // Another application's identifier is not the caller's to ask for.
+  EXPECT_EQ(QRVClient::resultCode(r[2]), 55u);
 
   // It lives in the mobile user's tree, owned by the caller, with its
   // default structure.
-  const std::string& path = first[1];
   EXPECT_EQ(path.rfind(daemon_.root() + "/private/var/mobile/Containers/Data/Application/", 0), 0u) << path;
   struct stat st;
   ASSERT_EQ(stat(path.c_str(), &st), 0);
@@ -95,23 +59,25 @@ TEST_F(ContainersIntegrationTest, AnApplicationGetsItsOwnDataContainer) {
 }
 
 TEST_F(ContainersIntegrationTest, InstallerCreatesListsAndLooksUpForOthers) {
-  QRVPlist list = QRVPlist::dictionary().set("Command", QRVPlist::uinteger(1)).set("ContainerClass",
-                                                                                   QRVPlist::uinteger(1));
-  auto replies = repliesAs(daemon_, kInstallerUID,
-                           {createRequest("com.example.a", 1), createRequest("com.example.b", 1), list,
-                            createRequest("com.example.a", 2, true), createRequest("com.example.a", 2, true)});
-  ASSERT_EQ(replies.size(), 5u);
-  EXPECT_EQ(fields(replies[0])[0], "1");
-  auto listed = fields(replies[2]);
-  EXPECT_EQ(listed[0], "1");
-  EXPECT_EQ(listed.back(), "2");  // two bundle containers
+  QRVPlist list =
+      QRVPlist::dictionary().set("Command", QRVPlist::uinteger(1)).set("ContainerClass", QRVPlist::uinteger(1));
+  auto r = QRVRepliesAs(daemon_, kInstallerUID,
+                        {createRequest("com.example.a", 1), createRequest("com.example.b", 1), list,
+                         createRequest("com.example.a", 2, true), createRequest("com.example.a", 2, true)});
+  ASSERT_EQ(QRVClient::resultCode(r[0]), 1u) << r[0].description();
+  EXPECT_EQ(QRVClient::resultCode(r[2]), 1u);
+  EXPECT_EQ(r[2].arrayForKey("ReplyIdsArray").size(), 2u);  // two bundle containers
   // Bundle containers belong to the installer account.
   struct stat st;
-  ASSERT_EQ(stat(fields(replies[0])[1].c_str(), &st), 0);
+  ASSERT_EQ(stat(r[0].stringForKey("ReplyPath").c_str(), &st), 0);
   EXPECT_EQ(st.st_uid, 33u);
   // Two transient requests: two different, fresh containers.
-  EXPECT_NE(fields(replies[3])[3], fields(replies[4])[3]);
-  EXPECT_FALSE(std::filesystem::exists(fields(replies[3])[1]));
+  ASSERT_EQ(QRVClient::resultCode(r[3]), 1u);
+  ASSERT_EQ(QRVClient::resultCode(r[4]), 1u);
+  EXPECT_NE(r[3].dataForKey("ReplyUUID"), r[4].dataForKey("ReplyUUID"));
+  // The first one is gone once the second replaced it.
+  EXPECT_FALSE(r[3].stringForKey("ReplyPath").empty());
+  EXPECT_FALSE(std::filesystem::exists(r[3].stringForKey("ReplyPath")));
 }
 
 }  // namespace

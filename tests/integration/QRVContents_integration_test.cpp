@@ -4,7 +4,6 @@
 #include <unistd.h>
 
 #include <filesystem>
-#include <sstream>
 
 #include "QRVClient.h"
 #include "QRVDaemonProcess.h"
@@ -19,31 +18,6 @@ const char* const kInstaller = "com.example.installer";
 
 QRVPlist request(uint64_t command) { return QRVPlist::dictionary().set("Command", QRVPlist::uinteger(command)); }
 
-QRVPlist containerRequest(uint64_t command, const QRVPlist::Bytes& uuid) {
-  return request(command)
-      .set("Identifier", QRVPlist::string(kInstaller))
-      .set("ContainerClass", QRVPlist::uinteger(2))
-      .set("UUID", QRVPlist::data(uuid));
-}
-
-// One line per reply: "code path existed infoValue diskUsage" ("-" for an
-// absent key).
-std::string render(const QRVPlist& reply) {
-  std::ostringstream line;
-  auto orDash = [](const std::string& s) { return s.empty() ? std::string("-") : s; };
-  line << QRVClient::resultCode(reply) << " " << orDash(reply.stringForKey("ReplyPath")) << " "
-       << reply.boolForKey("ReplyExisted") << " " << orDash(reply.stringForKey("ReplyInfoValue")) << " "
-       << reply.uint64ForKey("ReplyDiskUsage");
-  return line.str();
-}
-
-std::vector<std::string> fields(const std::string& line) {
-  std::vector<std::string> f;
-  std::istringstream in(line);
-  for (std::string w; in >> w;) f.push_back(w);
-  return f;
-}
-
 class ContentsIntegrationTest : public testing::Test {
  protected:
   void SetUp() override {
@@ -55,95 +29,83 @@ class ContentsIntegrationTest : public testing::Test {
                          .set("com.kelva.private.Quorva.stageSharedContent", QRVPlist::boolean(true)));
     daemon_.start();
   }
-
-  // Runs the whole conversation in one client process: the container's UUID
-  // from the first reply is used by the requests that follow.
-  std::vector<std::string> converse() {
-    auto out = QRVRunAs(kInstallerUID, kInstallerUID, [&] {
-      QRVClientError error;
-      auto client = QRVClient::connect(daemon_.root(), &error);
-      if (!client) return std::string("connect-failed\n");
-      std::ostringstream lines;
-      auto send = [&](const QRVPlist& r) -> std::optional<QRVPlist> {
-        auto reply = client->sendRequest(r, std::chrono::seconds(10), &error);
-        lines << (reply ? render(*reply) : std::string("x")) << "\n";
-        return reply;
-      };
-      auto created = send(request(0)
-                              .set("Identifier", QRVPlist::string(kInstaller))
-                              .set("ContainerClass", QRVPlist::uinteger(2))
-                              .set("CreateIfNecessary", QRVPlist::boolean(true)));
-      if (!created) return lines.str();
-      const QRVPlist::Bytes uuid = created->dataForKey("ReplyUUID");
-      send(containerRequest(5, uuid).set("Key", QRVPlist::string("k")).set("Value", QRVPlist::string("v")));  // 1
-      send(containerRequest(6, uuid).set("Key", QRVPlist::string("k")));                                      // 2
-      send(containerRequest(6, uuid).set("Key", QRVPlist::string("missing")));                                // 3
-      send(containerRequest(5, uuid).set("Key", QRVPlist::uinteger(3)));                                      // 4
-      send(containerRequest(23, uuid));                                                                       // 5
-      auto assets = request(28).set("Identifier", QRVPlist::string(kInstaller));
-      send(assets.set("CreateIfNecessary", QRVPlist::boolean(false)));                                       // 6
-      send(assets.set("CreateIfNecessary", QRVPlist::boolean(true)));                                        // 7
-      send(assets.set("IsRelative", QRVPlist::boolean(true)));                                               // 8
-      for (const char* path : {".", "..", "../Documents", "/etc/passwd"})                                    // 9-12
-        send(request(29).set("Identifier", QRVPlist::string(kInstaller)).set("SourcePath", QRVPlist::string(path)));
-      send(request(26)                                                                                       // 13
-               .set("Identifier", QRVPlist::string("systemgroup.com.example.shared"))
-               .set("SourcePath", QRVPlist::string("Library"))
-               .set("DestPath", QRVPlist::string("Library")));
-      send(containerRequest(9, uuid));                                                                       // 14
-      send(containerRequest(6, uuid).set("Key", QRVPlist::string("k")));                                      // 15
-      send(request(0).set("Identifier", QRVPlist::string(kInstaller)).set("ContainerClass", QRVPlist::uinteger(2)));
-      return lines.str();                                                                                    // 16
-    });
-    std::vector<std::string> result;
-    std::istringstream in(out.value_or("child-failed\n"));
-    for (std::string line; std::getline(in, line);) result.push_back(line);
-    return result;
-  }
-
   QRVDaemonProcess daemon_;
 };
 
 TEST_F(ContentsIntegrationTest, TheContentsCommandsWorkAndRefuseBadInputWhileTheDaemonKeepsServing) {
-  auto replies = converse();
-  ASSERT_EQ(replies.size(), 17u) << (replies.empty() ? "" : replies[0]);
-  auto created = fields(replies[0]);
-  ASSERT_EQ(created[0], "1") << replies[0];
-  const std::string container = created[1];
+  QRVPlist lookup =
+      request(0).set("Identifier", QRVPlist::string(kInstaller)).set("ContainerClass", QRVPlist::uinteger(2));
+  QRVPlist created =
+      QRVRepliesAs(daemon_, kInstallerUID, {QRVPlist(lookup).set("CreateIfNecessary", QRVPlist::boolean(true))})[0];
+  ASSERT_EQ(QRVClient::resultCode(created), 1u) << created.description();
+  const std::string container = created.stringForKey("ReplyPath");
+  // The container commands name it by identifier, class and UUID.
+  auto in = [&](uint64_t command) {
+    return QRVPlist(lookup)
+        .set("Command", QRVPlist::uinteger(command))
+        .set("UUID", QRVPlist::data(created.dataForKey("ReplyUUID")));
+  };
+  auto key = [](const char* k) { return QRVPlist::string(k); };
+  QRVPlist assets = request(28).set("Identifier", key(kInstaller));
+  auto source = [&](const char* path) {
+    return request(29).set("Identifier", key(kInstaller)).set("SourcePath", key(path));
+  };
+  std::vector<QRVPlist> requests = {
+      in(5).set("Key", key("k")).set("Value", key("v")),                    // 0
+      in(6).set("Key", key("k")),                                           // 1
+      in(6).set("Key", key("missing")),                                     // 2
+      in(5).set("Key", QRVPlist::uinteger(3)),                              // 3
+      in(23),                                                               // 4
+      QRVPlist(assets).set("CreateIfNecessary", QRVPlist::boolean(false)),  // 5
+      assets.set("CreateIfNecessary", QRVPlist::boolean(true)),             // 6
+      assets.set("IsRelative", QRVPlist::boolean(true)),                    // 7
+      source("."),                                                          // 8
+      source(".."),                                                         // 9
+      source("../Documents"),                                               // 10
+      source("/etc/passwd"),                                                // 11
+      request(26)                                                           // 12
+          .set("Identifier", key("systemgroup.com.example.shared"))
+          .set("SourcePath", key("Library"))
+          .set("DestPath", key("Library")),
+      in(9),                       // 13
+      in(6).set("Key", key("k")),  // 14
+      lookup,                      // 15
+  };
+  auto r = QRVRepliesAs(daemon_, kInstallerUID, requests);
 
-  EXPECT_EQ(fields(replies[1])[0], "1") << replies[1];
-  EXPECT_EQ(fields(replies[2])[0], "1");
-  EXPECT_EQ(fields(replies[2])[3], "v");
-  EXPECT_EQ(fields(replies[3])[0], "24");
-  EXPECT_EQ(fields(replies[4])[0], "38");
-  EXPECT_EQ(fields(replies[5])[0], "1") << replies[5];
-  EXPECT_GT(std::stoull(fields(replies[5])[4]), 0u);
+  EXPECT_EQ(QRVClient::resultCode(r[0]), 1u) << r[0].description();
+  EXPECT_EQ(QRVClient::resultCode(r[1]), 1u);
+  EXPECT_EQ(r[1].stringForKey("ReplyInfoValue"), "v");
+  EXPECT_EQ(QRVClient::resultCode(r[2]), 24u);
+  EXPECT_EQ(QRVClient::resultCode(r[3]), 38u);
+  EXPECT_EQ(QRVClient::resultCode(r[4]), 1u) << r[4].description();
+  EXPECT_GT(r[4].uint64ForKey("ReplyDiskUsage"), 0u);
 
-  EXPECT_EQ(fields(replies[6])[0], "71");
-  auto madeAssets = fields(replies[7]);
-  ASSERT_EQ(madeAssets[0], "1") << replies[7];
-  EXPECT_EQ(madeAssets[2], "0");
-  EXPECT_EQ(fs::path(madeAssets[1]).parent_path().string(), container);
-  auto relative = fields(replies[8]);
-  EXPECT_EQ(relative[1], fs::path(madeAssets[1]).filename().string());
-  EXPECT_EQ(relative[2], "1");
+  EXPECT_EQ(QRVClient::resultCode(r[5]), 71u);
+  ASSERT_EQ(QRVClient::resultCode(r[6]), 1u) << r[6].description();
+  const fs::path madeAssets = r[6].stringForKey("ReplyPath");
+  EXPECT_FALSE(r[6].boolForKey("ReplyExisted"));
+  EXPECT_EQ(madeAssets.parent_path().string(), container);
+  EXPECT_EQ(r[7].stringForKey("ReplyPath"), madeAssets.filename().string());
+  EXPECT_TRUE(r[7].boolForKey("ReplyExisted"));
 
-  for (int i = 9; i <= 11; i++) EXPECT_EQ(fields(replies[i])[0], "10") << replies[i];
-  EXPECT_EQ(fields(replies[12])[0], "11") << replies[12];
+  // Asset paths must stay strictly inside the assets directory.
+  for (int i = 8; i <= 10; i++) EXPECT_EQ(QRVClient::resultCode(r[i]), 10u) << r[i].description();
+  EXPECT_EQ(QRVClient::resultCode(r[11]), 11u) << r[11].description();
   EXPECT_TRUE(fs::exists("/etc/passwd"));
 
   // No code signing connected: no system group is granted.
-  EXPECT_EQ(fields(replies[13])[0], "55");
+  EXPECT_EQ(QRVClient::resultCode(r[12]), 55u);
 
-  EXPECT_EQ(fields(replies[14])[0], "1") << replies[14];
+  // A new directory UUID moves the container; the old UUID names nothing.
+  EXPECT_EQ(QRVClient::resultCode(r[13]), 1u) << r[13].description();
   EXPECT_FALSE(fs::exists(container));
-  // The old UUID names nothing; the identifier's container has moved.
-  EXPECT_EQ(fields(replies[15])[0], "21");
-  auto again = fields(replies[16]);
-  ASSERT_EQ(again[0], "1") << replies[16];
-  EXPECT_NE(again[1], container);
-  EXPECT_EQ(fs::path(again[1]).parent_path(), fs::path(container).parent_path());
-  EXPECT_TRUE(fs::is_directory(fs::path(again[1]) / fs::path(madeAssets[1]).filename()));
+  EXPECT_EQ(QRVClient::resultCode(r[14]), 21u);
+  ASSERT_EQ(QRVClient::resultCode(r[15]), 1u) << r[15].description();
+  const fs::path moved = r[15].stringForKey("ReplyPath");
+  EXPECT_NE(moved, container);
+  EXPECT_EQ(moved.parent_path(), fs::path(container).parent_path());
+  EXPECT_TRUE(fs::is_directory(moved / madeAssets.filename()));
   EXPECT_TRUE(daemon_.isRunning());
 }
 

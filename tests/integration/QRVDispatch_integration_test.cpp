@@ -4,17 +4,16 @@
 #include <fcntl.h>
 #include <poll.h>
 #include <sys/socket.h>
-#include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <cstring>
 #include <filesystem>
 
 #include "QRVClient.h"
 #include "QRVDaemonProcess.h"
 #include "QRVRunAs.h"
 #include "QRVWireFrame.h"
+#include "support/QRVEventually.h"
 
 namespace {
 
@@ -25,55 +24,29 @@ constexpr uid_t kStrangerUID = 2004;  // not in the trust store
 
 QRVPlist request(uint64_t command) { return QRVPlist::dictionary().set("Command", QRVPlist::uinteger(command)); }
 
-// Sends each request in turn from a process running as `uid` and returns
-// the result codes, space-separated ("x" for a request without reply).
-std::string resultsAs(const QRVDaemonProcess& daemon, uid_t uid, const std::vector<QRVPlist>& requests) {
-  auto out = QRVRunAs(uid, uid, [&] {
-    QRVClientError error;
-    auto client = QRVClient::connect(daemon.root(), &error);
-    if (!client) return std::string("connect-failed");
-    std::string codes;
-    for (const QRVPlist& r : requests) {
-      auto reply = client->sendRequest(r, std::chrono::seconds(10), &error);
-      codes += (codes.empty() ? "" : " ") + (reply ? std::to_string(QRVClient::resultCode(*reply)) : "x");
-    }
-    return codes;
-  });
-  return out.value_or("child-failed");
+// The result codes of the replies to `requests` sent from a process of `uid`.
+std::vector<uint64_t> codesAs(const QRVDaemonProcess& daemon, uid_t uid, const std::vector<QRVPlist>& requests) {
+  std::vector<uint64_t> codes;
+  for (const QRVPlist& reply : QRVRepliesAs(daemon, uid, requests)) codes.push_back(QRVClient::resultCode(reply));
+  return codes;
+}
+using Codes = std::vector<uint64_t>;
+
+// Raw writes on a client's socket, for frames the client library would
+// never send.
+bool sendRaw(const QRVClient& client, const std::vector<uint8_t>& bytes) {
+  return ::send(client.fd(), bytes.data(), bytes.size(), MSG_NOSIGNAL) == static_cast<ssize_t>(bytes.size());
 }
 
-// A raw connection for frames the client library would never send.
-class RawSocket {
- public:
-  explicit RawSocket(const std::string& path) {
-    fd_ = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-    sockaddr_un addr{};
-    addr.sun_family = AF_UNIX;
-    strncpy(addr.sun_path, path.c_str(), sizeof addr.sun_path - 1);
-    connected_ = connect(fd_, reinterpret_cast<sockaddr*>(&addr), sizeof addr) == 0;
+// True when the daemon closes the connection within the timeout (replies it
+// sent first are read and dropped).
+bool closedByPeer(const QRVClient& client, int timeoutMs = 5000) {
+  for (char buf[4096];;) {
+    pollfd p{client.fd(), POLLIN, 0};
+    if (poll(&p, 1, timeoutMs) <= 0) return false;
+    if (recv(client.fd(), buf, sizeof buf, 0) <= 0) return true;
   }
-  ~RawSocket() { close(fd_); }
-  bool connected() const { return connected_; }
-  int fd() const { return fd_; }
-  bool sendBytes(const std::vector<uint8_t>& bytes) {
-    return ::send(fd_, bytes.data(), bytes.size(), MSG_NOSIGNAL) == static_cast<ssize_t>(bytes.size());
-  }
-  // True when the daemon closes the connection within the timeout (replies
-  // it sent first are read and dropped).
-  bool closedByPeer(int timeoutMs = 5000) {
-    for (;;) {
-      pollfd p{fd_, POLLIN, 0};
-      if (poll(&p, 1, timeoutMs) <= 0) return false;
-      char buf[4096];
-      ssize_t n = recv(fd_, buf, sizeof buf, 0);
-      if (n <= 0) return true;
-    }
-  }
-
- private:
-  int fd_ = -1;
-  bool connected_ = false;
-};
+}
 
 std::vector<uint8_t> frame(uint32_t length, uint32_t flags, uint64_t id, const std::vector<uint8_t>& body) {
   std::vector<uint8_t> bytes(QRVWireFrame::kHeaderSize);
@@ -99,51 +72,44 @@ class DispatchIntegrationTest : public testing::Test {
   std::chrono::milliseconds startup_{0};
 };
 
-TEST_F(DispatchIntegrationTest, CommandsAreGatedByTheCallersEntitlements) {
+TEST_F(DispatchIntegrationTest, CommandsAreDispatchedByNumberAndGatedByTheCallersEntitlements) {
   RecordProperty("startup_ms", static_cast<int>(startup_.count()));
   QRVPlist retry = request(25).set("NumRetryCrashes", QRVPlist::uinteger(0));
-  // Unknown numbers and the retired command are invalid for everybody.
-  EXPECT_EQ(resultsAs(daemon_, kAllowedUID, {request(32), request(27), retry}), "49 49 55");
-  EXPECT_EQ(resultsAs(daemon_, kPlainUID, {request(27), request(32), retry}), "49 49 55");
-  EXPECT_EQ(resultsAs(daemon_, kStrangerUID, {retry}), "55");
-  EXPECT_EQ(resultsAs(daemon_, kTesterUID, {retry}), "1");
-  EXPECT_TRUE(daemon_.logEventuallyContains("command=25, client=com.example.plain, error=55"));
-  EXPECT_TRUE(daemon_.logEventuallyContains("connection attempt from pid"));
-}
-
-TEST_F(DispatchIntegrationTest, AbsentCommandIsCommandZero) {
   // Without "Command" the request is a create-or-lookup: the caller gets its
   // own container, and a request without an identifier is refused with 18.
   QRVPlist create = QRVPlist::dictionary()
                         .set("Identifier", QRVPlist::string("com.example.plain"))
                         .set("ContainerClass", QRVPlist::uinteger(2))
                         .set("CreateIfNecessary", QRVPlist::boolean(true));
-  EXPECT_EQ(resultsAs(daemon_, kPlainUID, {create, QRVPlist::dictionary()}), "1 18");
+  // Unknown numbers and the retired command are invalid for everybody,
+  // entitled or not.
+  EXPECT_EQ(codesAs(daemon_, kAllowedUID, {request(32), request(27), retry}), Codes({49, 49, 55}));
+  EXPECT_EQ(codesAs(daemon_, kPlainUID, {request(27), request(32), retry, create, QRVPlist::dictionary()}),
+            Codes({49, 49, 55, 1, 18}));
+  EXPECT_EQ(codesAs(daemon_, kStrangerUID, {retry}), Codes({55}));
+  EXPECT_EQ(codesAs(daemon_, kTesterUID, {retry}), Codes({1}));
+  EXPECT_TRUE(daemon_.logEventuallyContains("command=25, client=com.example.plain, error=55"));
   EXPECT_TRUE(daemon_.logEventuallyContains("command=0, client=com.example.plain, error=1"));
   EXPECT_TRUE(daemon_.logEventuallyContains("command=0, client=com.example.plain, error=18"));
+  EXPECT_TRUE(daemon_.logEventuallyContains("connection attempt from pid"));
 }
 
 TEST_F(DispatchIntegrationTest, PipelinedRequestsAreAnsweredInOrder) {
-  auto out = QRVRunAs(kPlainUID, kPlainUID, [&] {
-    QRVClientError error;
-    auto client = QRVClient::connect(daemon_.root(), &error);
-    if (!client) return std::string("connect-failed");
-    std::vector<uint64_t> ids;
-    for (int i = 0; i < 200; i++) {
-      auto id = client->send(request(i % 2 ? 25 : 32), std::chrono::seconds(10), &error);
-      if (!id) return "send failed: " + error.message;
-      ids.push_back(*id);
-    }
-    for (int i = 0; i < 200; i++) {
-      auto reply = client->receive(std::chrono::seconds(10), &error);
-      if (!reply) return "receive failed: " + error.message;
-      uint64_t expected = i % 2 ? 55 : 49;
-      if (reply->messageId != ids[i] || QRVClient::resultCode(reply->body) != expected)
-        return "reply " + std::to_string(i) + " out of order";
-    }
-    return std::string("ok");
-  });
-  EXPECT_EQ(out.value_or("child failed"), "ok");
+  QRVClientError error;
+  auto client = QRVClient::connect(daemon_.root(), &error);
+  ASSERT_TRUE(client) << error.message;
+  std::vector<uint64_t> ids;
+  for (int i = 0; i < 200; i++) {
+    auto id = client->send(request(i % 2 ? 25 : 32), std::chrono::seconds(10), &error);
+    ASSERT_TRUE(id) << error.message;
+    ids.push_back(*id);
+  }
+  for (int i = 0; i < 200; i++) {
+    auto reply = client->receive(std::chrono::seconds(10), &error);
+    ASSERT_TRUE(reply) << error.message;
+    ASSERT_EQ(reply->messageId, ids[i]) << "reply " << i;
+    ASSERT_EQ(QRVClient::resultCode(reply->body), i % 2 ? 55u : 49u) << "reply " << i;
+  }
 }
 
 TEST_F(DispatchIntegrationTest, BadFramesCloseOnlyTheirOwnConnection) {
@@ -159,25 +125,20 @@ TEST_F(DispatchIntegrationTest, BadFramesCloseOnlyTheirOwnConnection) {
       {"not a dictionary", frame(static_cast<uint32_t>(array.size()), 1, 1, array)},
       {"garbage body", frame(8, 1, 1, {1, 2, 3, 4, 5, 6, 7, 8})},
       {"no reply context", frame(static_cast<uint32_t>(dict.size()), 0, 1, dict)},
+      // Half a frame, then the client stops writing.
+      {"truncated", frame(100, 1, 1, {1, 2, 3})},
   };
   for (const auto& [what, bytes] : bad) {
-    RawSocket s(daemon_.socketPath());
-    ASSERT_TRUE(s.connected());
-    ASSERT_TRUE(s.sendBytes(bytes)) << what;
-    EXPECT_TRUE(s.closedByPeer()) << what;
+    auto s = QRVClient::connect(daemon_.root(), &error);
+    ASSERT_TRUE(s && sendRaw(*s, bytes)) << what;
+    if (what == "truncated") shutdown(s->fd(), SHUT_WR);
+    EXPECT_TRUE(closedByPeer(*s)) << what;
   }
-  {
-    // Truncated: half a frame, then the client goes away.
-    RawSocket s(daemon_.socketPath());
-    ASSERT_TRUE(s.sendBytes(frame(100, 1, 1, {1, 2, 3})));
-    shutdown(s.fd(), SHUT_WR);
-    EXPECT_TRUE(s.closedByPeer());
-  }
-  {
-    // A client that disconnects right after asking.
-    RawSocket s(daemon_.socketPath());
-    ASSERT_TRUE(s.sendBytes(frame(static_cast<uint32_t>(dict.size()), 1, 1, dict)));
-  }
+  // A client that disconnects right after asking.
+  auto gone = QRVClient::connect(daemon_.root(), &error);
+  ASSERT_TRUE(gone && sendRaw(*gone, frame(static_cast<uint32_t>(dict.size()), 1, 1, dict)));
+  gone.reset();
+
   auto reply = good->sendRequest(request(32), std::chrono::seconds(5), &error);
   ASSERT_TRUE(reply) << error.message;
   EXPECT_EQ(QRVClient::resultCode(*reply), 49u);
@@ -187,10 +148,11 @@ TEST_F(DispatchIntegrationTest, BadFramesCloseOnlyTheirOwnConnection) {
 }
 
 TEST_F(DispatchIntegrationTest, ClientThatNeverReadsIsCutOffWithoutSlowingOthers) {
-  RawSocket slow(daemon_.socketPath());
-  ASSERT_TRUE(slow.connected());
-  int flags = fcntl(slow.fd(), F_GETFL);
-  fcntl(slow.fd(), F_SETFL, flags | O_NONBLOCK);
+  QRVClientError error;
+  auto slow = QRVClient::connect(daemon_.root(), &error);
+  ASSERT_TRUE(slow) << error.message;
+  int flags = fcntl(slow->fd(), F_GETFL);
+  fcntl(slow->fd(), F_SETFL, flags | O_NONBLOCK);
   std::vector<uint8_t> dict = request(32).toBinary();
   std::vector<uint8_t> one = frame(static_cast<uint32_t>(dict.size()), 1, 1, dict);
   // Ask until the daemon stops taking requests (for 300 ms): its replies are
@@ -198,7 +160,7 @@ TEST_F(DispatchIntegrationTest, ClientThatNeverReadsIsCutOffWithoutSlowingOthers
   size_t sent = 0;
   auto lastAccepted = std::chrono::steady_clock::now();
   for (int round = 0; round < 500; round++) {
-    while (::send(slow.fd(), one.data(), one.size(), MSG_NOSIGNAL) > 0) {
+    while (::send(slow->fd(), one.data(), one.size(), MSG_NOSIGNAL) > 0) {
       sent++;
       lastAccepted = std::chrono::steady_clock::now();
     }
@@ -207,24 +169,24 @@ TEST_F(DispatchIntegrationTest, ClientThatNeverReadsIsCutOffWithoutSlowingOthers
   }
   EXPECT_GT(sent, 0u);
   // Everybody else is still served at once.
-  EXPECT_EQ(resultsAs(daemon_, kPlainUID, {request(27)}), "49");
+  EXPECT_EQ(codesAs(daemon_, kPlainUID, {request(27)}), Codes({49}));
   // After the stall timeout the slow client is closed.
-  fcntl(slow.fd(), F_SETFL, flags);
+  fcntl(slow->fd(), F_SETFL, flags);
   EXPECT_TRUE(daemon_.logEventuallyContains("client is not reading its replies", std::chrono::seconds(10)));
-  EXPECT_TRUE(slow.closedByPeer(10'000));
+  EXPECT_TRUE(closedByPeer(*slow, 10'000));
   EXPECT_TRUE(daemon_.isRunning());
 }
 
 TEST_F(DispatchIntegrationTest, RetryTestCrashesTheDaemonAsOftenAsAsked) {
   QRVPlist retry = request(25).set("NumRetryCrashes", QRVPlist::uinteger(1));
   // The first attempt takes the daemon down without a reply...
-  EXPECT_EQ(resultsAs(daemon_, kTesterUID, {retry}), "x");
+  EXPECT_EQ(codesAs(daemon_, kTesterUID, {retry}), Codes({0}));
   auto status = daemon_.waitForExit(std::chrono::seconds(10));
   ASSERT_TRUE(status.has_value());
   EXPECT_TRUE(WIFSIGNALED(*status) || WEXITSTATUS(*status) != 0);
   // ...and the retry after the restart succeeds.
   daemon_.start({"--write-stall-timeout", "1000"});
-  EXPECT_EQ(resultsAs(daemon_, kTesterUID, {retry}), "1");
+  EXPECT_EQ(codesAs(daemon_, kTesterUID, {retry}), Codes({1}));
 }
 
 TEST_F(DispatchIntegrationTest, SecondStartInTheSameBootSkipsTheBootWork) {
@@ -232,16 +194,14 @@ TEST_F(DispatchIntegrationTest, SecondStartInTheSameBootSkipsTheBootWork) {
   const std::string cleanupDone = daemon_.root() + "/run/quorva/notify/com.kelva.quorvad.cleanup-complete";
   // The notification is posted right after the line is logged.
   ASSERT_TRUE(daemon_.logEventuallyContains("quorvad first boot cleanup complete"));
-  for (int i = 0; i < 1000 && !std::filesystem::exists(rebootDone); i++) usleep(10'000);
-  EXPECT_TRUE(std::filesystem::exists(rebootDone));
+  EXPECT_TRUE(QRVEventually([&] { return std::filesystem::exists(rebootDone); }, std::chrono::seconds(10)));
   daemon_.stop();
   std::filesystem::remove(rebootDone);
   std::filesystem::remove(cleanupDone);
   size_t before = daemon_.readLog().size();
 
   daemon_.start();
-  for (int i = 0; i < 1000 && !std::filesystem::exists(cleanupDone); i++) usleep(10'000);
-  EXPECT_TRUE(std::filesystem::exists(cleanupDone));
+  EXPECT_TRUE(QRVEventually([&] { return std::filesystem::exists(cleanupDone); }, std::chrono::seconds(10)));
   std::string second = daemon_.readLog().substr(before);
   EXPECT_EQ(second.find("performing first boot initialization"), std::string::npos);
   EXPECT_EQ(second.find("reboot set-up"), std::string::npos);

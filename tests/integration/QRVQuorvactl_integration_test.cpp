@@ -29,6 +29,14 @@ ToolRun quorvactl(const std::string& arguments) {
   return run;
 }
 
+// The string value of `key` in quorvactl's JSON output; empty when absent.
+std::string jsonString(const std::string& json, const std::string& key) {
+  size_t at = json.find("\"" + key + "\": \"");
+  if (at == std::string::npos) return {};
+  at += key.size() + 5;
+  return json.substr(at, json.find('"', at) - at);
+}
+
 class QuorvactlIntegrationTest : public testing::Test {
  protected:
   void SetUp() override {
@@ -53,11 +61,8 @@ TEST_F(QuorvactlIntegrationTest, LookupFeedsTypedCallsListsAndRefuses) {
   EXPECT_NE(created.out.find("\"ReplyExisted\": false"), std::string::npos) << created.out;
   EXPECT_NE(created.out.find("\"ReplyIdentifier\": \"com.example.ctl\""), std::string::npos) << created.out;
   // The path printed is a directory the daemon made.
-  size_t at = created.out.find("\"ReplyPath\": \"");
-  ASSERT_NE(at, std::string::npos);
-  at += 14;
-  std::string path = created.out.substr(at, created.out.find('"', at) - at);
-  EXPECT_TRUE(std::filesystem::is_directory(path)) << path;
+  std::string path = jsonString(created.out, "ReplyPath");
+  ASSERT_TRUE(std::filesystem::is_directory(path)) << created.out;
 
   // Looked up again (human output), it now existed.
   ToolRun again = quorvactl(root_ + " lookup --id com.example.ctl --class 1");
@@ -66,14 +71,13 @@ TEST_F(QuorvactlIntegrationTest, LookupFeedsTypedCallsListsAndRefuses) {
   EXPECT_NE(again.out.find("ReplyPath = " + path), std::string::npos) << again.out;
 
   // The UUID as --json prints it feeds the calls that need one.
-  at = created.out.find("\"ReplyUUID\": \"");
-  ASSERT_NE(at, std::string::npos);
-  std::string uuid = created.out.substr(at + 14, 32);
+  std::string uuid = jsonString(created.out, "ReplyUUID");
+  ASSERT_EQ(uuid.size(), 32u) << created.out;
   std::string container = " --id com.example.ctl --class 1 --uuid " + uuid;
   EXPECT_EQ(quorvactl(root_ + " info-set" + container + " --key Color --value blue").status, 0);
   ToolRun info = quorvactl(root_ + " --json info-get" + container + " --key Color");
   EXPECT_EQ(info.status, 0) << info.out;
-  EXPECT_NE(info.out.find("\"ReplyInfoValue\": \"blue\""), std::string::npos) << info.out;
+  EXPECT_EQ(jsonString(info.out, "ReplyInfoValue"), "blue") << info.out;
   ToolRun metadata = quorvactl(root_ + " --json metadata --info" + container);
   EXPECT_EQ(metadata.status, 0) << metadata.out;
   EXPECT_NE(metadata.out.find("\"Color\": \"blue\""), std::string::npos) << metadata.out;
