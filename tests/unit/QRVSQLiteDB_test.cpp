@@ -15,6 +15,8 @@
 #include <fstream>
 #include <iterator>
 
+#include "support/QRVTestServices.h"
+
 // Failures print entries as their description.
 inline void PrintTo(const QRVCodeSigningEntry& e, std::ostream* os) { *os << e.description(); }
 
@@ -24,11 +26,6 @@ using ::testing::Not;
 using ::testing::UnorderedElementsAre;
 
 namespace {
-
-fs::path makeTempDir() {
-  std::string pattern = (fs::temp_directory_path() / "qrvdb.XXXXXX").string();
-  return mkdtemp(pattern.data()) ? fs::path(pattern) : fs::path();
-}
 
 QRVPlist infoWith(const std::string& marker) {
   QRVPlist entitlements;
@@ -61,15 +58,11 @@ struct LogCapture {
 class QRVSQLiteDBTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    dir_ = makeTempDir();
     ASSERT_FALSE(dir_.empty());
     db_ = QRVSQLiteDB::initWithParentDirectoryURL(dir_);
     ASSERT_TRUE(db_);
   }
-  void TearDown() override {
-    db_.reset();
-    fs::remove_all(dir_);
-  }
+  void TearDown() override { db_.reset(); }
 
   void exec(const std::string& sql) {
     ASSERT_EQ(sqlite3_exec(db_->db(), sql.c_str(), nullptr, nullptr, nullptr), SQLITE_OK) << sql;
@@ -87,11 +80,12 @@ class QRVSQLiteDBTest : public ::testing::Test {
   int64_t rowId(std::string_view identifier) {
     return scalar("SELECT id FROM code_signing_info WHERE code_signing_id_text=?", identifier);
   }
+  int64_t count(const std::string& table) { return scalar("SELECT count(*) FROM " + table); }
   void setBlob(std::string_view identifier, const void* bytes, int length) {
     sqlite3_stmt* s = nullptr;
     sqlite3_prepare_v2(db_->db(),
-                       "UPDATE code_signing_data SET data=?1 WHERE cs_info_id=(SELECT id FROM "
-                       "code_signing_info WHERE code_signing_id_text=?2)",
+                       "UPDATE code_signing_data SET data=?1 WHERE cs_info_id=(SELECT id FROM code_signing_info "
+                       "WHERE code_signing_id_text=?2)",
                        -1, &s, nullptr);
     sqlite3_bind_blob(s, 1, bytes, length, SQLITE_TRANSIENT);
     sqlite3_bind_text64(s, 2, identifier.data(), identifier.size(), SQLITE_TRANSIENT, SQLITE_UTF8);
@@ -105,24 +99,30 @@ class QRVSQLiteDBTest : public ::testing::Test {
     if (!entry) ADD_FAILURE() << error.description();
     return entry ? *entry : QRVCodeSigningEntry();
   }
-  std::vector<std::string> identifiers() {
-    QRVError error;
-    auto all = db_->identifiersWithError(&error);
-    if (!all) ADD_FAILURE() << error.description();
-    return all.value_or(std::vector<std::string>());
+  std::vector<std::string> children(std::string_view identifier) {
+    return lookUp(identifier).childBundleIdentifiers().value_or(std::vector<std::string>());
   }
   void add(const QRVCodeSigningEntry& entry, std::string_view identifier) {
     QRVError error;
     ASSERT_TRUE(db_->addCodeSigningEntry(&entry, identifier, &error)) << error.description();
   }
 
-  fs::path dir_;
+  // The code a call that took `&error_` failed with; 0 when it succeeded.
+  // Clears the error, so that no result is read from an earlier call.
+  uint64_t failed(bool ok) {
+    uint64_t code = ok ? 0 : error_.code();
+    error_ = QRVError();
+    return code;
+  }
+
+  QRVError error_;
+  QRVTemporaryDirectory temporary_;
+  const fs::path dir_ = temporary_.path();
   std::unique_ptr<QRVSQLiteDB> db_;
 };
 
 std::string runSqlite3(const fs::path& file, const std::string& command) {
-  std::string line = "sqlite3 '" + file.string() + "' '" + command + "' 2>&1";
-  FILE* p = popen(line.c_str(), "r");
+  FILE* p = popen(("sqlite3 '" + file.string() + "' '" + command + "' 2>&1").c_str(), "r");
   std::string out;
   char buffer[4096];
   for (size_t n; p && (n = fread(buffer, 1, sizeof buffer, p)) > 0;) out.append(buffer, n);
@@ -130,21 +130,19 @@ std::string runSqlite3(const fs::path& file, const std::string& command) {
   return out;
 }
 
-// MARK: - Schema and lifecycle
+// MARK: - Opening
 
-TEST_F(QRVSQLiteDBTest, CreatesTheSchemaAndHoldsTheFileExclusively) {
+TEST_F(QRVSQLiteDBTest, HoldsTheFileExclusivelyAndReopensOverExistingTables) {
   if (system("command -v sqlite3 >/dev/null 2>&1") != 0) GTEST_SKIP() << "no sqlite3 binary";
   const fs::path file = dir_ / "containers.sqlite3";
   EXPECT_EQ(db_->url(), file);
-  EXPECT_EQ(scalar("PRAGMA foreign_keys"), 1);
+  EXPECT_EQ(scalar("PRAGMA foreign_keys"), 1);  // the cascades depend on it
   add(entryWith("x"), "com.example.app");
-
   // Exclusive locking keeps every other process out while the daemon runs.
-  EXPECT_THAT(runSqlite3(file, "SELECT count(*) FROM code_signing_info;"),
-              HasSubstr("database is locked"));
+  EXPECT_THAT(runSqlite3(file, "SELECT count(*) FROM code_signing_info;"), HasSubstr("database is locked"));
 
   db_->closeDB();
-  EXPECT_EQ(db_->db(), nullptr);
+  // The file outlives daemon versions: its tables are pinned word for word.
   EXPECT_EQ(
       runSqlite3(file, ".schema"),
       "CREATE TABLE code_signing_info(id INTEGER PRIMARY KEY AUTOINCREMENT,code_signing_id_text "
@@ -162,69 +160,51 @@ TEST_F(QRVSQLiteDBTest, CreatesTheSchemaAndHoldsTheFileExclusively) {
       "CREATE INDEX cs_info_id_idx ON code_signing_data(cs_info_id);\n"
       "CREATE INDEX parent_id_idx ON child_bundles(parent_id);\n");
   EXPECT_EQ(runSqlite3(file, "PRAGMA journal_mode;"), "wal\n");
-
-  // Reopening runs the script again over the existing tables.
+  EXPECT_EQ(failed(db_->identifiersWithError(&error_).has_value()), 66u);  // closed: every call fails
   db_ = QRVSQLiteDB::initWithParentDirectoryURL(dir_);
   EXPECT_TRUE(db_->codeSigningEntryWithIdentifier("com.example.app", nullptr));
 }
 
-// MARK: - Failures that end the daemon
-
-void expectOpenDies(const fs::path& dir, const std::string& message) {
+// Every entitlement decision depends on the database, so the daemon must not
+// run on without it.
+TEST(QRVSQLiteDBDeathTest, AFileThatCannotBeOpenedOrSetUpTerminates) {
   // "fast" (fork) style: the child must not re-run the test's set-up, which
   // for the locked file would start a second lock holder.
   GTEST_FLAG_SET(death_test_style, "fast");
-  EXPECT_DEATH(QRVSQLiteDB::initWithParentDirectoryURL(dir), message);
-}
+  QRVTemporaryDirectory missing, corrupt, held;
+  EXPECT_DEATH(QRVSQLiteDB::initWithParentDirectoryURL(fs::path(missing.path()) / "missing"),
+               "opening .*containers.sqlite3 failed: unable to open database file.*Failed to open database, err = 14");
 
-TEST(QRVSQLiteDBDeathTest, UnopenableFileTerminates) {
-  fs::path dir = makeTempDir();
-  expectOpenDies(dir / "missing",
-                 "opening .*containers.sqlite3 failed: unable to open "
-                 "database file.*Failed to open database, err = 14");
-  fs::remove_all(dir);
-}
+  std::ofstream(fs::path(corrupt.path()) / "containers.sqlite3") << std::string(8192, 'Z');
+  EXPECT_DEATH(QRVSQLiteDB::initWithParentDirectoryURL(corrupt.path()),
+               "table create for .* failed: file is not a database.*Failed to initialize database, err = 26");
 
-TEST(QRVSQLiteDBDeathTest, CorruptFileTerminates) {
-  fs::path dir = makeTempDir();
-  std::ofstream(dir / "containers.sqlite3") << std::string(8192, 'Z');
-  expectOpenDies(dir,
-                 "table create for .* failed: file is not a database.*Failed to "
-                 "initialize database, err = 26");
-  fs::remove_all(dir);
-}
-
-TEST(QRVSQLiteDBDeathTest, FileHeldByAnotherProcessTerminates) {
-  fs::path dir = makeTempDir();
   int ready[2];
   ASSERT_EQ(pipe(ready), 0);
   pid_t holder = fork();
   ASSERT_GE(holder, 0);
   if (holder == 0) {
     sqlite3* db = nullptr;
-    sqlite3_open((dir / "containers.sqlite3").c_str(), &db);
-    bool locked = sqlite3_exec(db, "BEGIN EXCLUSIVE;", nullptr, nullptr, nullptr) == SQLITE_OK;
-    char c = locked ? 'y' : 'n';
+    sqlite3_open((fs::path(held.path()) / "containers.sqlite3").c_str(), &db);
+    char c = sqlite3_exec(db, "BEGIN EXCLUSIVE;", nullptr, nullptr, nullptr) == SQLITE_OK ? 'y' : 'n';
     (void)!write(ready[1], &c, 1);
     pause();
     _exit(0);
   }
   char c = 0;
-  ASSERT_EQ(read(ready[0], &c, 1), 1);
-  ASSERT_EQ(c, 'y');
-  expectOpenDies(dir,
-                 "table create for .* failed: database is locked.*Failed to "
-                 "initialize database, err = 5");
+  EXPECT_EQ(read(ready[0], &c, 1), 1);
+  EXPECT_EQ(c, 'y');
+  EXPECT_DEATH(QRVSQLiteDB::initWithParentDirectoryURL(held.path()),
+               "table create for .* failed: database is locked.*Failed to initialize database, err = 5");
   kill(holder, SIGKILL);
   waitpid(holder, nullptr, 0);
   close(ready[0]);
   close(ready[1]);
-  fs::remove_all(dir);
 }
 
 // MARK: - Adding and updating
 
-TEST_F(QRVSQLiteDBTest, AddingAgainUpdatesInPlaceAndKeepsChildren) {
+TEST_F(QRVSQLiteDBTest, AddingAgainUpdatesInPlaceKeepsChildrenAndMovesClaimedChildren) {
   QRVCodeSigningEntry first = entryWith("v1", {{"com.example.app.one"}});
   first.setRegisteredByCaller(true);
   add(first, "com.example.app");
@@ -235,122 +215,91 @@ TEST_F(QRVSQLiteDBTest, AddingAgainUpdatesInPlaceAndKeepsChildren) {
   second.setInvalid(true);
   second.setDataContainerClass(4);
   add(second, "com.example.app");
-
   EXPECT_EQ(rowId("com.example.app"), id);
-  EXPECT_EQ(scalar("SELECT count(*) FROM code_signing_data"), 1);
+  EXPECT_EQ(count("code_signing_data"), 1);
   EXPECT_EQ(scalar("SELECT cs_info_id FROM code_signing_data"), id);
   QRVCodeSigningEntry stored = lookUp("com.example.app");
   EXPECT_EQ(stored.codeSigningInfo(), infoWith("v2"));
   EXPECT_TRUE(stored.isInvalid());
   EXPECT_FALSE(stored.isRegisteredByCaller());
   EXPECT_EQ(stored.dataContainerClass(), 4u);
-  EXPECT_THAT(stored.childBundleIdentifiers().value_or(std::vector<std::string>()),
-              UnorderedElementsAre("com.example.app.one", "com.example.app.two"));
-}
+  EXPECT_THAT(children("com.example.app"), UnorderedElementsAre("com.example.app.one", "com.example.app.two"));
 
-TEST_F(QRVSQLiteDBTest, ChildMovesToItsNewParent) {
-  add(entryWith("a", {{"com.example.plugin"}}), "com.example.a");
-  add(entryWith("b", {{"com.example.plugin"}}), "com.example.b");
-  EXPECT_EQ(db_->parentIdentifierForChildIdentifier("com.example.plugin", nullptr),
-            "com.example.b");
-  QRVError error;
-  EXPECT_FALSE(db_->childIdentifiersForParentIdentifier("com.example.a", &error));
-  EXPECT_EQ(error.code(), 67u);
-  EXPECT_EQ(scalar("SELECT count(*) FROM child_bundles"), 1);
+  // A child claimed by another parent moves to it.
+  add(entryWith("b", {{"com.example.app.one"}}), "com.example.b");
+  EXPECT_EQ(db_->parentIdentifierForChildIdentifier("com.example.app.one", nullptr), "com.example.b");
+  EXPECT_THAT(children("com.example.app"), UnorderedElementsAre("com.example.app.two"));
+  EXPECT_EQ(count("child_bundles"), 2);
 }
 
 TEST_F(QRVSQLiteDBTest, RefusedChildIsSkippedButRefusedDataRollsBack) {
   exec(
-      "CREATE TEMP TRIGGER refuse_child BEFORE INSERT ON child_bundles WHEN "
-      "NEW.child_code_signing_id_text='bad' BEGIN SELECT RAISE(ABORT, 'refused'); END;");
+      "CREATE TEMP TRIGGER refuse_child BEFORE INSERT ON child_bundles WHEN NEW.child_code_signing_id_text='bad' "
+      "BEGIN SELECT RAISE(ABORT, 'refused'); END;");
   add(entryWith("p", {{"bad", "good"}}), "com.example.parent");
-  EXPECT_THAT(
-      lookUp("com.example.parent").childBundleIdentifiers().value_or(std::vector<std::string>()),
-      UnorderedElementsAre("good"));
+  EXPECT_THAT(children("com.example.parent"), UnorderedElementsAre("good"));
 
-  exec(
-      "CREATE TEMP TRIGGER refuse_data BEFORE INSERT ON code_signing_data BEGIN "
-      "SELECT RAISE(ABORT, 'no data'); END;");
+  exec("CREATE TEMP TRIGGER refuse_data BEFORE INSERT ON code_signing_data BEGIN SELECT RAISE(ABORT, 'no'); END;");
   QRVCodeSigningEntry entry = entryWith("q");
-  QRVError error;
-  EXPECT_FALSE(db_->addCodeSigningEntry(&entry, "com.example.new", &error));
-  EXPECT_EQ(error.code(), 66u);
-  EXPECT_THAT(error.message(), HasSubstr("sqlite3_step for"));
+  EXPECT_EQ(failed(db_->addCodeSigningEntry(&entry, "com.example.new", &error_)), 66u);
   EXPECT_EQ(rowId("com.example.new"), -1);  // the info row went with the rollback
 }
 
 TEST_F(QRVSQLiteDBTest, RefusesMissingArguments) {
-  QRVCodeSigningEntry entry = entryWith("x");
-  QRVError error;
-  EXPECT_FALSE(db_->addCodeSigningEntry(nullptr, "a", &error));
-  EXPECT_EQ(error.code(), 38u);
-  EXPECT_EQ(error.message(), "codeSigningEntry (null) and identifier a cannot be nil");
-  EXPECT_FALSE(db_->addCodeSigningEntry(&entry, std::nullopt, &error));
-  EXPECT_EQ(error.code(), 38u);
-  EXPECT_FALSE(db_->deleteCodeSigningEntryWithIdentifier(std::nullopt, &error));
-  EXPECT_EQ(error.message(), "\bidentifier (null) cannot be nil");
-
-  QRVCodeSigningEntry noDictionary;
-  EXPECT_FALSE(db_->addCodeSigningEntry(&noDictionary, "a", &error));
-  EXPECT_EQ(error.message(), "Error creating KLData from code signing info: (null)");
+  QRVCodeSigningEntry entry = entryWith("x"), noDictionary;
+  EXPECT_EQ(failed(db_->addCodeSigningEntry(nullptr, "a", &error_)), 38u);
+  EXPECT_EQ(failed(db_->addCodeSigningEntry(&entry, std::nullopt, &error_)), 38u);
+  EXPECT_EQ(failed(db_->deleteCodeSigningEntryWithIdentifier(std::nullopt, &error_)), 38u);
+  EXPECT_EQ(failed(db_->addCodeSigningEntry(&noDictionary, "a", &error_)), 66u);
   EXPECT_EQ(rowId("a"), -1);
 }
 
-// MARK: - Flags and advance copies
-
 TEST_F(QRVSQLiteDBTest, AdvanceCopiesShareTheFlagWordAndAreDeletedWholesale) {
-  QRVCodeSigningEntry both = entryWith("both", {{"com.example.both.child"}});
+  QRVCodeSigningEntry both = entryWith("both", {{"com.example.both.child"}}), advance = entryWith("advance"),
+                      placeholder = entryWith("placeholder");
   both.setPlaceholder(true);
   both.setAdvanceCopy(true);
-  QRVCodeSigningEntry advance = entryWith("advance");
   advance.setAdvanceCopy(true);
-  QRVCodeSigningEntry placeholder = entryWith("placeholder");
   placeholder.setPlaceholder(true);
   add(both, "both");
   add(advance, "advance");
   add(placeholder, "placeholder");
-
   const char* flags = "SELECT placeholder FROM code_signing_info WHERE code_signing_id_text=?";
   EXPECT_EQ(scalar(flags, "both"), 3);
   EXPECT_EQ(scalar(flags, "advance"), 2);
   EXPECT_EQ(scalar(flags, "placeholder"), 1);
   EXPECT_EQ(lookUp("both"), both);
 
-  QRVError error;
-  ASSERT_TRUE(db_->deleteAllAdvanceCopiesOfCodeSigningEntriesWithError(&error));
-  EXPECT_THAT(identifiers(), UnorderedElementsAre("placeholder"));
-  EXPECT_EQ(scalar("SELECT count(*) FROM code_signing_data"), 1);
-  EXPECT_EQ(scalar("SELECT count(*) FROM child_bundles"), 0);
+  ASSERT_TRUE(db_->deleteAllAdvanceCopiesOfCodeSigningEntriesWithError(&error_));
+  EXPECT_THAT(db_->identifiersWithError(&error_).value_or(std::vector<std::string>()),
+              UnorderedElementsAre("placeholder"));
+  EXPECT_EQ(count("code_signing_data"), 1);
+  EXPECT_EQ(count("child_bundles"), 0);
 }
 
-// MARK: - Deleting and invalidating
+// MARK: - Deleting, invalidating, not found
 
 TEST_F(QRVSQLiteDBTest, DeletingUnknownFailsButInvalidatingUnknownChangesNothing) {
   add(entryWith("p", {{"com.example.child"}}), "com.example.parent");
-  QRVError error;
-  ASSERT_TRUE(db_->deleteCodeSigningEntryWithIdentifier("com.example.parent", &error));
-  EXPECT_EQ(scalar("SELECT count(*) FROM code_signing_data"), 0);
-  EXPECT_EQ(scalar("SELECT count(*) FROM child_bundles"), 0);
+  ASSERT_TRUE(db_->deleteCodeSigningEntryWithIdentifier("com.example.parent", &error_));
+  EXPECT_EQ(count("code_signing_data"), 0);
+  EXPECT_EQ(count("child_bundles"), 0);
 
-  EXPECT_FALSE(db_->deleteCodeSigningEntryWithIdentifier("com.example.parent", &error));
-  EXPECT_EQ(error.code(), 66u);
-  EXPECT_EQ(error.message(), "failed to delete from code_signing_info");
-  ASSERT_NE(error.underlying(), nullptr);
-  EXPECT_EQ(error.underlying()->code(), 68u);
-  EXPECT_THAT(error.underlying()->message(), HasSubstr(": 0, but expecting 1"));
+  EXPECT_FALSE(db_->deleteCodeSigningEntryWithIdentifier("com.example.parent", &error_));
+  EXPECT_EQ(error_.code(), 66u);
+  ASSERT_NE(error_.underlying(), nullptr);
+  EXPECT_EQ(error_.underlying()->code(), 68u);
 
   add(entryWith("a"), "com.example.a");
   const int before = sqlite3_total_changes(db_->db());
-  EXPECT_TRUE(db_->invalidateCodeSigningWithIdentifier("com.example.unknown", &error));
+  EXPECT_TRUE(db_->invalidateCodeSigningWithIdentifier("com.example.unknown", &error_));
   EXPECT_EQ(sqlite3_total_changes(db_->db()), before);
-  EXPECT_FALSE(lookUp("com.example.a").isInvalid());
 }
 
 TEST_F(QRVSQLiteDBTest, InvalidatesParentAndChildrenInOneTransaction) {
   add(entryWith("p", {{"com.example.p.one", "com.example.p.two"}}), "com.example.p");
-  add(entryWith("one"), "com.example.p.one");
-  add(entryWith("two"), "com.example.p.two");
-  add(entryWith("other"), "com.example.other");
+  for (const char* other : {"com.example.p.one", "com.example.p.two", "com.example.other"})
+    add(entryWith(other), other);
   int commits = 0;
   sqlite3_commit_hook(
       db_->db(),
@@ -359,33 +308,21 @@ TEST_F(QRVSQLiteDBTest, InvalidatesParentAndChildrenInOneTransaction) {
         return 0;
       },
       &commits);
-
-  QRVError error;
-  ASSERT_TRUE(db_->invalidateCodeSigningForIdentifierAndAllChildren("com.example.p", &error));
+  ASSERT_TRUE(db_->invalidateCodeSigningForIdentifierAndAllChildren("com.example.p", &error_));
   EXPECT_EQ(commits, 1);
   EXPECT_EQ(scalar("SELECT count(*) FROM code_signing_info WHERE invalid=1"), 3);
   EXPECT_FALSE(lookUp("com.example.other").isInvalid());
 }
 
-// MARK: - Not found
-
 TEST_F(QRVSQLiteDBTest, NotFoundIs67AndIsNotLogged) {
   LogCapture log(dir_);
   add(entryWith("lonely"), "com.example.lonely");
-  QRVError error;
-  EXPECT_FALSE(db_->codeSigningEntryWithIdentifier("com.example.nobody", &error));
-  EXPECT_EQ(error.code(), 67u);
-  EXPECT_EQ(error.message(), "Identifier: \"com.example.nobody\" Not Found in DB");
-  EXPECT_FALSE(db_->childIdentifiersForParentIdentifier("com.example.lonely", &error));
-  EXPECT_EQ(error.message(),
-            "Children for parent identifier: \"com.example.lonely\" Not Found in DB");
-  EXPECT_FALSE(db_->parentIdentifierForChildIdentifier("com.example.lonely", &error));
-  EXPECT_EQ(error.message(), "Parent identifier for: \"com.example.lonely\" Not Found in DB");
+  EXPECT_EQ(failed(db_->codeSigningEntryWithIdentifier("com.example.nobody", &error_) != nullptr), 67u);
+  EXPECT_EQ(failed(db_->childIdentifiersForParentIdentifier("com.example.lonely", &error_).has_value()), 67u);
+  EXPECT_EQ(failed(db_->parentIdentifierForChildIdentifier("com.example.lonely", &error_).has_value()), 67u);
   EXPECT_FALSE(lookUp("com.example.lonely").childBundleIdentifiers());
   EXPECT_THAT(log.text(), Not(HasSubstr("Not Found")));
 }
-
-// MARK: - Unreadable rows
 
 TEST_F(QRVSQLiteDBTest, UnreadableBlobFailsLookUpAndIsSkippedByEnumeration) {
   add(entryWith("a"), "a");
@@ -394,14 +331,9 @@ TEST_F(QRVSQLiteDBTest, UnreadableBlobFailsLookUpAndIsSkippedByEnumeration) {
   const QRVPlist::Bytes array = QRVPlist::array({QRVPlist::string("x")}).toBinary();
   setBlob("b", array.data(), static_cast<int>(array.size()));
   setBlob("c", "\x01\x02garbage", 9);
-
-  QRVError error;
-  EXPECT_FALSE(db_->codeSigningEntryWithIdentifier("b", &error));
-  EXPECT_EQ(error.code(), 66u);
-  EXPECT_EQ(error.message(), "Error formatting info data from DB");
   setBlob("a", "", 0);
-  EXPECT_FALSE(db_->codeSigningEntryWithIdentifier("a", &error));
-  EXPECT_EQ(error.message(), "Failed to create code signing entry from statement row");
+  for (const char* unreadable : {"a", "b", "c"})
+    EXPECT_EQ(failed(db_->codeSigningEntryWithIdentifier(unreadable, &error_) != nullptr), 66u) << unreadable;
 
   add(entryWith("d", {{"d.child"}}), "d");
   std::vector<std::string> seen;
@@ -416,20 +348,15 @@ TEST_F(QRVSQLiteDBTest, UnreadableBlobFailsLookUpAndIsSkippedByEnumeration) {
 
 // MARK: - Transactions
 
-TEST_F(QRVSQLiteDBTest, FailingCommitIsReportedAsSuccessByAddOnly) {
+TEST_F(QRVSQLiteDBTest, FailingCommitIsReportedAsSuccessByAddOnlyAndLeavesNoTransactionOpen) {
   LogCapture log(dir_);
   add(entryWith("p", {{"com.example.child"}}), "com.example.p");
   sqlite3_commit_hook(
       db_->db(), [](void*) { return 1; }, nullptr);  // every COMMIT fails
-
   QRVCodeSigningEntry entry = entryWith("new");
-  QRVError error;
-  EXPECT_TRUE(db_->addCodeSigningEntry(&entry, "com.example.new", &error));
+  EXPECT_TRUE(db_->addCodeSigningEntry(&entry, "com.example.new", &error_));
   EXPECT_THAT(log.text(), HasSubstr("failed _sqliteExec commit"));
-
-  EXPECT_FALSE(db_->invalidateCodeSigningForIdentifierAndAllChildren("com.example.p", &error));
-  EXPECT_EQ(error.code(), 66u);
-  EXPECT_EQ(error.message(), "failed _sqliteExec commit");
+  EXPECT_EQ(failed(db_->invalidateCodeSigningForIdentifierAndAllChildren("com.example.p", &error_)), 66u);
 
   sqlite3_commit_hook(db_->db(), nullptr, nullptr);
   EXPECT_EQ(rowId("com.example.new"), -1);  // the refused commit rolled it back
@@ -444,15 +371,13 @@ TEST_F(QRVSQLiteDBTest, ExceptionInsideTransactionRollsBackWith40) {
   db_->TEST_setInsideTransactionHook([] { throw std::runtime_error("boom"); });
 
   QRVCodeSigningEntry entry = entryWith("new");
-  QRVError error;
-  EXPECT_FALSE(db_->addCodeSigningEntry(&entry, "com.example.new", &error));
-  EXPECT_EQ(error.code(), 40u);
-  EXPECT_THAT(error.message(), HasSubstr("boom"));
+  EXPECT_FALSE(db_->addCodeSigningEntry(&entry, "com.example.new", &error_));
+  EXPECT_EQ(error_.code(), 40u);
+  EXPECT_THAT(error_.message(), HasSubstr("boom"));
   EXPECT_TRUE(reported);
   EXPECT_EQ(rowId("com.example.new"), -1);
-
-  EXPECT_FALSE(db_->invalidateCodeSigningForIdentifierAndAllChildren("com.example.p", &error));
-  EXPECT_EQ(error.code(), 40u);
+  error_ = QRVError();
+  EXPECT_EQ(failed(db_->invalidateCodeSigningForIdentifierAndAllChildren("com.example.p", &error_)), 40u);
   EXPECT_EQ(scalar("SELECT count(*) FROM code_signing_info WHERE invalid=1"), 0);
 
   db_->TEST_setInsideTransactionHook(nullptr);
@@ -462,28 +387,25 @@ TEST_F(QRVSQLiteDBTest, ExceptionInsideTransactionRollsBackWith40) {
 // MARK: - Hostile identifiers
 
 TEST_F(QRVSQLiteDBTest, HostileIdentifiersAreBoundAsBytes) {
-  const std::vector<std::string> hostile = {
-      "x'); DROP TABLE code_signing_info; --",
-      "quote\"d",
-      std::string("nul\0middle", 10),
-      std::string(1 << 20, 'L'),
-      "\xff\xfe\xc3(not utf-8",
-      "",
-      "{} %s %@",
-  };
+  const std::vector<std::string> hostile = {"x'); DROP TABLE code_signing_info; --",
+                                            "quote\"d",
+                                            std::string("nul\0middle", 10),
+                                            std::string(1 << 20, 'L'),
+                                            "\xff\xfe\xc3(not utf-8",
+                                            "",
+                                            "{} %s %@"};
   for (const auto& identifier : hostile) {
     const std::string child = identifier + std::string("\0child", 6);
     add(entryWith("hostile", {{child}}), identifier);
     EXPECT_EQ(lookUp(identifier), entryWith("hostile", {{child}})) << identifier.size();
     EXPECT_EQ(db_->parentIdentifierForChildIdentifier(child, nullptr), identifier);
   }
-  QRVError error;
-  EXPECT_THAT(identifiers(), ::testing::UnorderedElementsAreArray(hostile));
-  EXPECT_FALSE(db_->codeSigningEntryWithIdentifier("nul", &error));  // not the NUL's prefix
+  EXPECT_THAT(db_->identifiersWithError(&error_).value_or(std::vector<std::string>()),
+              ::testing::UnorderedElementsAreArray(hostile));
+  EXPECT_EQ(failed(db_->codeSigningEntryWithIdentifier("nul", &error_) != nullptr), 67u);  // not the NUL's prefix
   for (const auto& identifier : hostile)
-    EXPECT_TRUE(db_->deleteCodeSigningEntryWithIdentifier(identifier, &error))
-        << error.description();
-  EXPECT_EQ(scalar("SELECT count(*) FROM child_bundles"), 0);
+    EXPECT_TRUE(db_->deleteCodeSigningEntryWithIdentifier(identifier, &error_)) << error_.description();
+  EXPECT_EQ(count("child_bundles"), 0);
 }
 
 }  // namespace
