@@ -38,6 +38,8 @@ void writeFile(const std::string& path, size_t bytes) {
   for (size_t written = 0; written < bytes; written += block.size()) out.write(block.data(), block.size());
 }
 
+QRVPlist key(const std::string& k) { return QRVPlist::string(k); }
+
 class ContentsTest : public testing::Test {
  protected:
   void SetUp() override {
@@ -54,7 +56,7 @@ class ContentsTest : public testing::Test {
   }
   std::shared_ptr<QRVClientConnection> admin() { return connectionFor("com.example.installer", true, true); }
 
-  QRVContainerIdentityRef identity(const std::string& id, QRVContainerClass c) {
+  QRVContainerIdentityRef identity(const std::string& id, QRVContainerClass c = QRVContainerClassAppData) {
     QRVError error;
     auto user = QRVUserIdentity::isUserIdentityRequiredForContainerClass(c)
                     ? env_.services->userIdentityCache->userIdentityForPersonalPersonaWithUID(501, 501)
@@ -67,6 +69,14 @@ class ContentsTest : public testing::Test {
     EXPECT_NE(m, nullptr) << error.description();
     return m;
   }
+  // The assets path as `by` (default the installer) asks for it; a failure
+  // leaves its error in error_.
+  std::optional<std::string> assets(const QRVContainerIdentityRef& id, bool relative, bool createIfNecessary,
+                                    std::shared_ptr<QRVClientConnection> by = nullptr) {
+    error_ = QRVError();
+    return (by ? by : admin())
+        ->userManagedAssetsPathWithContainerIdentity(id, relative, createIfNecessary, &existed_, &error_);
+  }
   // Forgets everything in memory, so that what follows sees only the disk.
   void freshCache() {
     env_.services->containerCache = std::make_shared<QRVContainerCache>(
@@ -75,30 +85,29 @@ class ContentsTest : public testing::Test {
   }
 
   QRVTestServices env_;
+  QRVError error_;
+  bool existed_ = false;
 };
 
 TEST_F(ContentsTest, InfoValuesAreSetReadAndRemovedAndSurviveAFreshCache) {
-  auto app = identity("com.example.app", QRVContainerClassAppData);
+  auto app = identity("com.example.app");
   QRVError error;
-  EXPECT_FALSE(admin()->setInfoValue(QRVPlist::string("v"), QRVPlist::string("k"), app, true, &error));
+  EXPECT_FALSE(admin()->setInfoValue(QRVPlist::string("v"), key("k"), app, true, &error));
   EXPECT_EQ(error.code(), 21u);
   create(app);
 
-  ASSERT_TRUE(admin()->setInfoValue(QRVPlist::string("v"), QRVPlist::string("k"), app, true, &error))
-      << error.description();
-  ASSERT_TRUE(admin()->setInfoValue(QRVPlist::uinteger(7), QRVPlist::string("n"), app, true, &error));
+  ASSERT_TRUE(admin()->setInfoValue(QRVPlist::string("v"), key("k"), app, true, &error)) << error.description();
+  ASSERT_TRUE(admin()->setInfoValue(QRVPlist::uinteger(7), key("n"), app, true, &error));
   freshCache();
-  auto v = admin()->infoValueForKey(QRVPlist::string("k"), app, true, &error);
-  ASSERT_TRUE(v.has_value()) << error.description();
-  EXPECT_EQ(*v, QRVPlist::string("v"));
-  EXPECT_EQ(admin()->infoValueForKey(QRVPlist::string("n"), app, false, &error), QRVPlist::uinteger(7));
+  EXPECT_EQ(admin()->infoValueForKey(key("k"), app, true, &error), QRVPlist::string("v")) << error.description();
+  EXPECT_EQ(admin()->infoValueForKey(key("n"), app, false, &error), QRVPlist::uinteger(7));
 
   // Setting nothing removes the key, on disk too.
-  ASSERT_TRUE(admin()->removeInfoValueForKey(QRVPlist::string("k"), app, true, &error));
+  ASSERT_TRUE(admin()->removeInfoValueForKey(key("k"), app, true, &error));
   freshCache();
-  EXPECT_FALSE(admin()->infoValueForKey(QRVPlist::string("k"), app, true, &error).has_value());
+  EXPECT_FALSE(admin()->infoValueForKey(key("k"), app, true, &error).has_value());
   EXPECT_EQ(error.code(), 24u);
-  EXPECT_EQ(admin()->infoValueForKey(QRVPlist::string("n"), app, true, &error), QRVPlist::uinteger(7));
+  EXPECT_EQ(admin()->infoValueForKey(key("n"), app, true, &error), QRVPlist::uinteger(7));
 
   // Keys must be strings.
   EXPECT_FALSE(admin()->infoValueForKey(QRVPlist::uinteger(1), app, true, &error).has_value());
@@ -108,71 +117,60 @@ TEST_F(ContentsTest, InfoValuesAreSetReadAndRemovedAndSurviveAFreshCache) {
 }
 
 TEST_F(ContentsTest, ConcurrentWritersOfDifferentKeysKeepBothValues) {
-  auto app = identity("com.example.app", QRVContainerClassAppData);
+  auto app = identity("com.example.app");
   create(app);
   std::vector<std::thread> threads;
   for (int t = 0; t < 4; t++)
     threads.emplace_back([&, t] {
       for (int i = 0; i < 10; i++) {
         QRVError e;
-        EXPECT_TRUE(admin()->setInfoValue(QRVPlist::uinteger(i), QRVPlist::string("key" + std::to_string(t)), app,
-                                          true, &e));
+        EXPECT_TRUE(admin()->setInfoValue(QRVPlist::uinteger(i), key("key" + std::to_string(t)), app, true, &e));
       }
     });
   for (auto& t : threads) t.join();
   freshCache();
   QRVError error;
   for (int t = 0; t < 4; t++)
-    EXPECT_EQ(admin()->infoValueForKey(QRVPlist::string("key" + std::to_string(t)), app, true, &error),
-              QRVPlist::uinteger(9));
+    EXPECT_EQ(admin()->infoValueForKey(key("key" + std::to_string(t)), app, true, &error), QRVPlist::uinteger(9));
 }
 
 TEST_F(ContentsTest, AssetsPathIsCreatedOnceOwnedByTheUserAndAnsweredRelativeOrAbsolute) {
-  auto app = identity("com.example.app", QRVContainerClassAppData);
+  auto app = identity("com.example.app");
+  EXPECT_FALSE(assets(app, false, false));
+  EXPECT_EQ(error_.code(), 21u);
+  // Asked to create, it makes the application data container as well.
+  existed_ = true;
+  auto path = assets(app, false, true);
+  ASSERT_TRUE(path.has_value()) << error_.description();
+  EXPECT_FALSE(existed_);
   QRVError error;
-  bool existed = true;
-  EXPECT_FALSE(admin()->userManagedAssetsPathWithContainerIdentity(app, false, false, &existed, &error));
-  EXPECT_EQ(error.code(), 21u);
-  auto container = create(app);
-  EXPECT_FALSE(admin()->userManagedAssetsPathWithContainerIdentity(app, false, false, &existed, &error));
-  EXPECT_EQ(error.code(), 71u);
-
-  auto path = admin()->userManagedAssetsPathWithContainerIdentity(app, false, true, &existed, &error);
-  ASSERT_TRUE(path.has_value()) << error.description();
-  EXPECT_FALSE(existed);
+  auto container = admin()->metadataWithContainerIdentity(app, &error);
+  ASSERT_NE(container, nullptr) << error.description();
   const std::string name = fs::path(*path).filename().string();
   EXPECT_EQ(*path, container->url() + "/" + name);
   EXPECT_EQ(name.rfind("com.kelva.UserManagedAssets.", 0), 0u) << name;
   struct stat st;
   ASSERT_EQ(stat(path->c_str(), &st), 0);
+  EXPECT_TRUE(S_ISDIR(st.st_mode));
   EXPECT_EQ(st.st_uid, 501u);
   EXPECT_EQ(st.st_gid, 501u);
   EXPECT_EQ(st.st_mode & 07777, 0755u);
 
   // The name is in the metadata file: a fresh cache answers the same.
   freshCache();
-  auto relative = admin()->userManagedAssetsPathWithContainerIdentity(app, true, true, &existed, &error);
-  ASSERT_TRUE(relative.has_value()) << error.description();
-  EXPECT_TRUE(existed);
-  EXPECT_EQ(*relative, name);
+  EXPECT_EQ(assets(app, true, true), name) << error_.description();
+  EXPECT_TRUE(existed_);
 
   // Without the entitlement only one's own identifier.
-  auto own = connectionFor("com.example.app", false);
-  EXPECT_EQ(own->userManagedAssetsPathWithContainerIdentity(app, true, false, &existed, &error), name);
-  auto other = connectionFor("com.example.other", false);
-  EXPECT_FALSE(other->userManagedAssetsPathWithContainerIdentity(app, true, false, &existed, &error));
-  EXPECT_EQ(error.code(), 38u);
-}
+  EXPECT_EQ(assets(app, true, false, connectionFor("com.example.app", false)), name);
+  EXPECT_FALSE(assets(app, true, false, connectionFor("com.example.other", false)));
+  EXPECT_EQ(error_.code(), 38u);
 
-TEST_F(ContentsTest, AssetsPathCreatesTheApplicationDataContainerWhenAsked) {
-  auto app = identity("com.example.fresh", QRVContainerClassAppData);
-  QRVError error;
-  bool existed = true;
-  auto path = admin()->userManagedAssetsPathWithContainerIdentity(app, false, true, &existed, &error);
-  ASSERT_TRUE(path.has_value()) << error.description();
-  EXPECT_FALSE(existed);
-  EXPECT_TRUE(fs::is_directory(*path));
-  EXPECT_NE(admin()->metadataWithContainerIdentity(app, &error), nullptr);
+  // A container without the directory is not given one by a mere look-up.
+  auto plain = identity("com.example.plain");
+  create(plain);
+  EXPECT_FALSE(assets(plain, false, false));
+  EXPECT_EQ(error_.code(), 71u);
 }
 
 class AssetDeletionTest : public ContentsTest {
@@ -180,11 +178,10 @@ class AssetDeletionTest : public ContentsTest {
   void SetUp() override {
     ContentsTest::SetUp();
     if (IsSkipped()) return;
-    app_ = identity("com.example.app", QRVContainerClassAppData);
+    app_ = identity("com.example.app");
     container_ = create(app_);
-    QRVError error;
-    bool existed;
-    assets_ = *admin()->userManagedAssetsPathWithContainerIdentity(app_, false, true, &existed, &error);
+    assets_ = assets(app_, false, true).value_or("");
+    ASSERT_FALSE(assets_.empty()) << error_.description();
     // Outside the container entirely, and inside it but outside the assets.
     outside_ = env_.root.path() + "/victim";
     writeFile(outside_, 10);
@@ -196,9 +193,10 @@ class AssetDeletionTest : public ContentsTest {
     fs::create_symlink(outside_, assets_ + "/absolute");
     fs::create_symlink("sub/deeper/file", assets_ + "/inner");
   }
-  uint64_t remove(const std::string& relativePath) {
+  uint64_t remove(const std::string& relativePath, const QRVContainerIdentityRef& id = nullptr) {
     QRVError error;
-    return admin()->deleteUserManagedAssetWithContainerIdentity(app_, relativePath, &error) ? 1 : error.code();
+    return admin()->deleteUserManagedAssetWithContainerIdentity(id ? id : app_, relativePath, &error) ? 1
+                                                                                                      : error.code();
   }
   void expectNothingOutsideTouched() {
     EXPECT_TRUE(fs::exists(outside_));
@@ -211,7 +209,17 @@ class AssetDeletionTest : public ContentsTest {
   std::string assets_, outside_;
 };
 
-TEST_F(AssetDeletionTest, RemovesItemsInsideTheAssetsDirectory) {
+TEST_F(AssetDeletionTest, RemovesOnlyWhatLiesInsideTheAssetsDirectory) {
+  // The directory itself, anything outside it, through links or not, and
+  // what is not a relative path at all.
+  for (const char* path : {".", "./", "sub/..", "..", "../Documents/precious", "climb", "climb/precious", "absolute"})
+    EXPECT_EQ(remove(path), 10u) << path;
+  EXPECT_EQ(remove(""), 11u);
+  EXPECT_EQ(remove(outside_), 11u);
+  expectNothingOutsideTouched();
+  EXPECT_TRUE(fs::is_symlink(assets_ + "/climb"));
+  EXPECT_TRUE(fs::is_symlink(assets_ + "/absolute"));
+
   EXPECT_EQ(remove("file"), 1u);
   EXPECT_FALSE(fs::exists(assets_ + "/file"));
   // A link inside is removed itself, not what it names.
@@ -220,46 +228,26 @@ TEST_F(AssetDeletionTest, RemovesItemsInsideTheAssetsDirectory) {
   EXPECT_TRUE(fs::exists(assets_ + "/sub/deeper/file"));
   EXPECT_EQ(remove("sub/"), 1u);
   EXPECT_FALSE(fs::exists(assets_ + "/sub"));
+  // Removing what is already gone is no failure.
+  EXPECT_EQ(remove("nothing-here"), 1u);
   expectNothingOutsideTouched();
 }
 
-TEST_F(AssetDeletionTest, RefusesTheDirectoryItselfAndEverythingOutsideIt) {
-  EXPECT_EQ(remove("."), 10u);
-  EXPECT_EQ(remove("./"), 10u);
-  EXPECT_EQ(remove("sub/.."), 10u);
-  EXPECT_EQ(remove(".."), 10u);
-  EXPECT_EQ(remove("../Documents/precious"), 10u);
-  EXPECT_EQ(remove("climb"), 10u);
-  EXPECT_EQ(remove("climb/precious"), 10u);
-  EXPECT_EQ(remove("absolute"), 10u);
-  EXPECT_EQ(remove(""), 11u);
-  EXPECT_EQ(remove(outside_), 11u);
-  expectNothingOutsideTouched();
-  EXPECT_TRUE(fs::is_symlink(assets_ + "/climb"));
-  EXPECT_TRUE(fs::is_symlink(assets_ + "/absolute"));
-}
+TEST_F(AssetDeletionTest, FailuresAndAnAssetsDirectorySwappedForALink) {
+  env_.fileSystem->failNext(QRVFakeFileSystemExtras::Operation::kRemoveTree, EIO);
+  EXPECT_EQ(remove("file"), 41u);
+  auto plain = identity("com.example.plain");
+  create(plain);
+  EXPECT_EQ(remove("file", plain), 11u);  // no assets directory
 
-TEST_F(AssetDeletionTest, AnAssetsDirectorySwappedForALinkIsRefused) {
   fs::remove_all(assets_);
   fs::create_symlink("Documents", assets_);
   EXPECT_EQ(remove("precious"), 10u);
   EXPECT_TRUE(fs::exists(container_->url() + "/Documents/precious"));
 }
 
-TEST_F(AssetDeletionTest, FailedRemovalIs41AndMissingAssetsDirectoryIs11) {
-  env_.fileSystem->failNext(QRVFakeFileSystemExtras::Operation::kRemoveTree, EIO);
-  EXPECT_EQ(remove("file"), 41u);
-  // Removing what is already gone is no failure.
-  EXPECT_EQ(remove("nothing-here"), 1u);
-  auto other = identity("com.example.plain", QRVContainerClassAppData);
-  create(other);
-  QRVError error;
-  EXPECT_FALSE(admin()->deleteUserManagedAssetWithContainerIdentity(other, "file", &error));
-  EXPECT_EQ(error.code(), 11u);
-}
-
 TEST_F(ContentsTest, DataContainersAreMeasuredEveryTimeBundlesOnce) {
-  auto data = identity("com.example.app", QRVContainerClassAppData);
+  auto data = identity("com.example.app");
   auto dataContainer = create(data);
   QRVError error;
   auto before = admin()->diskUsageWithContainerIdentity(data, &error);
@@ -268,7 +256,7 @@ TEST_F(ContentsTest, DataContainersAreMeasuredEveryTimeBundlesOnce) {
   auto after = admin()->diskUsageWithContainerIdentity(data, &error);
   ASSERT_TRUE(after.has_value());
   EXPECT_GE(*after, *before + (1 << 20));
-  EXPECT_FALSE(admin()->infoValueForKey(QRVPlist::string("com.kelva.Verdane.StaticDiskUsage"), data, true, &error));
+  EXPECT_FALSE(admin()->infoValueForKey(key("com.kelva.Verdane.StaticDiskUsage"), data, true, &error));
 
   auto bundle = identity("com.example.app", QRVContainerClassAppBundle);
   auto bundleContainer = create(bundle);
@@ -276,37 +264,33 @@ TEST_F(ContentsTest, DataContainersAreMeasuredEveryTimeBundlesOnce) {
   auto first = admin()->diskUsageWithContainerIdentity(bundle, &error);
   ASSERT_TRUE(first.has_value()) << error.description();
   EXPECT_GE(*first, 1u << 20);
-  EXPECT_EQ(admin()->infoValueForKey(QRVPlist::string("com.kelva.Verdane.StaticDiskUsage"), bundle, true, &error),
+  EXPECT_EQ(admin()->infoValueForKey(key("com.kelva.Verdane.StaticDiskUsage"), bundle, true, &error),
             QRVPlist::uinteger(*first));
   writeFile(bundleContainer->url() + "/more", 1 << 20);
   EXPECT_EQ(admin()->diskUsageWithContainerIdentity(bundle, &error), first);
 
-  EXPECT_FALSE(admin()->diskUsageWithContainerIdentity(identity("com.example.none", QRVContainerClassAppData), &error));
+  EXPECT_FALSE(admin()->diskUsageWithContainerIdentity(identity("com.example.none"), &error));
   EXPECT_EQ(error.code(), 21u);
-}
 
-TEST_F(ContentsTest, DiskUsageWaitsAtTestLockPointTwo) {
-  auto data = identity("com.example.app", QRVContainerClassAppData);
-  create(data);
+  // Measuring waits at test lock point 2.
   QRVTestLocks& locks = *env_.services->testLocks;
   locks.setEnabled(true);
   ASSERT_TRUE(locks.acquireLock(2));
   std::atomic<bool> done{false};
   std::thread measuring([&] {
-    QRVError error;
-    EXPECT_TRUE(admin()->diskUsageWithContainerIdentity(data, &error).has_value());
+    QRVError e;
+    EXPECT_TRUE(admin()->diskUsageWithContainerIdentity(data, &e).has_value());
     done = true;
   });
   std::this_thread::sleep_for(std::chrono::milliseconds(200));
   EXPECT_FALSE(done.load());
   locks.releaseLock(2);
   measuring.join();
-  EXPECT_TRUE(done.load());
   locks.setEnabled(false);
 }
 
 TEST_F(ContentsTest, NewDirectoryUUIDKeepsTheContainerReachable) {
-  auto app = identity("com.example.app", QRVContainerClassAppData);
+  auto app = identity("com.example.app");
   auto old = create(app);
   writeFile(old->url() + "/Documents/kept", 10);
   QRVError error;
@@ -329,64 +313,52 @@ TEST_F(ContentsTest, NewDirectoryUUIDKeepsTheContainerReachable) {
     EXPECT_EQ(admin()->metadataWithContainerIdentity(concreteOld, &error), nullptr);
     EXPECT_EQ(error.code(), 21u);
   }
-}
 
-TEST_F(ContentsTest, NewDirectoryUUIDRefusesANonUUIDDirectory) {
+  // A directory not named by a UUID (a well-known name) keeps its name.
   env_.services->wellKnownNames = std::make_shared<KnowsOneName>();
   freshCache();
   auto wellKnown = identity("com.example.wellknown", QRVContainerClassSystemData);
   auto container = create(wellKnown);
   ASSERT_NE(container, nullptr);
-  QRVError error;
   EXPECT_EQ(admin()->regenerateDirectoryUUIDWithContainerIdentity(wellKnown, &error), nullptr);
   EXPECT_EQ(error.code(), 11u);
   EXPECT_TRUE(fs::exists(container->url()));
 }
 
-class StageSharedContentTest : public ContentsTest {
- protected:
-  void SetUp() override {
-    ContentsTest::SetUp();
-    if (IsSkipped()) return;
-    own_ = create(identity("com.example.daemon", QRVContainerClassSystemData));
-    group_ = create(identity("systemgroup.com.example.shared", QRVContainerClassSystemGroup));
-    fs::create_directories(own_->url() + "/Library/out");
-    writeFile(own_->url() + "/Library/out/payload", 10);
-  }
-  uint64_t stage(const std::string& group, const std::string& source, const std::string& dest) {
+TEST_F(ContentsTest, SharedContentGoesOnlyToAGrantedGroupAndNeverLeavesEitherContainer) {
+  auto own = create(identity("com.example.daemon", QRVContainerClassSystemData));
+  auto group = create(identity("systemgroup.com.example.shared", QRVContainerClassSystemGroup));
+  const std::string payload = own->url() + "/Library/out/payload";
+  fs::create_directories(fs::path(payload).parent_path());
+  writeFile(payload, 10);
+  auto stage = [&](const std::string& groupId, const std::string& source, const std::string& dest) -> uint64_t {
     QRVError error;
-    return connectionFor("com.example.daemon")->stageSharedContentForIdentifier(group, source, dest, &error)
+    return connectionFor("com.example.daemon")->stageSharedContentForIdentifier(groupId, source, dest, &error)
                ? 1
                : error.code();
-  }
-  QRVMetadataRef own_, group_;
-};
-
-TEST_F(StageSharedContentTest, WithoutCodeSigningNoGroupIsGrantedAndNothingMoves) {
-  EXPECT_EQ(stage("systemgroup.com.example.shared", "Library/out/payload", "payload"), 55u);
-  EXPECT_EQ(stage("systemgroup.com.example.shared", "Library/../../x", "payload"), 38u);
+  };
+  const std::string shared = "systemgroup.com.example.shared";
+  // Without code signing no group is granted.
+  EXPECT_EQ(stage(shared, "Library/out/payload", "payload"), 55u);
+  EXPECT_EQ(stage(shared, "Library/../../x", "payload"), 38u);
   EXPECT_EQ(stage("", "Library/out/payload", "payload"), 11u);
-  EXPECT_TRUE(fs::exists(own_->url() + "/Library/out/payload"));
-}
 
-TEST_F(StageSharedContentTest, AGrantedGroupReceivesTheItemButNothingLeavesEitherContainer) {
   env_.services->systemGroups = std::make_shared<GrantsOneGroup>();
   EXPECT_EQ(stage("systemgroup.com.example.other", "Library/out/payload", "payload"), 55u);
-  fs::create_symlink("../../..", own_->url() + "/Library/up");
-  EXPECT_EQ(stage("systemgroup.com.example.shared", "Library/up", "payload"), 10u);
-  fs::create_symlink("/", group_->url() + "/root");
-  EXPECT_EQ(stage("systemgroup.com.example.shared", "Library/out/payload", "root/payload"), 10u);
-  EXPECT_EQ(stage("systemgroup.com.example.shared", "Library/out/payload", "../payload"), 38u);
-  EXPECT_TRUE(fs::exists(own_->url() + "/Library/out/payload"));
+  fs::create_symlink("../../..", own->url() + "/Library/up");
+  EXPECT_EQ(stage(shared, "Library/up", "payload"), 10u);
+  fs::create_symlink("/", group->url() + "/root");
+  EXPECT_EQ(stage(shared, "Library/out/payload", "root/payload"), 10u);
+  EXPECT_EQ(stage(shared, "Library/out/payload", "../payload"), 38u);
+  EXPECT_TRUE(fs::exists(payload));
 
   QRVError error;
   auto dest = connectionFor("com.example.daemon")
-                  ->stageSharedContentForIdentifier("systemgroup.com.example.shared", "Library/out/payload",
-                                                    "payload", &error);
+                  ->stageSharedContentForIdentifier(shared, "Library/out/payload", "payload", &error);
   ASSERT_TRUE(dest.has_value()) << error.description();
-  EXPECT_EQ(*dest, group_->url() + "/payload");
+  EXPECT_EQ(*dest, group->url() + "/payload");
   EXPECT_TRUE(fs::exists(*dest));
-  EXPECT_FALSE(fs::exists(own_->url() + "/Library/out/payload"));
+  EXPECT_FALSE(fs::exists(payload));
 }
 
 }  // namespace

@@ -53,7 +53,9 @@ class CreateOrLookupTest : public testing::Test {
     c->setAllowGroupIdLookup(p.groups);
     return c;
   }
-  std::shared_ptr<QRVClientConnection> admin() { return connectionFor("com.example.installer", {true, true}); }
+  std::shared_ptr<QRVClientConnection> admin() {
+    return connectionFor("com.example.installer", {true, true, false, std::nullopt});
+  }
 
   QRVContainerIdentityRef identity(const std::string& id, QRVContainerClass c) {
     QRVError error;
@@ -62,69 +64,88 @@ class CreateOrLookupTest : public testing::Test {
                     : env_.services->userIdentityCache->defaultUserIdentity();
     return QRVContainerIdentity::containerIdentityWithUserIdentity(user, id, c, &error);
   }
+  // Creates (or with `create` false only looks up) as `by`, or as the
+  // installer; a failure leaves its error in error_.
+  QRVMetadataRef get(const QRVContainerIdentityRef& id, bool create = true, bool transient = false,
+                     std::shared_ptr<QRVClientConnection> by = nullptr) {
+    error_ = QRVError();
+    return (by ? by : admin())->createOrLookupContainerWithContainerIdentity(id, create, transient, true, &error_);
+  }
+  // Forgets everything in memory, so that what follows sees only the disk.
+  void freshCache() {
+    env_.services->containerCache = std::make_shared<QRVContainerCache>(
+        env_.services->fileManager, env_.services->globalConfiguration, env_.services->userIdentityCache,
+        env_.services->platform.sandbox, nullptr, env_.services->wellKnownNames);
+  }
+  std::string mobile(const std::string& rest) { return env_.root.path() + "/private/var/mobile/Containers/" + rest; }
 
   QRVTestServices env_;
+  QRVError error_;
 };
 
 TEST_F(CreateOrLookupTest, CreatesInStagingMovesLiveAndFindsItAgain) {
-  QRVError error;
   auto app = identity("com.example.app", QRVContainerClassAppData);
-  auto missing = admin()->createOrLookupContainerWithContainerIdentity(app, false, false, true, &error);
-  EXPECT_EQ(missing, nullptr);
-  EXPECT_EQ(error.code(), 21u);
+  EXPECT_EQ(get(app, false), nullptr);
+  EXPECT_EQ(error_.code(), 21u);
 
-  auto created = admin()->createOrLookupContainerWithContainerIdentity(app, true, false, true, &error);
-  ASSERT_NE(created, nullptr) << error.description();
+  auto created = get(app);
+  ASSERT_NE(created, nullptr) << error_.description();
   EXPECT_FALSE(created->existed());
-  const std::string parent = env_.root.path() + "/private/var/mobile/Containers/Data/Application";
-  EXPECT_EQ(created->url(), parent + "/" + created->uuid().string());
+  EXPECT_EQ(created->url(), mobile("Data/Application/") + created->uuid().string());
   struct stat st;
   ASSERT_EQ(stat(created->url().c_str(), &st), 0);
   EXPECT_EQ(st.st_uid, 501u);
-  EXPECT_TRUE(fs::exists(created->url() + "/.com.kelva.quorva.metadata.plist"));
   for (const char* sub : {"Documents", "Library", "Library/Caches", "Library/Preferences", "SystemData", "tmp"})
     EXPECT_TRUE(fs::is_directory(created->url() + "/" + sub)) << sub;
   // Staging holds nothing once the container is live.
-  std::string staging = env_.root.path() + "/private/var/mobile/Containers/Staging";
-  EXPECT_TRUE(fs::is_empty(staging));
+  EXPECT_TRUE(fs::is_empty(mobile("Staging")));
 
-  auto again = admin()->createOrLookupContainerWithContainerIdentity(app, true, false, true, &error);
+  auto again = get(app);
   ASSERT_NE(again, nullptr);
   EXPECT_TRUE(again->existed());
   EXPECT_EQ(again->uuid(), created->uuid());
 
-  // A fresh cache finds it on disk too.
-  env_.services->containerCache = std::make_shared<QRVContainerCache>(
-      env_.services->fileManager, env_.services->globalConfiguration, env_.services->userIdentityCache,
-      env_.services->platform.sandbox);
+  // A fresh cache finds it on disk too, but a named UUID must be its own.
+  freshCache();
+  QRVError error;
   auto reread = admin()->metadataWithContainerIdentity(app, &error);
   ASSERT_NE(reread, nullptr) << error.description();
   EXPECT_EQ(reread->uuid(), created->uuid());
-
-  // A named UUID must be the container's own.
   auto wrongUUID = QRVConcreteContainerIdentity::containerIdentityWithUUID(QRVUUID::random(), app->userIdentity(),
                                                                            app->identifier(), 2, &error);
   EXPECT_EQ(admin()->metadataWithContainerIdentity(wrongUUID, &error), nullptr);
   EXPECT_EQ(error.code(), 21u);
+
+  // Listing is sorted by identifier; an unknown class is refused.
+  ASSERT_NE(get(identity("com.example.a", 2)), nullptr);
+  auto all = admin()->containersWithClass(QRVContainerClassAppData, false, &error);
+  ASSERT_TRUE(all);
+  ASSERT_EQ(all->size(), 2u);
+  EXPECT_EQ((*all)[0]->identifier(), "com.example.a");
+  EXPECT_FALSE(admin()->containersWithClass(14, false, &error));
+
+  fs::remove_all(created->url() + "/Library");
+  ASSERT_TRUE(admin()->recreateDefaultStructureWithContainerIdentity(created->containerIdentity(), &error))
+      << error.description();
+  EXPECT_TRUE(fs::is_directory(created->url() + "/Library/Preferences"));
 }
 
 TEST_F(CreateOrLookupTest, TransientRequestsAlwaysGetAFreshContainer) {
-  QRVError error;
-  auto tmp = identity("com.example.app", QRVContainerClassAppData);
-  EXPECT_EQ(admin()->createOrLookupContainerWithContainerIdentity(tmp, false, true, true, &error), nullptr);
-  EXPECT_EQ(error.code(), 21u);  // never merely looked up
-  auto first = admin()->createOrLookupContainerWithContainerIdentity(tmp, true, true, true, &error);
-  ASSERT_NE(first, nullptr) << error.description();
+  auto app = identity("com.example.app", QRVContainerClassAppData);
+  EXPECT_EQ(get(app, false, true), nullptr);
+  EXPECT_EQ(error_.code(), 21u);  // never merely looked up
+  auto first = get(app, true, true);
+  ASSERT_NE(first, nullptr) << error_.description();
   EXPECT_TRUE(first->transient());
   EXPECT_NE(first->url().find("/Containers/Temp/Data/Application/"), std::string::npos);
   std::ofstream(first->url() + "/Documents/old") << "x";
-  auto second = admin()->createOrLookupContainerWithContainerIdentity(tmp, true, true, true, &error);
-  ASSERT_NE(second, nullptr) << error.description();
+  auto second = get(app, true, true);
+  ASSERT_NE(second, nullptr) << error_.description();
   EXPECT_NE(second->uuid(), first->uuid());
   EXPECT_FALSE(fs::exists(first->url()));
   EXPECT_TRUE(fs::is_empty(second->url() + "/Documents"));
   // The live container of the identity is untouched by transient work.
-  EXPECT_EQ(admin()->createOrLookupContainerWithContainerIdentity(tmp, false, false, true, &error), nullptr);
+  EXPECT_EQ(get(app, false), nullptr);
 }
 
 TEST_F(CreateOrLookupTest, ConcurrentCreatesMakeOneContainer) {
@@ -148,58 +169,48 @@ TEST_F(CreateOrLookupTest, ConcurrentCreatesMakeOneContainer) {
 }
 
 TEST_F(CreateOrLookupTest, AccessRules) {
-  QRVError error;
   auto own = identity("com.example.me", QRVContainerClassAppData);
   auto other = identity("com.example.other", QRVContainerClassAppData);
   auto group = identity("group.example", QRVContainerClassAppGroup);
-  auto systemGroup = identity("systemgroup.example", QRVContainerClassSystemGroup);
-  auto ownSystem = identity("com.example.me", QRVContainerClassSystemData);
-  auto daemonSystem = identity("com.example.daemon", QRVContainerClassSystemData);
-
   auto me = connectionFor("com.example.me");
-  EXPECT_NE(me->createOrLookupContainerWithContainerIdentity(own, true, false, true, &error), nullptr);
-  EXPECT_EQ(me->createOrLookupContainerWithContainerIdentity(other, true, false, true, &error), nullptr);
-  EXPECT_EQ(error.code(), 55u);
-  // Its own system container only when code signing grants it one.
-  EXPECT_EQ(me->createOrLookupContainerWithContainerIdentity(ownSystem, true, false, true, &error), nullptr);
-  EXPECT_EQ(error.code(), 55u);
-  env_.services->codeSigning = std::make_shared<SaysHasSystemContainer>();
-  auto daemon = connectionFor("com.example.daemon");
-  EXPECT_NE(daemon->createOrLookupContainerWithContainerIdentity(daemonSystem, true, false, true, &error), nullptr)
-      << error.description();
-
-  // Group look-up reaches group containers of anyone, and nothing else.
-  auto groups = connectionFor("com.example.me", {false, false, true});
-  EXPECT_NE(groups->createOrLookupContainerWithContainerIdentity(group, true, false, true, &error), nullptr);
-  EXPECT_NE(groups->createOrLookupContainerWithContainerIdentity(systemGroup, true, false, true, &error), nullptr);
-  EXPECT_EQ(groups->createOrLookupContainerWithContainerIdentity(other, true, false, true, &error), nullptr);
-  EXPECT_EQ(error.code(), 55u);
-
-  // The lookup entitlement grants identifiers per class.
+  auto groups = connectionFor("com.example.me", {false, false, true, std::nullopt});
   QRVPlist lookup = QRVPlist::dictionary().set("appData", QRVPlist::array({QRVPlist::string("com.example.other")}));
   auto looker = connectionFor("com.example.looker", {false, false, false, lookup});
-  EXPECT_TRUE(looker->isEntitledForLookupWithClass(2, "com.example.other"));
-  EXPECT_FALSE(looker->isEntitledForLookupWithClass(4, "com.example.other"));
-  EXPECT_NE(looker->createOrLookupContainerWithContainerIdentity(other, true, false, true, &error), nullptr);
-  EXPECT_EQ(looker->createOrLookupContainerWithContainerIdentity(group, true, false, true, &error), nullptr);
-  EXPECT_EQ(error.code(), 55u);
 
-  EXPECT_EQ(me->createOrLookupContainerWithContainerIdentity(nullptr, true, false, true, &error), nullptr);
-  EXPECT_EQ(error.code(), 38u);
+  struct Case {
+    std::shared_ptr<QRVClientConnection> by;
+    QRVContainerIdentityRef id;
+    uint64_t code;  // 1: allowed
+  };
+  const Case cases[] = {
+      {me, own, 1}, {me, other, 55}, {me, nullptr, 38},
+      // Its own system container only when code signing grants it one.
+      {me, identity("com.example.me", QRVContainerClassSystemData), 55},
+      // Group look-up reaches group containers of anyone, and nothing else.
+      {groups, group, 1}, {groups, identity("systemgroup.example", QRVContainerClassSystemGroup), 1},
+      {groups, other, 55},
+      // The lookup entitlement grants identifiers per class.
+      {looker, other, 1}, {looker, group, 55}};
+  for (size_t i = 0; i < std::size(cases); i++) {
+    SCOPED_TRACE(i);
+    auto m = get(cases[i].id, true, false, cases[i].by);
+    EXPECT_EQ(m ? 1u : error_.code(), cases[i].code) << error_.description();
+  }
+  env_.services->codeSigning = std::make_shared<SaysHasSystemContainer>();
+  EXPECT_NE(get(identity("com.example.daemon", QRVContainerClassSystemData), true, false,
+                connectionFor("com.example.daemon")),
+            nullptr)
+      << error_.description();
 }
 
 TEST_F(CreateOrLookupTest, SystemContainersAndWellKnownNames) {
-  QRVError error;
   env_.services->wellKnownNames = std::make_shared<KnowsOneName>();
-  env_.services->containerCache = std::make_shared<QRVContainerCache>(
-      env_.services->fileManager, env_.services->globalConfiguration, env_.services->userIdentityCache,
-      env_.services->platform.sandbox, nullptr, env_.services->wellKnownNames);
-  auto known = admin()->createOrLookupContainerWithContainerIdentity(
-      identity("com.example.wellknown", QRVContainerClassSystemData), true, false, true, &error);
-  ASSERT_NE(known, nullptr) << error.description();
+  freshCache();
+  auto wellKnown = identity("com.example.wellknown", QRVContainerClassSystemData);
+  auto known = get(wellKnown);
+  ASSERT_NE(known, nullptr) << error_.description();
   EXPECT_EQ(known->url(), env_.root.path() + "/private/var/containers/Data/System/com.example.wellknown");
-  auto plain = admin()->createOrLookupContainerWithContainerIdentity(
-      identity("com.example.sys", QRVContainerClassSystemData), true, false, true, &error);
+  auto plain = get(identity("com.example.sys", QRVContainerClassSystemData));
   ASSERT_NE(plain, nullptr);
   EXPECT_EQ(fs::path(plain->url()).filename(), plain->uuid().string());
   // Entries of a system container belong to nobody and are reached through
@@ -209,33 +220,28 @@ TEST_F(CreateOrLookupTest, SystemContainersAndWellKnownNames) {
   EXPECT_EQ(st.st_uid, QRVFileManager::kSystemContainerOwner);
   ASSERT_EQ(stat(plain->url().c_str(), &st), 0);
   EXPECT_EQ(st.st_uid, 0u);
-  // Found again after a restart of the cache, by either name.
-  env_.services->containerCache = std::make_shared<QRVContainerCache>(
-      env_.services->fileManager, env_.services->globalConfiguration, env_.services->userIdentityCache,
-      env_.services->platform.sandbox, nullptr, env_.services->wellKnownNames);
-  auto found = admin()->createOrLookupContainerWithContainerIdentity(
-      identity("com.example.wellknown", QRVContainerClassSystemData), false, false, true, &error);
-  ASSERT_NE(found, nullptr) << error.description();
+  // Found again after a restart of the cache.
+  freshCache();
+  auto found = get(wellKnown, false);
+  ASSERT_NE(found, nullptr) << error_.description();
   EXPECT_EQ(found->uuid(), known->uuid());
 }
 
 TEST_F(CreateOrLookupTest, FailuresLeaveNothingLive) {
-  QRVError error;
   // The class directory cannot exist: a file stands in its way.
-  std::string parent = env_.root.path() + "/private/var/mobile/Containers/Data/Application";
+  const std::string parent = mobile("Data/Application"), staging = mobile("Staging");
   fs::create_directories(fs::path(parent).parent_path());
   std::ofstream(parent) << "in the way";
   auto app = identity("com.example.app", QRVContainerClassAppData);
-  EXPECT_EQ(admin()->createOrLookupContainerWithContainerIdentity(app, true, false, true, &error), nullptr);
-  EXPECT_EQ(error.code(), 43u);  // the cache cannot read the class directory
+  EXPECT_EQ(get(app), nullptr);
+  EXPECT_EQ(error_.code(), 43u);  // the cache cannot read the class directory
   fs::remove(parent);
 
   // No staging directory can be made.
-  std::string staging = env_.root.path() + "/private/var/mobile/Containers/Staging";
   fs::remove_all(staging);
   std::ofstream(staging) << "in the way";
-  EXPECT_EQ(admin()->createOrLookupContainerWithContainerIdentity(app, true, false, true, &error), nullptr);
-  EXPECT_EQ(error.code(), 7u);
+  EXPECT_EQ(get(app), nullptr);
+  EXPECT_EQ(error_.code(), 7u);
   fs::remove(staging);
   EXPECT_TRUE(fs::is_empty(parent));
 
@@ -243,35 +249,19 @@ TEST_F(CreateOrLookupTest, FailuresLeaveNothingLive) {
   // goes live.
   env_.services->dataProtection = std::make_shared<AsksForClassThree>();
   env_.fileSystem->failNext(QRVFakeFileSystemExtras::Operation::kSetProtectionClass, EIO, 100);
-  EXPECT_EQ(admin()->createOrLookupContainerWithContainerIdentity(app, true, false, true, &error), nullptr);
-  EXPECT_EQ(error.code(), 6u);
+  EXPECT_EQ(get(app), nullptr);
+  EXPECT_EQ(error_.code(), 6u);
   EXPECT_TRUE(fs::is_empty(parent));
   env_.fileSystem->failNext(QRVFakeFileSystemExtras::Operation::kSetProtectionClass, 0, 0);
-  auto made = admin()->createOrLookupContainerWithContainerIdentity(app, true, false, true, &error);
-  ASSERT_NE(made, nullptr) << error.description();
+  auto made = get(app);
+  ASSERT_NE(made, nullptr) << error_.description();
   uint32_t cls = 0;
+  QRVError error;
   ASSERT_TRUE(env_.services->fileManager->dataProtectionClassOfItemAtURL(made->url() + "/Documents", &cls, &error));
   EXPECT_EQ(cls, 3u);
   // SystemData never counts as user data: it gets no class.
   ASSERT_TRUE(env_.services->fileManager->dataProtectionClassOfItemAtURL(made->url() + "/SystemData", &cls, &error));
   EXPECT_EQ(cls, 0u);
-}
-
-TEST_F(CreateOrLookupTest, ListingAndRecreatingTheDefaultStructure) {
-  QRVError error;
-  for (const char* id : {"com.example.b", "com.example.a"})
-    ASSERT_NE(admin()->createOrLookupContainerWithContainerIdentity(identity(id, 2), true, false, true, &error), nullptr);
-  auto all = admin()->containersWithClass(QRVContainerClassAppData, false, &error);
-  ASSERT_TRUE(all);
-  ASSERT_EQ(all->size(), 2u);
-  EXPECT_EQ((*all)[0]->identifier(), "com.example.a");
-  EXPECT_FALSE(admin()->containersWithClass(14, false, &error));
-
-  auto a = admin()->metadataWithContainerIdentity(identity("com.example.a", 2), &error);
-  fs::remove_all(a->url() + "/Library");
-  ASSERT_TRUE(admin()->recreateDefaultStructureWithContainerIdentity(a->containerIdentity(), &error))
-      << error.description();
-  EXPECT_TRUE(fs::is_directory(a->url() + "/Library/Preferences"));
 }
 
 }  // namespace

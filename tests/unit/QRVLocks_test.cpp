@@ -5,22 +5,15 @@
 #include <array>
 #include <atomic>
 #include <chrono>
-#include <fstream>
 #include <functional>
 #include <random>
-#include <sstream>
 #include <thread>
 
 #include "support/QRVEventually.h"
-#include "support/QRVTestServices.h"
 
 namespace {
 
 using namespace std::chrono_literals;
-
-bool waitUntil(const std::function<bool()>& condition, std::chrono::milliseconds timeout = 5s) {
-  return QRVEventually(condition, timeout);
-}
 
 // A lock call made on a thread of its own; the lock it takes is released
 // by the test, from the test's thread (locks are not tied to threads).
@@ -32,7 +25,7 @@ class Attempt {
   }) {}
   ~Attempt() { thread_.join(); }
   bool granted() const { return granted_; }
-  bool waitGranted() { return waitUntil([this] { return granted_.load(); }); }
+  bool waitGranted() { return QRVEventually([this] { return granted_.load(); }); }
   // Still waiting after a short while: a waiter blocked on a condition
   // variable shows nothing else.
   bool stillWaiting() {
@@ -65,39 +58,30 @@ class LocksTest : public testing::Test {
 
 // --- Coexistence -------------------------------------------------------------
 
-TEST_F(LocksTest, ReadersShareAnIdentifierAndAWriterExcludesOnlyItsOwn) {
+TEST_F(LocksTest, ReadersShareAWriterExcludesOnlyItsOwnAndAWaitingWriterHoldsBackNewReaders) {
   lock_identifier_for_reading("X");
   lock_identifier_for_reading("X");
   EXPECT_EQ(TEST_lock_record_snapshot("X")->lockState, 2);
   {
     Attempt writer([] { lock_identifier_for_writing("X"); });
-    ASSERT_TRUE(waitUntil([] { return refCount("X") == 3; }));  // counted as a waiter
+    ASSERT_TRUE(QRVEventually([] { return refCount("X") == 3; }));  // counted as a waiter
     Attempt other([] { lock_identifier_for_writing("Y"); });
     EXPECT_TRUE(other.waitGranted());
+    Attempt reader([] { lock_identifier_for_reading("X"); });
+    ASSERT_TRUE(QRVEventually([] { return refCount("X") == 4; }));
     EXPECT_TRUE(writer.stillWaiting());
+    EXPECT_FALSE(reader.granted());
     unlock_identifier("X");
     EXPECT_TRUE(writer.stillWaiting());
     unlock_identifier("X");
     EXPECT_TRUE(writer.waitGranted());
     EXPECT_EQ(TEST_lock_record_snapshot("X")->lockState, -1);
+    EXPECT_FALSE(reader.granted());
+    unlock_identifier("X");
+    EXPECT_TRUE(reader.waitGranted());
   }
   unlock_identifier("X");
   unlock_identifier("Y");
-}
-
-TEST_F(LocksTest, AWaitingWriterHoldsBackNewReaders) {
-  lock_identifier_for_reading("X");
-  Attempt writer([] { lock_identifier_for_writing("X"); });
-  ASSERT_TRUE(waitUntil([] { return refCount("X") == 2; }));
-  Attempt reader([] { lock_identifier_for_reading("X"); });
-  ASSERT_TRUE(waitUntil([] { return refCount("X") == 3; }));
-  EXPECT_TRUE(reader.stillWaiting());
-  unlock_identifier("X");
-  EXPECT_TRUE(writer.waitGranted());
-  EXPECT_FALSE(reader.granted());
-  unlock_identifier("X");
-  EXPECT_TRUE(reader.waitGranted());
-  unlock_identifier("X");
 }
 
 TEST_F(LocksTest, GlobalReadCoexistsWithIdentifierReadersButNotWriters) {
@@ -153,7 +137,7 @@ TEST_F(LocksTest, GlobalWriteWaitsForEveryHolderAndThenExcludesEverything) {
     bool readerDone = false, writerDone = false;
     int globalReleases = 0;
     unlock_all_identifiers();
-    bool done = waitUntil([&] {
+    bool done = QRVEventually([&] {
       if (reader.granted() && !readerDone) unlock_identifier("X"), readerDone = true;
       if (writer.granted() && !writerDone) unlock_identifier("Z"), writerDone = true;
       if (TEST_lock_table_snapshot().allReaderWriterState != 0) unlock_all_identifiers(), globalReleases++;
@@ -166,50 +150,28 @@ TEST_F(LocksTest, GlobalWriteWaitsForEveryHolderAndThenExcludesEverything) {
 
 // --- Order and records ---------------------------------------------------------
 
-TEST_F(LocksTest, AnArrayIsTakenAscendingOnceAndReleasedDescending) {
+TEST_F(LocksTest, AnArrayIsTakenAscendingOnceAndHeldUntilItsLastHolderGoes) {
   // With A held elsewhere, [B, A, B] stops at A before it has touched B.
   lock_identifier_for_writing("A");
   {
     Attempt array([] { lock_identifier_for_writing({"B", "A", "B"}); });
-    ASSERT_TRUE(waitUntil([] { return refCount("A") == 2; }));
+    ASSERT_TRUE(QRVEventually([] { return refCount("A") == 2; }));
     EXPECT_FALSE(TEST_lock_record_snapshot("B").has_value());
     unlock_identifier("A");
     ASSERT_TRUE(array.waitGranted());
   }
   EXPECT_EQ(refCount("A"), 1u);  // each once
   EXPECT_EQ(refCount("B"), 1u);
-
-  // The release order shows in the debug log.
-  QRVTemporaryDirectory dir;
-  std::string log = dir.path() + "/locks.log";
-  ASSERT_TRUE(QRVLog::open("test", log, QRVLogLevel::kDebug, 1, 1 << 20));
-  unlock_identifier(std::vector<std::string>{"B", "A", "B"});
-  lock_identifier_for_reading(std::vector<std::string>{"D", "C"});
-  unlock_identifier(std::vector<std::string>{"D", "C"});
-  QRVLog::close();
-  std::stringstream text;
-  text << std::ifstream(log).rdbuf();
-  std::string s = text.str();
-  auto at = [&](const std::string& line) { return s.find(line); };
-  EXPECT_LT(at("Unlocked identifier B"), at("Unlocked identifier A"));
-  EXPECT_LT(at("Got lock on identifier C"), at("Got lock on identifier D"));
-  EXPECT_LT(at("Unlocked identifier D"), at("Unlocked identifier C"));
-  EXPECT_NE(at("Destroying lock for identifier A"), std::string::npos);
-}
-
-TEST_F(LocksTest, RecordLivesExactlyAsLongAsItsHoldersAndWaiters) {
-  EXPECT_FALSE(TEST_lock_record_snapshot("X").has_value());
-  lock_identifier_for_writing("X");
-  EXPECT_EQ(TEST_lock_table_snapshot().recordCount, 1u);
+  // A waiter keeps the record alive past its first holder.
   {
-    Attempt waiter([] { lock_identifier_for_reading("X"); });
-    ASSERT_TRUE(waitUntil([] { return refCount("X") == 2; }));
-    unlock_identifier("X");
+    Attempt waiter([] { lock_identifier_for_reading("B"); });
+    ASSERT_TRUE(QRVEventually([] { return refCount("B") == 2; }));
+    unlock_identifier(std::vector<std::string>{"B", "A", "B"});
     ASSERT_TRUE(waiter.waitGranted());
   }
-  EXPECT_EQ(refCount("X"), 1u);  // the record survived its first holder
-  unlock_identifier("X");
-  EXPECT_FALSE(TEST_lock_record_snapshot("X").has_value());
+  EXPECT_EQ(TEST_lock_record_snapshot("B")->lockState, 1);
+  EXPECT_FALSE(TEST_lock_record_snapshot("A").has_value());
+  unlock_identifier("B");
   lock_identifier_for_reading(std::vector<std::string>{});  // an empty list takes nothing
   EXPECT_EQ(TEST_lock_table_snapshot().recordCount, 0u);
 }
@@ -318,7 +280,7 @@ TEST_F(LocksTest, RandomLockingKeepsExclusionAndFinishes) {
 
   std::vector<std::thread> threads;
   for (int t = 0; t < kThreads; t++) threads.emplace_back(worker, 1234u + t);
-  if (!waitUntil([&] { return finished == kThreads; }, 180s)) {
+  if (!QRVEventually([&] { return finished == kThreads; }, 180s)) {
     // Deadlocked threads cannot be joined: say so and stop here.
     ADD_FAILURE() << "lock stress test deadlocked";
     std::abort();

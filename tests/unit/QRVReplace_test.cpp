@@ -36,9 +36,8 @@ class ReplaceTest : public testing::Test {
 
   std::shared_ptr<QRVClientConnection> connection(const std::string& caller, bool unrestricted,
                                                   std::optional<QRVPlist::Array> wipe = std::nullopt) {
-    auto user = env_.services->userIdentityCache->userIdentityForPersonalPersonaWithUID(501, 501);
-    auto identity = std::make_shared<const QRVClientIdentity>(caller, 501, 501, 42, user, QRVPlist::dictionary(), false,
-                                                              QRVAuditToken::make(501, 501, 42, 1));
+    auto identity = std::make_shared<const QRVClientIdentity>(caller, 501, 501, 42, mobile(), QRVPlist::dictionary(),
+                                                              false, QRVAuditToken::make(501, 501, 42, 1));
     return std::make_shared<QRVClientConnection>(identity, true, unrestricted, unrestricted, std::nullopt, wipe,
                                                  std::make_shared<QRVCommandQueue>(), env_.services);
   }
@@ -47,7 +46,8 @@ class ReplaceTest : public testing::Test {
   QRVUserIdentityRef mobile() {
     return env_.services->userIdentityCache->userIdentityForPersonalPersonaWithUID(501, 501);
   }
-  QRVContainerIdentityRef identity(const std::string& id, QRVContainerClass c, QRVUserIdentityRef user = nullptr) {
+  QRVContainerIdentityRef identity(const std::string& id, QRVContainerClass c = QRVContainerClassAppData,
+                                   QRVUserIdentityRef user = nullptr) {
     QRVError error;
     return QRVContainerIdentity::containerIdentityWithUserIdentity(user ? user : mobile(), id, c, &error);
   }
@@ -70,75 +70,57 @@ class ReplaceTest : public testing::Test {
 };
 
 TEST_F(ReplaceTest, ReplacePutsNewContentInPlaceAndLeavesNoJournal) {
-  auto app = identity("com.example.app", QRVContainerClassAppData);
-  auto old = create(app);
-  writeText(old->url() + "/old.txt", "old");
-  auto fresh = create(app, true);
-  writeText(fresh->url() + "/new.txt", "new");
+  for (bool preserve : {false, true}) {
+    SCOPED_TRACE(preserve ? "preserving the old UUID" : "taking the new UUID");
+    auto app = identity(preserve ? "com.example.kept" : "com.example.app");
+    auto old = create(app);
+    writeText(old->url() + "/old.txt", "old");
+    auto fresh = create(app, true);
+    writeText(fresh->url() + "/new.txt", "new");
 
-  QRVError error;
-  ASSERT_TRUE(
-      admin()->replaceContainerIdentity(old->containerIdentity(), fresh->containerIdentity(), false, false, &error))
-      << error.description();
-  const std::string dest = fs::path(old->url()).parent_path().string() + "/" + fresh->uuid().string();
-  EXPECT_EQ(readText(dest + "/new.txt"), "new");
-  EXPECT_FALSE(fs::exists(old->url()));
-  EXPECT_FALSE(fs::exists(fresh->url()));
-  EXPECT_EQ(entriesIn(replaceDir()), 0u);
+    ASSERT_EQ(replaceCode(old->containerIdentity(), fresh->containerIdentity(), preserve), 1u);
+    // Kept, the old UUID keeps the old path; else the new UUID names it.
+    const QRVUUID uuid = preserve ? old->uuid() : fresh->uuid();
+    const std::string dest = fs::path(old->url()).parent_path().string() + "/" + uuid.string();
+    EXPECT_EQ(readText(dest + "/new.txt"), "new");
+    EXPECT_FALSE(fs::exists(dest + "/old.txt"));
+    EXPECT_EQ(fs::exists(old->url()), preserve);
+    EXPECT_FALSE(fs::exists(fresh->url()));
+    EXPECT_EQ(entriesIn(replaceDir()), 0u);
 
-  auto found = lookup(app, &error);
-  ASSERT_NE(found, nullptr) << error.description();
-  EXPECT_EQ(found->uuid(), fresh->uuid());
-  EXPECT_EQ(found->url(), dest);
-  // The old directory went to death row, not away.
-  EXPECT_GE(entriesIn(env_.services->globalConfiguration->deathrowDirectory()), 1u);
-}
-
-TEST_F(ReplaceTest, PreservingTheUUIDKeepsTheOldPathAndWritesTheUUIDIntoTheMetadata) {
-  auto app = identity("com.example.app", QRVContainerClassAppData);
-  auto old = create(app);
-  writeText(old->url() + "/old.txt", "old");
-  auto fresh = create(app, true);
-  writeText(fresh->url() + "/new.txt", "new");
-
-  EXPECT_EQ(replaceCode(old->containerIdentity(), fresh->containerIdentity(), true), 1u);
-  EXPECT_EQ(readText(old->url() + "/new.txt"), "new");
-  EXPECT_FALSE(fs::exists(old->url() + "/old.txt"));
-  QRVError error;
-  auto onDisk = QRVMetadata::readAndValidateMetadataAtUrl(old->url(), mobile(), true, *env_.services->fileManager,
-                                                          *env_.services->userIdentityCache, &error);
-  ASSERT_NE(onDisk, nullptr) << error.description();
-  EXPECT_EQ(onDisk->uuid(), old->uuid());
-  auto found = lookup(app, &error);
-  ASSERT_NE(found, nullptr);
-  EXPECT_EQ(found->uuid(), old->uuid());
-  EXPECT_EQ(found->url(), old->url());
+    QRVError error;
+    auto onDisk = QRVMetadata::readAndValidateMetadataAtUrl(dest, mobile(), true, *env_.services->fileManager,
+                                                            *env_.services->userIdentityCache, &error);
+    ASSERT_NE(onDisk, nullptr) << error.description();
+    EXPECT_EQ(onDisk->uuid(), uuid);
+    auto found = lookup(app, &error);
+    ASSERT_NE(found, nullptr) << error.description();
+    EXPECT_EQ(found->uuid(), uuid);
+    EXPECT_EQ(found->url(), dest);
+  }
+  // The old directories went to death row, not away.
+  EXPECT_GE(entriesIn(env_.services->globalConfiguration->deathrowDirectory()), 2u);
 }
 
 TEST_F(ReplaceTest, EachCheckAnswersItsCodeAndMovesNothing) {
-  auto app = identity("com.example.app", QRVContainerClassAppData);
-  auto other = identity("com.example.other", QRVContainerClassAppData);
-  auto plugin = identity("com.example.plugin", QRVContainerClassPluginData);
-  auto a = create(app), b = create(other), p = create(plugin);
+  auto a = create(identity("com.example.app")), b = create(identity("com.example.other"));
+  auto p = create(identity("com.example.plugin", QRVContainerClassPluginData));
   writeText(a->url() + "/keep.txt", "a");
 
-  EXPECT_EQ(replaceCode(nullptr, b->containerIdentity()), 38u);
-  EXPECT_EQ(replaceCode(a->containerIdentity(), other), 11u);      // no UUID on the new side
-  EXPECT_EQ(replaceCode(app, b->containerIdentity(), true), 11u);  // preserving without an old UUID
-  EXPECT_EQ(replaceCode(a->containerIdentity(), p->containerIdentity()), 23u);
-  EXPECT_EQ(replaceCode(a->containerIdentity(), a->containerIdentity()), 22u);
-
-  // The same identifier under another user identity.
   QRVError error;
   auto elsewhere = QRVConcreteContainerIdentity::containerIdentityWithUUID(
       b->uuid(),
       QRVUserIdentity::make(502, 502, env_.root.path() + "/private/var/other", "", QRVPersonaTypePersonal, 502),
       "com.example.other", QRVContainerClassAppData, &error);
   ASSERT_NE(elsewhere, nullptr) << error.description();
-  EXPECT_EQ(replaceCode(a->containerIdentity(), elsewhere), 76u);
-
   auto ghost = QRVConcreteContainerIdentity::containerIdentityWithUUID(QRVUUID::random(), mobile(), "com.example.ghost",
                                                                        QRVContainerClassAppData, &error);
+  EXPECT_EQ(replaceCode(nullptr, b->containerIdentity()), 38u);
+  EXPECT_EQ(replaceCode(a->containerIdentity(), identity("com.example.other")), 11u);  // no UUID on the new side
+  EXPECT_EQ(replaceCode(identity("com.example.app"), b->containerIdentity(), true), 11u);  // preserving, no old UUID
+  EXPECT_EQ(replaceCode(a->containerIdentity(), p->containerIdentity()), 23u);
+  EXPECT_EQ(replaceCode(a->containerIdentity(), a->containerIdentity()), 22u);
+  EXPECT_EQ(replaceCode(a->containerIdentity(), elsewhere), 76u);  // same identifier, another user
   EXPECT_EQ(replaceCode(a->containerIdentity(), ghost), 21u);
   // A live new container already sits at its own destination.
   EXPECT_EQ(replaceCode(a->containerIdentity(), b->containerIdentity()), 27u);
@@ -153,12 +135,12 @@ class RecoveryTest : public ReplaceTest {
   void SetUp() override {
     ReplaceTest::SetUp();
     if (IsSkipped()) return;
-    base_ = env_.root.path() + "/replace-test";
-    oldURL_ = base_ + "/live/" + QRVUUID::random().string();
-    staging_ = base_ + "/staging/" + QRVUUID::random().string();
-    dest_ = base_ + "/live/" + QRVUUID::random().string();
-    newURL_ = base_ + "/transient/" + QRVUUID::random().string();
-    for (const char* d : {"/live", "/staging", "/transient"}) fs::create_directories(base_ + d);
+    const std::string base = env_.root.path() + "/replace-test";
+    oldURL_ = base + "/live/" + QRVUUID::random().string();
+    staging_ = base + "/staging/" + QRVUUID::random().string();
+    dest_ = base + "/live/" + QRVUUID::random().string();
+    newURL_ = base + "/transient/" + QRVUUID::random().string();
+    for (const char* d : {"/live", "/staging", "/transient"}) fs::create_directories(base + d);
     fs::create_directories(replaceDir());
   }
   void writeJournal() {
@@ -176,14 +158,8 @@ class RecoveryTest : public ReplaceTest {
     EXPECT_EQ(entriesIn(replaceDir()), 0u);
   }
 
-  std::string base_, oldURL_, staging_, dest_, newURL_;
+  std::string oldURL_, staging_, dest_, newURL_;
 };
-
-TEST_F(RecoveryTest, NothingToRecoverWithoutAReplaceDirectory) {
-  fs::remove_all(replaceDir());
-  QRVError error;
-  EXPECT_TRUE(admin()->_recoverFromReplaceOperationsWithError(&error)) << error.description();
-}
 
 TEST_F(RecoveryTest, EachOfTheFourStatesEndsWithOneContainerInPlace) {
   // Not started: the old directory is still in place.
@@ -212,12 +188,16 @@ TEST_F(RecoveryTest, EachOfTheFourStatesEndsWithOneContainerInPlace) {
   EXPECT_FALSE(fs::exists(oldURL_));
 }
 
-TEST_F(RecoveryTest, BootSetUpRunsTheRecovery) {
+TEST_F(RecoveryTest, BootSetUpRunsTheRecoveryAndNoReplaceDirectoryIsNothingToDo) {
   marked(staging_, "old");
   writeJournal();
   admin()->quorvaSetup();
   EXPECT_EQ(readText(oldURL_ + "/mark"), "old");
   EXPECT_EQ(entriesIn(replaceDir()), 0u);
+
+  fs::remove_all(replaceDir());
+  QRVError error;
+  EXPECT_TRUE(admin()->_recoverFromReplaceOperationsWithError(&error)) << error.description();
 }
 
 TEST_F(RecoveryTest, UnreadableOrIncompleteJournalsAreDiscardedWithoutAMove) {
@@ -231,10 +211,10 @@ TEST_F(RecoveryTest, UnreadableOrIncompleteJournalsAreDiscardedWithoutAMove) {
   ASSERT_TRUE(QRV_writeToURL(*env_.services->fileManager, partial, replaceDir() + "/partial.plist", &error));
   ASSERT_TRUE(QRV_writeToURL(*env_.services->fileManager, QRVPlist::array(), replaceDir() + "/array.plist", &error));
 
-  EXPECT_FALSE(admin()->_readAndValidateReplaceFileAtUrl(replaceDir() + "/partial.plist", &error));
-  EXPECT_EQ(error.code(), 35u);
-  EXPECT_FALSE(admin()->_readAndValidateReplaceFileAtUrl(replaceDir() + "/garbage.plist", &error));
-  EXPECT_EQ(error.code(), 35u);
+  for (const char* name : {"/partial.plist", "/garbage.plist"}) {
+    EXPECT_FALSE(admin()->_readAndValidateReplaceFileAtUrl(replaceDir() + name, &error));
+    EXPECT_EQ(error.code(), 35u) << name;
+  }
   EXPECT_FALSE(admin()->_writeToDiskReplaceAt(replaceDir() + "/x.plist", oldURL_, "", staging_, dest_, &error));
   EXPECT_EQ(error.code(), 33u);
 
@@ -243,19 +223,30 @@ TEST_F(RecoveryTest, UnreadableOrIncompleteJournalsAreDiscardedWithoutAMove) {
   EXPECT_EQ(readText(staging_ + "/mark"), "old");
 }
 
-TEST_F(ReplaceTest, WipeKeepsUUIDAndPathAndLeavesTheDefaultStructureEmpty) {
-  auto app = identity("com.example.app", QRVContainerClassAppData);
+TEST_F(ReplaceTest, WipeKeepsUUIDAndPathAndLeavesOnlyTheDefaultStructure) {
+  auto app = identity("com.example.app");
   auto old = create(app);
   writeText(old->url() + "/old.txt", "old");
   auto subdirectories = env_.fileSystem->defaultSubdirectories(QRVContainerClassAppData);
   ASSERT_FALSE(subdirectories.empty());
   writeText(old->url() + "/" + subdirectories.front() + "/deep.txt", "old");
 
-  auto client = connection("com.example.settings", false, QRVPlist::Array{QRVPlist::string("com.example.app")});
+  // Refused outside the caller's list, without a list, and for other classes.
   QRVError error;
+  auto notListed = connection("com.example.settings", false, QRVPlist::Array{QRVPlist::string("com.example.other")});
+  EXPECT_FALSE(notListed->deleteDataContainerContentWithContainerIdentity(app, &error));
+  EXPECT_EQ(error.code(), 55u);
+  EXPECT_FALSE(connection("com.example.settings", false)->deleteDataContainerContentWithContainerIdentity(app, &error));
+  EXPECT_EQ(error.code(), 55u);
+  EXPECT_FALSE(admin()->deleteDataContainerContentWithContainerIdentity(
+      identity("com.example.app", QRVContainerClassAppBundle, env_.services->userIdentityCache->defaultUserIdentity()),
+      &error));
+  EXPECT_EQ(error.code(), 11u);
+  EXPECT_EQ(readText(old->url() + "/old.txt"), "old");
+
+  auto client = connection("com.example.settings", false, QRVPlist::Array{QRVPlist::string("com.example.app")});
   ASSERT_TRUE(client->deleteDataContainerContentWithContainerIdentity(app, &error)) << error.description();
   EXPECT_FALSE(client->isUnrestricted());  // widened only for the wipe itself
-
   auto found = lookup(app, &error);
   ASSERT_NE(found, nullptr) << error.description();
   EXPECT_EQ(found->uuid(), old->uuid());
@@ -272,28 +263,9 @@ TEST_F(ReplaceTest, WipeKeepsUUIDAndPathAndLeavesTheDefaultStructureEmpty) {
   EXPECT_EQ(entriesIn(replaceDir()), 0u);
 }
 
-TEST_F(ReplaceTest, WipeIsRefusedOutsideTheCallersListAndForNonDataClasses) {
-  auto app = identity("com.example.app", QRVContainerClassAppData);
-  auto old = create(app);
-  writeText(old->url() + "/old.txt", "old");
-
-  QRVError error;
-  auto client = connection("com.example.settings", false, QRVPlist::Array{QRVPlist::string("com.example.other")});
-  EXPECT_FALSE(client->deleteDataContainerContentWithContainerIdentity(app, &error));
-  EXPECT_EQ(error.code(), 55u);
-  EXPECT_FALSE(connection("com.example.settings", false)->deleteDataContainerContentWithContainerIdentity(app, &error));
-  EXPECT_EQ(error.code(), 55u);
-  EXPECT_FALSE(admin()->deleteDataContainerContentWithContainerIdentity(
-      identity("com.example.app", QRVContainerClassAppBundle, env_.services->userIdentityCache->defaultUserIdentity()),
-      &error));
-  EXPECT_EQ(error.code(), 11u);
-  EXPECT_EQ(readText(old->url() + "/old.txt"), "old");
-}
-
 TEST_F(ReplaceTest, DeleteCommandsStageThroughTheQueue) {
-  auto app = identity("com.example.app", QRVContainerClassAppData);
-  auto other = identity("com.example.other", QRVContainerClassAppData);
-  auto a = create(app), b = create(other);
+  auto app = identity("com.example.app");
+  auto a = create(app), b = create(identity("com.example.other"));
   auto client = admin();
   auto uuidData = [](const QRVUUID& u) { return QRVPlist::data(QRVPlist::Bytes(u.bytes().begin(), u.bytes().end())); };
 
@@ -332,7 +304,7 @@ TEST_F(ReplaceTest, DeleteCommandsStageThroughTheQueue) {
   EXPECT_EQ(error.code(), 21u);
 }
 
-TEST(ApplicationTerminationAssertionTest, HoldsUntilInvalidatedAndChecksTheReason) {
+TEST(ApplicationTerminationTest, AssertionHoldsUntilInvalidatedAndChecksTheReason) {
   auto service = std::make_shared<QRVFakeApplicationTermination>();
   {
     QRVApplicationTerminationAssertion assertion(service, "com.example.app", 1);
@@ -342,10 +314,8 @@ TEST(ApplicationTerminationAssertionTest, HoldsUntilInvalidatedAndChecksTheReaso
     EXPECT_EQ(service->held, 0);
   }
   service->refuse = true;
-  QRVApplicationTerminationAssertion refused(service, "com.example.app", 0);
-  EXPECT_FALSE(refused.isHeld());
-  QRVApplicationTerminationAssertion unavailable(nullptr, "com.example.app", -1);
-  EXPECT_FALSE(unavailable.isHeld());
+  EXPECT_FALSE(QRVApplicationTerminationAssertion(service, "com.example.app", 0).isHeld());
+  EXPECT_FALSE(QRVApplicationTerminationAssertion(nullptr, "com.example.app", -1).isHeld());
 
   EXPECT_DEATH(QRVApplicationTerminationAssertion(service, "com.example.app", 7), "");
   EXPECT_DEATH(
@@ -356,7 +326,7 @@ TEST(ApplicationTerminationAssertionTest, HoldsUntilInvalidatedAndChecksTheReaso
       "");
 }
 
-TEST(LinuxApplicationTerminationTest, FreezesAndKillsTheScopeWhileHeld) {
+TEST(ApplicationTerminationTest, LinuxFreezesAndKillsTheScopeWhileHeld) {
   QRVTemporaryDirectory slice;
   const std::string scope = slice.path() + "/app-com.example.app.scope";
   fs::create_directories(scope);
