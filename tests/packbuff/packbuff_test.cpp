@@ -156,8 +156,7 @@ TEST(PackbuffTest, RejectsBadInputWithoutMoving) {
 }
 
 TEST(PackbuffTest, GrowsByBlockSizePlusItem) {
-  sb_packbuff* pb = sb_packbuff_new(3);
-  EXPECT_NE(Printed(pb).find("  block_size:      256\n"), std::string::npos);
+  sb_packbuff* pb = sb_packbuff_new(3);  // too small: the default block
   EXPECT_EQ(Sizes(pb), "256/8/248");
   sb_packbuff_free(pb);
 
@@ -211,31 +210,13 @@ TEST(PackbuffTest, UnmapsWholeMappedRegion) {
   EXPECT_EQ(errno, ENOMEM);
 }
 
-TEST(PackbuffTest, PrintsHandleAndItems) {
-  sb_packbuff* pb = sb_packbuff_new(64);
-  sb_packbuff_pack_uint32(pb, 5, 7);
-  sb_packbuff_pack_string(pb, 1, "abc", 3);
-  sb_packbuff_pack_bytes(pb, 2, "\x01\x02", 2);
-  auto* p = static_cast<const char*>(sb_packbuff_get_bytes(pb));
-  auto at = [&](int offset) { return static_cast<const void*>(p + offset); };
-  char want[1024];
-  snprintf(want, sizeof(want),
-           "packbuff: %p\n  block_size:      64\n  dealloc_type:    free()\n"
-           "  bytes_allocated: 64\n  bytes_used:      48\n  bytes_remaining: 16\n"
-           "  item_buffer %p, item: %p\n\n"
-           "   0:%p -- value type 5 --inline value: 7\n"
-           "   1:%p -- value type 1 --string (%p, 4 pad bytes, size: 4): \n     `abc'\n"
-           "   2:%p -- value type 2 --bytes (%p, 6 pad bytes, size: 2)\n"
-           "*  3: %p -- END\n",
-           static_cast<void*>(pb), at(0), at(40), at(0), at(8), at(16), at(24), at(32), at(40));
-  EXPECT_EQ(Printed(pb), want);
-  sb_packbuff_free(pb);
-
+TEST(PackbuffTest, PrintWalkStaysInsideHostileItems) {
   // Unknown items are stepped over; a length past the used bytes ends the walk.
   Wire bad(Hex("0900 0100 00000000 0200 0100 c8000000 78000000 00000000"));
-  p = reinterpret_cast<const char*>(bad.bytes.data());
+  auto at = [&](int offset) { return static_cast<const void*>(bad.bytes.data() + offset); };
   std::string out = Printed(bad.pb);
   EXPECT_NE(out.find("  dealloc_type:    None\n"), std::string::npos);
+  char want[512];
   snprintf(want, sizeof(want),
            "*  0:%p -- value type 1 --*Unknown item type* 9\n"
            "   1:%p -- value type 1 --string (%p, 0 pad bytes, size: 200): \n"

@@ -117,18 +117,11 @@ TEST_F(LayoutTest, DirectoryThatCannotBeCreatedStillYieldsItsPath) {
   EXPECT_FALSE(std::filesystem::exists(config().deathrowDirectory()));
 }
 
-TEST_F(LayoutTest, MobileAccountAndInternalImage) {
+TEST_F(LayoutTest, MobileAccount) {
   EXPECT_EQ(config().currentMobileUserId(), 501u);
   EXPECT_EQ(config().currentMobileGroupId(), 501u);
-  env_.systemInfo->internal = true;
-  EXPECT_TRUE(config().isInternalImage());
-  config().setIsInternalImage(false);
-  EXPECT_FALSE(config().isInternalImage());
-  EXPECT_EQ(QRVGlobalConfiguration::appUserDataItemNames(),
-            (std::vector<std::string>{"Documents", "Library", "tmp", "Coinvault"}));
 
   // Without a "mobile" account both ids stay 0.
-  QRVFakeAccounts none;
   QRVGlobalConfiguration bare(env_.root.path(), env_.systemInfo, std::make_shared<QRVFakeAccounts>(),
                               env_.services->fileManager);
   EXPECT_EQ(bare.currentMobileUserId(), 0u);

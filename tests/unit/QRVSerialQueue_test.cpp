@@ -10,6 +10,8 @@
 #include <thread>
 #include <vector>
 
+#include "support/QRVEventually.h"
+
 namespace {
 
 using namespace std::chrono_literals;
@@ -17,17 +19,10 @@ constexpr auto kTimeout = 30s;  // reached only when something is broken
 
 // A count that threads wait on, with a bound.
 struct Counter {
-  std::mutex m;
-  std::condition_variable cv;
-  int n = 0;
-  void add() {
-    std::lock_guard<std::mutex> l(m);
-    n++;
-    cv.notify_all();
-  }
+  std::atomic<int> n{0};
+  void add() { n++; }
   bool waitFor(int target, std::chrono::milliseconds timeout = kTimeout) {
-    std::unique_lock<std::mutex> l(m);
-    return cv.wait_for(l, timeout, [&] { return n >= target; });
+    return QRVEventually([&] { return n >= target; }, timeout);
   }
 };
 

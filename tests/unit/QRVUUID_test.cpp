@@ -33,9 +33,8 @@ TEST(QRVUUIDTest, TextIsUpperCase8_4_4_4_12AndParsesEitherCase) {
   EXPECT_EQ(QRVUUID::fromString("01234567-89ab-cdef-fedc-ba9876543210"), u);
 
   for (const char* bad : {"", "01234567-89AB-CDEF-FEDC-BA987654321", "01234567-89AB-CDEF-FEDC-BA98765432100",
-                          "0123456789ABCDEFFEDCBA9876543210", "0123456-789AB-CDEF-FEDC-BA9876543210",
-                          "01234567-89AB-CDEF-FEDC-BA987654321G", "01234567-89AB-CDEF-FEDC+BA9876543210",
-                          "01234567-89AB-CDEF-FEDC-BA98765432 0"})
+                          "0123456789ABCDEFFEDCBA9876543210", "01234567-89AB-CDEF-FEDC-BA987654321G",
+                          "01234567-89AB-CDEF-FEDC-BA987654321g"})
     EXPECT_FALSE(QRVUUID::fromString(bad)) << bad;
   for (size_t i = 0; i < text.size(); i++) {  // every position: a dash, or a digit, out of place
     std::string moved = text;

@@ -4,6 +4,7 @@
 
 #include "QRVCurrentPersona.h"
 #include "fake/QRVFakePlatform.h"
+#include "support/QRVEventually.h"
 
 namespace {
 
@@ -92,27 +93,17 @@ TEST_F(UserIdentityCacheTest, PersonaListChangeFlushesAndRebuilds) {
   list[1].uniqueString = "WORK2";
   personas_->change(list);
   // The flush runs asynchronously; the next question sees the new list.
-  for (int i = 0; i < 500 && cache->userIdentityForPersonaUniqueString("WORK2", 501, 501) == nullptr; i++)
-    std::this_thread::sleep_for(std::chrono::milliseconds(5));
-  EXPECT_NE(cache->userIdentityForPersonaUniqueString("WORK2", 501, 501), nullptr);
+  EXPECT_TRUE(QRVEventually([&] { return cache->userIdentityForPersonaUniqueString("WORK2", 501, 501) != nullptr; }));
   EXPECT_EQ(cache->userIdentityForPersonaUniqueString("WORK", 501, 501), nullptr);
 }
 
-TEST_F(UserIdentityCacheTest, EmptyListIsRetriedAndFinallyFatal) {
-  personas_->supported = true;
-  personas_->list.clear();
-  EXPECT_DEATH(
-      {
-        auto cache = makeCache();
-        cache->userIdentityForPersonalPersona();
-      },
-      "Could not obtain persona attributes after exhausting retries.");
-}
-
-TEST_F(UserIdentityCacheTest, ListWithoutPersonalPersonaIsRetried) {
+TEST_F(UserIdentityCacheTest, EmptyListOrNoPersonalPersonaIsRetriedAndFinallyFatal) {
   personas_->supported = true;
   personas_->list.erase(personas_->list.begin());
   EXPECT_DEATH(makeCache()->unspecificUserIdentity(), "exhausting retries");
+  personas_->list.clear();
+  EXPECT_DEATH(makeCache()->userIdentityForPersonalPersona(),
+               "Could not obtain persona attributes after exhausting retries.");
 }
 
 }  // namespace
