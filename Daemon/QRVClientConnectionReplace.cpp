@@ -32,19 +32,6 @@ constexpr const char* kNewURLKey = "QRVReplaceOperationNewURL";
 constexpr const char* kStagingURLKey = "QRVReplaceOperationStagingURL";
 constexpr const char* kDestURLKey = "QRVReplaceOperationDestURL";
 
-std::string lastPathComponent(const std::string& path) {
-  std::string p = path;
-  while (p.size() > 1 && p.back() == '/') p.pop_back();
-  size_t slash = p.rfind('/');
-  return slash == std::string::npos ? p : p.substr(slash + 1);
-}
-
-std::string withoutTrailingSlash(std::string p) {
-  while (p.size() > 1 && p.back() == '/') p.pop_back();
-  return p;
-}
-
-
 // The data classes: the only ones whose contents belong to an application's
 // user and may be wiped.
 bool isWipeableDataClass(QRVContainerClass c) {
@@ -123,10 +110,10 @@ std::optional<QRVPlist> QRVClientConnection::_readAndValidateReplaceFileAtUrl(co
     return std::nullopt;
   }
   return QRVPlist::dictionary()
-      .set(kOldURLKey, QRVPlist::string(withoutTrailingSlash(oldURL)))
-      .set(kNewURLKey, QRVPlist::string(withoutTrailingSlash(newURL)))
-      .set(kStagingURLKey, QRVPlist::string(withoutTrailingSlash(staging)))
-      .set(kDestURLKey, QRVPlist::string(withoutTrailingSlash(dest)));
+      .set(kOldURLKey, QRVPlist::string(QRVPathWithoutTrailingSlashes(oldURL)))
+      .set(kNewURLKey, QRVPlist::string(QRVPathWithoutTrailingSlashes(newURL)))
+      .set(kStagingURLKey, QRVPlist::string(QRVPathWithoutTrailingSlashes(staging)))
+      .set(kDestURLKey, QRVPlist::string(QRVPathWithoutTrailingSlashes(dest)));
 }
 
 bool QRVClientConnection::_recoverFromReplaceOperationsWithError(QRVError* error) {
@@ -218,10 +205,10 @@ bool QRVClientConnection::replaceContainerIdentity(const QRVContainerIdentityRef
     if (!oldMetadata) return notFound(*oldIdentity);
     QRVMetadataRef newMetadata = find(*newIdentity, true);
     if (!newMetadata) return notFound(*newIdentity);
-    const std::string oldURL = withoutTrailingSlash(oldMetadata->url());
-    const std::string newURL = withoutTrailingSlash(newMetadata->url());
+    const std::string oldURL = QRVPathWithoutTrailingSlashes(oldMetadata->url());
+    const std::string newURL = QRVPathWithoutTrailingSlashes(newMetadata->url());
     if (oldURL == newURL) return QRVFail(error, QRV_ERROR(22, "Can't replace the same container at {}", oldURL));
-    if (!QRVUUID::fromString(lastPathComponent(newURL)))
+    if (!QRVUUID::fromString(QRVLastPathComponent(newURL)))
       return QRVFail(error, QRV_ERROR(10, "Invalid URL (last path component not UUID): {}", newURL));
 
     const QRVUUID keptUUID = preserveOldUUID ? *oldIdentity->uuid() : *newIdentity->uuid();
@@ -229,7 +216,7 @@ bool QRVClientConnection::replaceContainerIdentity(const QRVContainerIdentityRef
     std::optional<std::string> parent =
         config.containerDirectoryURLForUserIdentity(userIdentity, containerClass, transient);
     if (!parent) return QRVFail(error, QRV_ERROR(11, "Can't act on an invalid container class: {}", containerClass));
-    const std::string dest = withoutTrailingSlash(*parent) + "/" + keptUUID.string();
+    const std::string dest = QRVPathWithoutTrailingSlashes(*parent) + "/" + keptUUID.string();
     // When the old UUID is kept the destination is the old directory's own
     // place, which the first rename empties.
     if (dest != oldURL) {
@@ -238,7 +225,7 @@ bool QRVClientConnection::replaceContainerIdentity(const QRVContainerIdentityRef
       auto existing = cache.allContainersForUserIdentity(userIdentity, containerClass, transient, &listError);
       if (existing) {
         for (const QRVMetadataRef& m : *existing) {
-          if (withoutTrailingSlash(m->url()) == dest)
+          if (QRVPathWithoutTrailingSlashes(m->url()) == dest)
             return QRVFail(error,
                            QRV_ERROR(27, "Container with identifier: {}, class: {}, transient: {} already exists",
                                      m->identifier(), containerClass, transient ? 1 : 0));
@@ -247,9 +234,9 @@ bool QRVClientConnection::replaceContainerIdentity(const QRVContainerIdentityRef
     }
 
     const std::string stagingParent = config.stagingDirectoryURLForUserIdentity(userIdentity, containerClass);
-    const std::string staging = withoutTrailingSlash(stagingParent) + "/" + QRVUUID::random().string();
+    const std::string staging = QRVPathWithoutTrailingSlashes(stagingParent) + "/" + QRVUUID::random().string();
     const std::string replaceDirectory = config.replaceDirectory();
-    const std::string journalURL = withoutTrailingSlash(replaceDirectory) + "/" + QRVUUID::random().string() + ".plist";
+    const std::string journalURL = QRVPathWithoutTrailingSlashes(replaceDirectory) + "/" + QRVUUID::random().string() + ".plist";
     QRVError step;
     if (!fm.createDirectoryAtURL(replaceDirectory, true, 0755, &step) ||
         !fm.createDirectoryAtURL(stagingParent, true, 0755, &step) ||

@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <exception>
 
+#include "QRVDictionaryAdditions.h"
 #include "QRVExceptionReporter.h"
 #include "QRVFileManager.h"
 #include "QRVGlobalConfiguration.h"
@@ -12,12 +13,6 @@
 namespace {
 
 const char* transientSuffix(bool transient) { return transient ? "(transient)" : ""; }
-
-std::string lastPathComponent(std::string path) {
-  while (path.size() > 1 && path.back() == '/') path.pop_back();
-  size_t slash = path.rfind('/');
-  return slash == std::string::npos ? path : path.substr(slash + 1);
-}
 
 std::string shortDescription(const QRVUserIdentityRef& u) { return u ? u->shortDescription() : "(null)"; }
 std::string identifierOf(const QRVUserIdentityRef& u) { return u ? u->identifier() : "(null)"; }
@@ -76,7 +71,7 @@ std::string QRVContainerCache::cacheKey(const QRVUserIdentityRef& userIdentity, 
 }
 
 bool QRVContainerCache::containerURL(const std::string& url, QRVContainerClass isValidForContainerClass) {
-  const std::string name = lastPathComponent(url);
+  const std::string name = QRVLastPathComponent(url);
   if (QRVUUID::fromString(name)) return true;
   if (isValidForContainerClass == QRVContainerClassSystemData) return wellKnownNames_->systemContainerIdIsWellknown(name);
   if (isValidForContainerClass == QRVContainerClassSystemGroup)

@@ -25,9 +25,13 @@ std::string QRVPathByAppendingComponent(const std::string& directory, const std:
   return directory.back() == '/' ? directory + component : directory + "/" + component;
 }
 
+std::string QRVPathWithoutTrailingSlashes(std::string path) {
+  while (path.size() > 1 && path.back() == '/') path.pop_back();
+  return path;
+}
+
 std::string QRVLastPathComponent(const std::string& path) {
-  std::string p = path;
-  while (p.size() > 1 && p.back() == '/') p.pop_back();
+  std::string p = QRVPathWithoutTrailingSlashes(path);
   size_t slash = p.rfind('/');
   return slash == std::string::npos ? p : p.substr(slash + 1);
 }

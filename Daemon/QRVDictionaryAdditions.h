@@ -26,6 +26,8 @@ std::optional<QRVPlist> QRV_dictionaryWithContentsOfURL(QRVFileManager& fileMana
 std::string QRVPathByAppendingComponent(const std::string& directory, const std::string& component);
 // The last component of `path`, ignoring trailing slashes.
 std::string QRVLastPathComponent(const std::string& path);
+// `path` without trailing slashes ("/" stays "/").
+std::string QRVPathWithoutTrailingSlashes(std::string path);
 
 // True when a component of `path` is exactly "..": such a relative path
 // could climb out of the directory it is meant for.

@@ -2,6 +2,7 @@
 
 #include <vector>
 
+#include "QRVDictionaryAdditions.h"
 #include "QRVFileManager.h"
 #include "QRVGlobalConfiguration.h"
 #include "QRVLog.h"
@@ -35,17 +36,12 @@ std::string join(const std::vector<std::string>& parts, size_t count) {
   return path.empty() ? "/" : path;
 }
 
-std::string withoutTrailingSlashes(std::string path) {
-  while (path.size() > 1 && path.back() == '/') path.pop_back();
-  return path;
-}
-
 // The container directory of a metadata file, as the caller spelled it.
 std::string directoryOf(const std::string& fileURL) {
-  std::string path = withoutTrailingSlashes(fileURL);
+  std::string path = QRVPathWithoutTrailingSlashes(fileURL);
   size_t slash = path.rfind('/');
   if (slash == std::string::npos) return ".";
-  return slash == 0 ? "/" : withoutTrailingSlashes(path.substr(0, slash));
+  return slash == 0 ? "/" : QRVPathWithoutTrailingSlashes(path.substr(0, slash));
 }
 
 std::string appending(const std::string& directory, const std::string& name) {
