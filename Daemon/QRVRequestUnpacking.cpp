@@ -7,6 +7,13 @@ namespace QRVRequestUnpacking {
 QRVUserIdentityRef userIdentityForContainerIdentifier(const QRVPlist& request, QRVContainerClass containerClass,
                                                       QRVClientConnection& connection, QRVError* error) {
   QRVServices& services = connection.services();
+  // The open commands also reach callers the trust store does not know. Such
+  // a caller has no identifier and no user of its own, so no container is
+  // its to name; everything after this point relies on an identity.
+  if (!connection.clientIdentity()) {
+    QRVFail(error, QRV_ERROR(55, "Unidentified caller may not name a container"));
+    return nullptr;
+  }
   if (!QRVUserIdentity::isUserIdentityRequiredForContainerClass(containerClass))
     return services.userIdentityCache->defaultUserIdentity();
   const QRVUserIdentityRef& own = connection.clientIdentity()->userIdentity();

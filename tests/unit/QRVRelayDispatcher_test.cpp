@@ -242,3 +242,26 @@ TEST_F(RelayDispatcherTest, RegisteredEntitlementsAreRecordedOnlyForCallersWithP
 }
 
 }  // namespace
+
+// The open commands reach callers the trust store does not know, who have no
+// identity at all: the real handlers must refuse them rather than act for
+// nobody (a null identity once took the daemon down here).
+TEST(RelayDispatcherRealHandlersTest, AnUnidentifiedCallerIsRefusedByTheOpenCommands) {
+  QRVTestServices env;
+  QRVRelayDispatcher dispatcher(env.services, QRVDefaultCommandTable());
+  QRVUUID uuid = QRVUUID::random();
+  QRVPlist request = QRVPlist::dictionary()
+                         .set("Identifier", QRVPlist::string("com.example.a"))
+                         .set("ContainerClass", QRVPlist::uinteger(2))
+                         .set("CreateIfNecessary", QRVPlist::boolean(true))
+                         .set("UUID", QRVPlist::data(QRVPlist::Bytes(uuid.bytes().begin(), uuid.bytes().end())));
+  for (uint64_t c : {0, 28}) {
+    SCOPED_TRACE(c);
+    auto connection = std::make_shared<QRVTestConnection>(600);
+    dispatcher.QRVProcessRelayEvent(connection,
+                                    connection->message(QRVPlist(request).set("Command", QRVPlist::uinteger(c))));
+    ASSERT_EQ(connection->replies.size(), 1u);
+    EXPECT_EQ(connection->replies[0].second.uint64ForKey("ReplyError"), 55u);
+  }
+  EXPECT_FALSE(std::filesystem::exists(env.root.path() + "/private/var/mobile/Containers/Data/Application"));
+}
