@@ -440,22 +440,30 @@ bool QRVFileManager::createDirectoryAtURL(const std::string& url, bool withInter
     if (stat(url.c_str(), &st) != 0 || !S_ISDIR(st.st_mode))
       return QRVFail(error, QRV_POSIX_ERROR(EEXIST, "{} of {} failed: {}", call, url, errnoText(EEXIST)));
   }
+  if (protectionClass == kLeaveProtectionClassAlone && owner == 0) return true;
+  // Class and owner are changed through a descriptor that did not follow a
+  // link: a directory that was there already may lie in a container whose
+  // user put a link in its place, and what the link points to is not ours to
+  // give away.
+  int fd = open(url.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
+  if (fd < 0) {
+    e = errno;
+    return QRVFail(error, QRV_POSIX_ERROR(e, "opendir of {} failed: {}", url, errnoText(e)));
+  }
   if (protectionClass != kLeaveProtectionClassAlone) {
-    int fd = open(url.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
-    if (fd < 0) {
-      e = errno;
-      return QRVFail(error, QRV_POSIX_ERROR(e, "opendir of {} failed: {}", url, errnoText(e)));
-    }
     e = fileSystem_->setProtectionClass(fd, protectionClass);
-    close(fd);
-    if (e)
+    if (e) {
+      close(fd);
       return QRVFail(error, QRV_POSIX_ERROR(e, "Failed to setclass({}) on directory {}: {}",
                                             static_cast<int32_t>(protectionClass), url, errnoText(e)));
+    }
   }
-  if (owner != 0 && chown(url.c_str(), owner, owner) != 0) {
+  if (owner != 0 && fchown(fd, owner, owner) != 0) {
     e = errno;
+    close(fd);
     return QRVFail(error, QRV_POSIX_ERROR(e, "Failed to chown({},{}) {}: {}", owner, owner, url, errnoText(e)));
   }
+  close(fd);
   return true;
 }
 

@@ -248,6 +248,15 @@ TEST_F(FileManagerTest, DirectoriesGetExactModeOwnerAsGroupAndClassAndFailuresCa
   ASSERT_TRUE(fm.dataProtectionClassOfItemAtURL(at("m/n/o"), &cls, &error));
   EXPECT_EQ(cls, 2u);
 
+  // A link where a directory stood (a container's user may plant one) is
+  // neither given away nor classed through: what it points to is not ours.
+  ASSERT_EQ(mkdir(at("target").c_str(), 0755), 0);
+  ASSERT_EQ(symlink(at("target").c_str(), at("planted").c_str()), 0);
+  EXPECT_NE(failed(fm.createDirectoryAtURL(at("planted"), false, 0755, 1000, 2, &error)), 0u);
+  EXPECT_EQ(lstatOf(at("target")).st_uid, geteuid());
+  ASSERT_TRUE(fm.dataProtectionClassOfItemAtURL(at("target"), &cls, &error));
+  EXPECT_NE(cls, 2u);
+
   write("file");
   EXPECT_EQ(failed(fm.createDirectoryAtURL(at("file"), false, 0755, &error)), EEXIST);
   EXPECT_EQ(failed(fm.createDirectoryAtURL(at("no/parent"), false, 0755, &error)), ENOENT);
