@@ -287,7 +287,9 @@ void QRVUserIdentityCache::forEachAccessibleUserIdentitySynchronouslyExecuteBloc
     std::lock_guard<std::mutex> lock(mutex_);
     _lock_resyncIfNeeded();
     if (userIdentityForPersonalPersona_) all.push_back(userIdentityForPersonalPersona_);
-    for (const auto& [id, u] : personaIDToUserIdentityMap_) {
+    // Not a structured binding: clang before 16 cannot capture one.
+    for (const auto& entry : personaIDToUserIdentityMap_) {
+      const QRVUserIdentityRef& u = entry.second;
       bool seen = std::any_of(all.begin(), all.end(), [&](const QRVUserIdentityRef& a) {
         return a->isEqualToUserIdentity(*u);
       });
