@@ -86,7 +86,8 @@ TEST_F(DispatchIntegrationTest, CommandsAreDispatchedByNumberAndGatedByTheCaller
   EXPECT_EQ(codesAs(daemon_, kAllowedUID, {request(32), request(27), retry}), Codes({49, 49, 55}));
   EXPECT_EQ(codesAs(daemon_, kPlainUID, {request(27), request(32), retry, create, QRVPlist::dictionary()}),
             Codes({49, 49, 55, 1, 18}));
-  EXPECT_EQ(codesAs(daemon_, kStrangerUID, {retry}), Codes({55}));
+  // A stranger has no identity at all; the open command 0 refuses it too.
+  EXPECT_EQ(codesAs(daemon_, kStrangerUID, {retry, create}), Codes({55, 55}));
   EXPECT_EQ(codesAs(daemon_, kTesterUID, {retry}), Codes({1}));
   EXPECT_TRUE(daemon_.logEventuallyContains("command=25, client=com.example.plain, error=55"));
   EXPECT_TRUE(daemon_.logEventuallyContains("command=0, client=com.example.plain, error=1"));
