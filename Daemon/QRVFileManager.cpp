@@ -110,11 +110,17 @@ int openItem(int directoryFD, const char* name) {
 }
 
 // mkdir with exactly `mode`: the umask must not narrow what the caller asked
-// for. Sets *created when this call made the directory.
+// for. Sets *created when this call made the directory. The directory is
+// made private and given its mode through a descriptor that did not follow
+// a link, so that a link swapped in for it meanwhile gets nothing.
 int makeDirectory(const std::string& path, mode_t mode, bool* created) {
-  if (mkdir(path.c_str(), mode) != 0) return errno;
+  if (mkdir(path.c_str(), 0700) != 0) return errno;
   *created = true;
-  return chmod(path.c_str(), mode) == 0 ? 0 : errno;
+  int fd = open(path.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
+  if (fd < 0) return errno;
+  int e = fchmod(fd, mode) == 0 ? 0 : errno;
+  close(fd);
+  return e;
 }
 
 // The directory and its missing parents, each made with `mode`. EEXIST when
