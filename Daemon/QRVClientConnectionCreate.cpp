@@ -84,7 +84,7 @@ bool QRVClientConnection::_createSubDirectories(const std::string& url, const QR
     uint32_t toSet = cls == 0 ? QRVFileManager::kLeaveProtectionClassAlone : cls;
     std::string path = url + "/" + name;
     QRVError underlying;
-    if (!services_->fileManager->createDirectoryAtURL(path, true, 0755, owner, toSet, &underlying))
+    if (!services_->fileManager->createDirectoryBelowURL(url, name, 0755, owner, toSet, &underlying))
       return QRVFail(error, QRV_ERROR_UNDERLYING(6, underlying, "Failed to create sub-dir for {} at {} (protClass: {})",
                                                  metadata.identifier(), path, cls));
   }

@@ -456,21 +456,57 @@ bool QRVFileManager::createDirectoryAtURL(const std::string& url, bool withInter
     e = errno;
     return QRVFail(error, QRV_POSIX_ERROR(e, "opendir of {} failed: {}", url, errnoText(e)));
   }
+  bool ok = _setClassAndOwnerOfDirectory(fd, url, owner, protectionClass, error);
+  close(fd);
+  return ok;
+}
+
+bool QRVFileManager::_setClassAndOwnerOfDirectory(int fd, const std::string& url, uid_t owner,
+                                                  uint32_t protectionClass, QRVError* error) {
   if (protectionClass != kLeaveProtectionClassAlone) {
-    e = fileSystem_->setProtectionClass(fd, protectionClass);
-    if (e) {
-      close(fd);
+    if (int e = fileSystem_->setProtectionClass(fd, protectionClass))
       return QRVFail(error, QRV_POSIX_ERROR(e, "Failed to setclass({}) on directory {}: {}",
                                             static_cast<int32_t>(protectionClass), url, errnoText(e)));
-    }
   }
   if (owner != 0 && fchown(fd, owner, owner) != 0) {
-    e = errno;
-    close(fd);
+    int e = errno;
     return QRVFail(error, QRV_POSIX_ERROR(e, "Failed to chown({},{}) {}: {}", owner, owner, url, errnoText(e)));
   }
-  close(fd);
   return true;
+}
+
+bool QRVFileManager::createDirectoryBelowURL(const std::string& base, const std::string& relative, mode_t mode,
+                                             uid_t owner, uint32_t protectionClass, QRVError* error) {
+  std::vector<std::string> components = pathComponents(relative);
+  bool climbs = std::any_of(components.begin(), components.end(),
+                            [](const std::string& c) { return c == "/" || c == "." || c == ".."; });
+  if (components.empty() || climbs)
+    return QRVFail(error, QRV_POSIX_ERROR(EINVAL, "mkdir of {} below {} failed: {}", relative, base, errnoText(EINVAL)));
+  int fd = open(base.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
+  if (fd < 0) {
+    int e = errno;
+    return QRVFail(error, QRV_POSIX_ERROR(e, "opendir of {} failed: {}", base, errnoText(e)));
+  }
+  // One component at a time, each opened without following a link: a link
+  // anywhere below `base` stops the walk instead of taking it elsewhere.
+  std::string path = base;
+  for (const std::string& name : components) {
+    path = appendingPathComponent(path, name);
+    bool created = mkdirat(fd, name.c_str(), 0700) == 0;
+    int e = created || errno == EEXIST ? 0 : errno;
+    int child = e ? -1 : openat(fd, name.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
+    if (!e && child < 0) e = errno == ENOTDIR ? EEXIST : errno;
+    if (!e && created && fchmod(child, mode) != 0) e = errno;
+    close(fd);
+    fd = child;
+    if (e) {
+      if (fd >= 0) close(fd);
+      return QRVFail(error, QRV_POSIX_ERROR(e, "mkdir of {} failed: {}", path, errnoText(e)));
+    }
+  }
+  bool ok = _setClassAndOwnerOfDirectory(fd, path, owner, protectionClass, error);
+  close(fd);
+  return ok;
 }
 
 bool QRVFileManager::createDirectoryAtURL(const std::string& url, bool withIntermediateDirectories, mode_t mode,

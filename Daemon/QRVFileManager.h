@@ -134,6 +134,15 @@ class QRVFileManager {
   bool createDirectoryAtURLWithOwner(const std::string& url, bool withIntermediateDirectories, mode_t mode, uid_t owner,
                                      QRVError* error);
 
+  // Creates the relative path `relative` (no "." or "..") below the
+  // directory `base` as createDirectoryAtURL does with intermediate
+  // directories, but walks from `base` one component at a time without
+  // following links: for directories inside a container, whose user may have
+  // put links anywhere. A link or a non-directory on the way fails with
+  // EEXIST (a link as `base` itself with ELOOP or ENOTDIR).
+  bool createDirectoryBelowURL(const std::string& base, const std::string& relative, mode_t mode, uid_t owner,
+                               uint32_t protectionClass, QRVError* error);
+
   // Creates a new directory (mode 0700) named `prefix` + six random
   // characters inside `directory` and returns its path. The first form uses
   // the prefix "temp.".
@@ -251,6 +260,8 @@ class QRVFileManager {
   bool _clearImmutableAndRemove(int directoryFD, const char* name, const std::string& path, bool isDirectory);
   std::optional<gid_t> _systemUsersGroup(QRVError* error);
   std::string _underRoot(const std::string& path) const;
+  bool _setClassAndOwnerOfDirectory(int fd, const std::string& url, uid_t owner, uint32_t protectionClass,
+                                    QRVError* error);
 
   const std::string root_;
   const std::shared_ptr<QRVFileSystemExtras> fileSystem_;

@@ -257,6 +257,20 @@ TEST_F(FileManagerTest, DirectoriesGetExactModeOwnerAsGroupAndClassAndFailuresCa
   ASSERT_TRUE(fm.dataProtectionClassOfItemAtURL(at("target"), &cls, &error));
   EXPECT_NE(cls, 2u);
 
+  // Below a container the walk takes no link at any depth, and never climbs.
+  ASSERT_EQ(mkdir(at("box").c_str(), 0755), 0);
+  ASSERT_EQ(symlink(at("target").c_str(), at("box/Library").c_str()), 0);
+  EXPECT_EQ(failed(fm.createDirectoryBelowURL(at("box"), "Library/Caches", 0755, 0, QRVFileManager::kLeaveProtectionClassAlone, &error)), EEXIST);
+  EXPECT_FALSE(std::filesystem::exists(at("target/Caches")));
+  for (const char* climbing : {"../out", "/out", "./out", "a/../../out", ""})
+    EXPECT_EQ(failed(fm.createDirectoryBelowURL(at("box"), climbing, 0755, 0, QRVFileManager::kLeaveProtectionClassAlone, &error)), EINVAL) << climbing;
+  ASSERT_TRUE(fm.createDirectoryBelowURL(at("box"), "Documents/Inbox", 0751, geteuid() == 0 ? 1000 : 0, 2, &error));
+  EXPECT_EQ(lstatOf(at("box/Documents")).st_mode & 07777, 0751u);
+  EXPECT_EQ(lstatOf(at("box/Documents/Inbox")).st_mode & 07777, 0751u);
+  if (geteuid() == 0) EXPECT_EQ(lstatOf(at("box/Documents/Inbox")).st_uid, 1000u);
+  ASSERT_TRUE(fm.dataProtectionClassOfItemAtURL(at("box/Documents/Inbox"), &cls, &error));
+  EXPECT_EQ(cls, 2u);
+
   write("file");
   EXPECT_EQ(failed(fm.createDirectoryAtURL(at("file"), false, 0755, &error)), EEXIST);
   EXPECT_EQ(failed(fm.createDirectoryAtURL(at("no/parent"), false, 0755, &error)), ENOENT);
