@@ -19,9 +19,7 @@ shift || true
 root="$(cd "$(dirname "$0")/.." && pwd)"
 build="${BUILD_DIR:-$root/build-fuzz}"
 
-CC=clang CXX=clang++ cmake -S "$root" -B "$build" -G Ninja -DCMAKE_BUILD_TYPE=RelWithDebInfo \
-  -DQUORVAD_BUILD_FUZZ=ON -DQUORVAD_BUILD_TESTS=OFF -DQUORVAD_BUILD_BENCH=OFF >/dev/null
-cmake --build "$build" --target request_fuzz
+BUILD_DIR="$build" "$root/scripts/fuzz-build.sh" request_fuzz
 
 # New inputs go to the build directory; the checked-in seeds are read only.
 corpus="$build/corpus/request"

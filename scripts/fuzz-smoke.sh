@@ -10,9 +10,7 @@ seconds="${1:-30}"
 root="$(cd "$(dirname "$0")/.." && pwd)"
 build="${BUILD_DIR:-$root/build-fuzz}"
 
-CC=clang CXX=clang++ cmake -S "$root" -B "$build" -G Ninja -DCMAKE_BUILD_TYPE=RelWithDebInfo \
-  -DQUORVAD_BUILD_FUZZ=ON -DQUORVAD_BUILD_TESTS=OFF -DQUORVAD_BUILD_BENCH=OFF >/dev/null
-cmake --build "$build" --target packbuff_fuzz
+BUILD_DIR="$build" "$root/scripts/fuzz-build.sh" packbuff_fuzz
 
 # A small seed corpus: an empty buffer, one of each item kind, a key/value pair.
 corpus="$build/corpus/packbuff"
