@@ -21,11 +21,11 @@
 #include <string>
 #include <thread>
 
-#include "QRVDaemon.h"
-#include "QRVExceptionReporter.h"
-#include "QRVLog.h"
-#include "QRVPlatform.h"
-#include "QRVServices.h"
+#include "base/QRVLog.h"
+#include "core/QRVDaemon.h"
+#include "core/QRVExceptionReporter.h"
+#include "core/QRVServices.h"
+#include "platform/QRVPlatform.h"
 
 namespace {
 

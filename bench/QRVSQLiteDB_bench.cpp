@@ -27,7 +27,7 @@
 #include <string>
 #include <vector>
 
-#include "QRVSQLiteDB.h"
+#include "codesigning/QRVSQLiteDB.h"
 
 namespace fs = std::filesystem;
 

@@ -1,4 +1,4 @@
-#include "QRVClient.h"
+#include "client/QRVClient.h"
 
 #include <fmt/format.h>
 #include <poll.h>
@@ -12,8 +12,8 @@
 #include <cstring>
 #include <utility>
 
-#include "QRVProtocol.h"
-#include "QRVWireFrame.h"
+#include "base/QRVWireFrame.h"
+#include "client/QRVProtocol.h"
 
 namespace {
 

@@ -31,7 +31,7 @@
 #include <string>
 #include <vector>
 
-#include "QRVPlist.h"
+#include "base/QRVPlist.h"
 
 // Why a client call failed. `errnum` classifies the failure with an errno
 // value so callers can branch without parsing text; `message` is a complete

@@ -1,8 +1,8 @@
-#include "QRVContainerClient.h"
+#include "client/QRVContainerClient.h"
 
 #include <algorithm>
 
-#include "QRVProtocol.h"
+#include "client/QRVProtocol.h"
 
 namespace {
 

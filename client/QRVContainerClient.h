@@ -21,8 +21,8 @@
 #include <string>
 #include <vector>
 
-#include "QRVClient.h"
-#include "QRVPlist.h"
+#include "base/QRVPlist.h"
+#include "client/QRVClient.h"
 
 using QRVUUIDBytes = std::array<uint8_t, 16>;
 

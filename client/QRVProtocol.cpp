@@ -1,4 +1,4 @@
-#include "QRVProtocol.h"
+#include "client/QRVProtocol.h"
 
 #include <array>
 #include <utility>

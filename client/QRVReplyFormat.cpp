@@ -1,12 +1,12 @@
-#include "QRVReplyFormat.h"
+#include "client/QRVReplyFormat.h"
 
 #include <fmt/format.h>
 
 #include <cmath>
 #include <ctime>
 
-#include "QRVProtocol.h"
-#include "QRVUUID.h"
+#include "base/QRVUUID.h"
+#include "client/QRVProtocol.h"
 
 namespace QRVReplyFormat {
 

@@ -15,7 +15,7 @@
 #include <string>
 #include <string_view>
 
-#include "QRVPlist.h"
+#include "base/QRVPlist.h"
 
 namespace QRVReplyFormat {
 

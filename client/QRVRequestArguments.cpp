@@ -1,4 +1,4 @@
-#include "QRVRequestArguments.h"
+#include "client/QRVRequestArguments.h"
 
 #include <fmt/format.h>
 
@@ -7,8 +7,8 @@
 #include <fstream>
 #include <iterator>
 
-#include "QRVProtocol.h"
-#include "QRVUUID.h"
+#include "base/QRVUUID.h"
+#include "client/QRVProtocol.h"
 
 namespace QRVRequestArguments {
 

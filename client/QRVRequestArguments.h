@@ -24,7 +24,7 @@
 #include <utility>
 #include <vector>
 
-#include "QRVPlist.h"
+#include "base/QRVPlist.h"
 
 namespace QRVRequestArguments {
 

@@ -11,11 +11,11 @@
 #include <string_view>
 #include <vector>
 
-#include "QRVClient.h"
-#include "QRVContainerClient.h"
-#include "QRVProtocol.h"
-#include "QRVReplyFormat.h"
-#include "QRVRequestArguments.h"
+#include "client/QRVClient.h"
+#include "client/QRVContainerClient.h"
+#include "client/QRVProtocol.h"
+#include "client/QRVReplyFormat.h"
+#include "client/QRVRequestArguments.h"
 
 namespace {
 

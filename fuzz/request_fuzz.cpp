@@ -34,9 +34,9 @@
 #include <string>
 #include <vector>
 
-#include "QRVCommandTable.h"
-#include "QRVLog.h"
-#include "QRVRelayDispatcher.h"
+#include "base/QRVLog.h"
+#include "core/QRVCommandTable.h"
+#include "core/QRVRelayDispatcher.h"
 #include "support/QRVTestConnection.h"
 #include "support/QRVTestServices.h"
 

@@ -4,7 +4,7 @@
 #include <memory>
 #include <string>
 
-#include "QRVError.h"
+#include "base/QRVError.h"
 
 class QRVApplicationTermination {
  public:

@@ -1,4 +1,4 @@
-#include "QRVMessageService.h"
+#include "platform/QRVMessageService.h"
 
 std::shared_ptr<QRVReply> QRVReply::createFrom(const QRVMessage& request) {
   if (!request.hasReplyContext) return nullptr;

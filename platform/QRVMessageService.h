@@ -16,10 +16,10 @@
 #include <optional>
 #include <string>
 
-#include "QRVAuditToken.h"
-#include "QRVError.h"
-#include "QRVPlist.h"
-#include "QRVSerialQueue.h"
+#include "base/QRVError.h"
+#include "base/QRVPlist.h"
+#include "base/QRVSerialQueue.h"
+#include "platform/QRVAuditToken.h"
 
 class QRVConnection;
 

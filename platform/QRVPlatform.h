@@ -6,18 +6,18 @@
 #include <memory>
 #include <string>
 
-#include "QRVAccounts.h"
-#include "QRVApplicationTermination.h"
-#include "QRVFeatureFlags.h"
-#include "QRVFileSystemExtras.h"
-#include "QRVFirstBootMarker.h"
-#include "QRVLockStateService.h"
-#include "QRVMessageService.h"
-#include "QRVNotificationService.h"
-#include "QRVPersonaService.h"
-#include "QRVSandbox.h"
-#include "QRVSystemInfo.h"
-#include "QRVTrustStore.h"
+#include "platform/QRVAccounts.h"
+#include "platform/QRVApplicationTermination.h"
+#include "platform/QRVFeatureFlags.h"
+#include "platform/QRVFileSystemExtras.h"
+#include "platform/QRVFirstBootMarker.h"
+#include "platform/QRVLockStateService.h"
+#include "platform/QRVMessageService.h"
+#include "platform/QRVNotificationService.h"
+#include "platform/QRVPersonaService.h"
+#include "platform/QRVSandbox.h"
+#include "platform/QRVSystemInfo.h"
+#include "platform/QRVTrustStore.h"
 
 struct QRVPlatform {
   std::shared_ptr<QRVMessageService> messages;

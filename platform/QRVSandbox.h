@@ -7,8 +7,8 @@
 #include <optional>
 #include <string>
 
-#include "QRVAuditToken.h"
-#include "QRVError.h"
+#include "base/QRVError.h"
+#include "platform/QRVAuditToken.h"
 
 // One mapping the launcher uses to find a process's container: for the user
 // `uid` in persona `personaID`, items of `itemType` named `identifier` live at

@@ -3,7 +3,7 @@
 
 #include <string>
 
-#include "QRVPlist.h"
+#include "base/QRVPlist.h"
 
 class QRVSystemInfo {
  public:

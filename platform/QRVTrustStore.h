@@ -5,9 +5,9 @@
 #include <optional>
 #include <string>
 
-#include "QRVAuditToken.h"
-#include "QRVError.h"
-#include "QRVPlist.h"
+#include "base/QRVError.h"
+#include "base/QRVPlist.h"
+#include "platform/QRVAuditToken.h"
 
 class QRVTrustStore {
  public:

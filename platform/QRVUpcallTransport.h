@@ -7,9 +7,9 @@
 #include <functional>
 #include <memory>
 
-#include "QRVAuditToken.h"
-#include "QRVError.h"
-#include "QRVSerialQueue.h"
+#include "base/QRVError.h"
+#include "base/QRVSerialQueue.h"
+#include "platform/QRVAuditToken.h"
 
 class QRVUpcallTransport {
  public:

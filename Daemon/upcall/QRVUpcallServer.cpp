@@ -1,6 +1,6 @@
 #include "upcall/QRVUpcallServer.h"
 
-#include "QRVLog.h"
+#include "base/QRVLog.h"
 
 bool QRVUpcallServer::start(std::shared_ptr<QRVSerialQueue> targetQueue) {
   if (queue_) return true;

@@ -5,8 +5,8 @@
 
 #include <memory>
 
-#include "QRVSerialQueue.h"
-#include "QRVServices.h"
+#include "base/QRVSerialQueue.h"
+#include "core/QRVServices.h"
 
 class QRVUpcallServer {
  public:

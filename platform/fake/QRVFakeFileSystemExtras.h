@@ -22,8 +22,8 @@
 #include <utility>
 #include <vector>
 
-#include "QRVFileSystemExtras.h"
-#include "QRVLockStateService.h"
+#include "platform/QRVFileSystemExtras.h"
+#include "platform/QRVLockStateService.h"
 
 class QRVFakeFileSystemExtras : public QRVFileSystemExtras {
  public:

@@ -7,16 +7,16 @@
 #include <string>
 #include <vector>
 
-#include "QRVAccounts.h"
-#include "QRVApplicationTermination.h"
-#include "QRVFeatureFlags.h"
-#include "QRVFirstBootMarker.h"
-#include "QRVLockStateService.h"
-#include "QRVNotificationService.h"
-#include "QRVPersonaService.h"
-#include "QRVSandbox.h"
-#include "QRVSystemInfo.h"
-#include "QRVTrustStore.h"
+#include "platform/QRVAccounts.h"
+#include "platform/QRVApplicationTermination.h"
+#include "platform/QRVFeatureFlags.h"
+#include "platform/QRVFirstBootMarker.h"
+#include "platform/QRVLockStateService.h"
+#include "platform/QRVNotificationService.h"
+#include "platform/QRVPersonaService.h"
+#include "platform/QRVSandbox.h"
+#include "platform/QRVSystemInfo.h"
+#include "platform/QRVTrustStore.h"
 
 class QRVFakeTrustStore : public QRVTrustStore {
  public:

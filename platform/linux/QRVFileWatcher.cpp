@@ -1,4 +1,4 @@
-#include "linux/QRVFileWatcher.h"
+#include "platform/linux/QRVFileWatcher.h"
 
 #include <poll.h>
 #include <sys/eventfd.h>

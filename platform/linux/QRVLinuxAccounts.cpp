@@ -1,4 +1,4 @@
-#include "linux/QRVLinuxAccounts.h"
+#include "platform/linux/QRVLinuxAccounts.h"
 
 #include <grp.h>
 #include <pwd.h>

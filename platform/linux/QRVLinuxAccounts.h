@@ -6,7 +6,7 @@
 
 #include <string>
 
-#include "QRVAccounts.h"
+#include "platform/QRVAccounts.h"
 
 class QRVLinuxAccounts : public QRVAccounts {
  public:

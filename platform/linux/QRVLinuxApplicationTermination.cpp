@@ -1,4 +1,4 @@
-#include "linux/QRVLinuxApplicationTermination.h"
+#include "platform/linux/QRVLinuxApplicationTermination.h"
 
 #include <fcntl.h>
 #include <sys/stat.h>
@@ -7,7 +7,7 @@
 #include <cerrno>
 #include <cstring>
 
-#include "QRVLog.h"
+#include "base/QRVLog.h"
 
 namespace {
 

@@ -6,7 +6,7 @@
 
 #include <string>
 
-#include "QRVApplicationTermination.h"
+#include "platform/QRVApplicationTermination.h"
 
 class QRVLinuxApplicationTermination : public QRVApplicationTermination {
  public:

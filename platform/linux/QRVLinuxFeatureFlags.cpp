@@ -1,10 +1,10 @@
-#include "linux/QRVLinuxFeatureFlags.h"
+#include "platform/linux/QRVLinuxFeatureFlags.h"
 
 #include <fstream>
 #include <iterator>
 #include <vector>
 
-#include "QRVPlist.h"
+#include "base/QRVPlist.h"
 
 bool QRVLinuxFeatureFlags::isEnabled(const std::string& domain, const std::string& feature) {
   std::ifstream in(path_, std::ios::binary);

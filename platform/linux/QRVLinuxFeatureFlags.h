@@ -4,7 +4,7 @@
 
 #include <string>
 
-#include "QRVFeatureFlags.h"
+#include "platform/QRVFeatureFlags.h"
 
 class QRVLinuxFeatureFlags : public QRVFeatureFlags {
  public:

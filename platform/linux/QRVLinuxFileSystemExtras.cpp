@@ -1,4 +1,4 @@
-#include "linux/QRVLinuxFileSystemExtras.h"
+#include "platform/linux/QRVLinuxFileSystemExtras.h"
 
 #include <acl/libacl.h>
 #include <dirent.h>

@@ -30,8 +30,8 @@
 
 #include <memory>
 
-#include "QRVFileSystemExtras.h"
-#include "QRVLockStateService.h"
+#include "platform/QRVFileSystemExtras.h"
+#include "platform/QRVLockStateService.h"
 
 class QRVLinuxFileSystemExtras : public QRVFileSystemExtras {
  public:

@@ -1,4 +1,4 @@
-#include "linux/QRVLinuxFirstBootMarker.h"
+#include "platform/linux/QRVLinuxFirstBootMarker.h"
 
 #include <fcntl.h>
 #include <semaphore.h>

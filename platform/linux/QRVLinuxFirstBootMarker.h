@@ -5,7 +5,7 @@
 
 #include <string>
 
-#include "QRVFirstBootMarker.h"
+#include "platform/QRVFirstBootMarker.h"
 
 class QRVLinuxFirstBootMarker : public QRVFirstBootMarker {
  public:

@@ -1,4 +1,4 @@
-#include "linux/QRVLinuxLockStateService.h"
+#include "platform/linux/QRVLinuxLockStateService.h"
 
 #include <fstream>
 

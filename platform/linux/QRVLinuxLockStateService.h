@@ -4,8 +4,8 @@
 
 #include <string>
 
-#include "QRVLockStateService.h"
-#include "linux/QRVFileWatcher.h"
+#include "platform/QRVLockStateService.h"
+#include "platform/linux/QRVFileWatcher.h"
 
 class QRVLinuxLockStateService : public QRVLockStateService {
  public:

@@ -1,4 +1,4 @@
-#include "linux/QRVLinuxMessageService.h"
+#include "platform/linux/QRVLinuxMessageService.h"
 
 #include <fcntl.h>
 #include <poll.h>
@@ -15,9 +15,9 @@
 #include <cstring>
 #include <filesystem>
 
-#include "QRVLog.h"
-#include "QRVWireFrame.h"
-#include "linux/QRVProcInfo.h"
+#include "base/QRVLog.h"
+#include "base/QRVWireFrame.h"
+#include "platform/linux/QRVProcInfo.h"
 
 namespace {
 

@@ -19,7 +19,7 @@
 #include <thread>
 #include <vector>
 
-#include "QRVMessageService.h"
+#include "platform/QRVMessageService.h"
 
 class QRVLinuxMessageService : public QRVMessageService {
  public:

@@ -1,4 +1,4 @@
-#include "linux/QRVLinuxNotificationService.h"
+#include "platform/linux/QRVLinuxNotificationService.h"
 
 #include <fcntl.h>
 #include <sys/stat.h>
@@ -7,7 +7,7 @@
 #include <cerrno>
 #include <filesystem>
 
-#include "QRVLog.h"
+#include "base/QRVLog.h"
 
 uint32_t QRVLinuxNotificationService::post(const std::string& name) {
   if (name.empty() || name.find('/') != std::string::npos || name == "." || name == "..") return EINVAL;

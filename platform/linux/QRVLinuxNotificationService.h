@@ -4,7 +4,7 @@
 
 #include <string>
 
-#include "QRVNotificationService.h"
+#include "platform/QRVNotificationService.h"
 
 class QRVLinuxNotificationService : public QRVNotificationService {
  public:

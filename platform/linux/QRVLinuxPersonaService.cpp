@@ -1,11 +1,11 @@
-#include "linux/QRVLinuxPersonaService.h"
+#include "platform/linux/QRVLinuxPersonaService.h"
 
 #include <cstring>
 #include <filesystem>
 #include <fstream>
 #include <iterator>
 
-#include "QRVLog.h"
+#include "base/QRVLog.h"
 
 namespace {
 

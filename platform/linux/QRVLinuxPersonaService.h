@@ -9,9 +9,9 @@
 
 #include <string>
 
-#include "QRVPersonaService.h"
-#include "QRVPlist.h"
-#include "linux/QRVFileWatcher.h"
+#include "base/QRVPlist.h"
+#include "platform/QRVPersonaService.h"
+#include "platform/linux/QRVFileWatcher.h"
 
 class QRVLinuxPersonaService : public QRVPersonaService {
  public:

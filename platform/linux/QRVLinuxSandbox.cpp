@@ -1,4 +1,4 @@
-#include "linux/QRVLinuxSandbox.h"
+#include "platform/linux/QRVLinuxSandbox.h"
 
 #include <fcntl.h>
 #include <sys/stat.h>
@@ -9,9 +9,9 @@
 
 #include <sodium.h>
 
-#include "QRVLog.h"
-#include "QRVPlist.h"
-#include "linux/QRVProcInfo.h"
+#include "base/QRVLog.h"
+#include "base/QRVPlist.h"
+#include "platform/linux/QRVProcInfo.h"
 
 static_assert(QRVLinuxSandbox::kKeySize == crypto_auth_KEYBYTES);
 

@@ -32,8 +32,8 @@
 #include <tuple>
 #include <vector>
 
-#include "QRVSandbox.h"
-#include "QRVSerialQueue.h"
+#include "base/QRVSerialQueue.h"
+#include "platform/QRVSandbox.h"
 
 class QRVLinuxSandbox : public QRVSandbox {
  public:

@@ -1,4 +1,4 @@
-#include "linux/QRVLinuxSystemInfo.h"
+#include "platform/linux/QRVLinuxSystemInfo.h"
 
 #include <fstream>
 #include <sstream>

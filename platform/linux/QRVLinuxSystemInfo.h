@@ -5,7 +5,7 @@
 #include <mutex>
 #include <string>
 
-#include "QRVSystemInfo.h"
+#include "platform/QRVSystemInfo.h"
 
 class QRVLinuxSystemInfo : public QRVSystemInfo {
  public:

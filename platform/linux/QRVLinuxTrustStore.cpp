@@ -1,4 +1,4 @@
-#include "linux/QRVLinuxTrustStore.h"
+#include "platform/linux/QRVLinuxTrustStore.h"
 
 #include <sys/inotify.h>
 #include <sys/stat.h>
@@ -11,7 +11,7 @@
 #include <fstream>
 #include <iterator>
 
-#include "QRVLog.h"
+#include "base/QRVLog.h"
 
 QRVLinuxTrustStore::QRVLinuxTrustStore(std::string directory) : directory_(std::move(directory)) {
   inotifyFd_ = inotify_init1(IN_NONBLOCK | IN_CLOEXEC);

@@ -12,8 +12,8 @@
 #include <string>
 #include <vector>
 
-#include "QRVTrustStore.h"
-#include "linux/QRVProcInfo.h"
+#include "platform/QRVTrustStore.h"
+#include "platform/linux/QRVProcInfo.h"
 
 class QRVLinuxTrustStore : public QRVTrustStore {
  public:

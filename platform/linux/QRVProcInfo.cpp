@@ -1,4 +1,4 @@
-#include "linux/QRVProcInfo.h"
+#include "platform/linux/QRVProcInfo.h"
 
 #include <sys/stat.h>
 

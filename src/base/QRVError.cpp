@@ -1,4 +1,4 @@
-#include "QRVError.h"
+#include "base/QRVError.h"
 
 QRVError QRVError::make(const char* domain, uint64_t code, const char* function, uint32_t line,
                         int level, std::string message,

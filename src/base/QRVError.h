@@ -16,7 +16,7 @@
 
 #include <fmt/format.h>
 
-#include "QRVLog.h"
+#include "base/QRVLog.h"
 
 class QRVError {
  public:

@@ -1,4 +1,4 @@
-#include "QRVLog.h"
+#include "base/QRVLog.h"
 
 #include <unistd.h>
 

@@ -1,4 +1,4 @@
-#include "QRVPlist.h"
+#include "base/QRVPlist.h"
 
 #include <plist/plist.h>
 

@@ -1,4 +1,4 @@
-#include "QRVSerialQueue.h"
+#include "base/QRVSerialQueue.h"
 
 #include <sys/resource.h>
 #include <unistd.h>

@@ -1,4 +1,4 @@
-#include "QRVUUID.h"
+#include "base/QRVUUID.h"
 
 #include <sys/random.h>
 

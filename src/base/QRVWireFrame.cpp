@@ -1,4 +1,4 @@
-#include "QRVWireFrame.h"
+#include "base/QRVWireFrame.h"
 
 #include <cstring>
 

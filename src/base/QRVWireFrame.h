@@ -13,7 +13,7 @@
 #include <optional>
 #include <vector>
 
-#include "QRVPlist.h"
+#include "base/QRVPlist.h"
 
 namespace QRVWireFrame {
 

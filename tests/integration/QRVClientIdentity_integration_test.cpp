@@ -6,9 +6,9 @@
 
 #include <regex>
 
-#include "QRVClient.h"
-#include "QRVDaemonProcess.h"
-#include "QRVRunAs.h"
+#include "client/QRVClient.h"
+#include "integration/QRVDaemonProcess.h"
+#include "integration/QRVRunAs.h"
 
 namespace {
 

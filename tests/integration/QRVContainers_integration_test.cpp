@@ -5,9 +5,9 @@
 
 #include <filesystem>
 
-#include "QRVClient.h"
-#include "QRVDaemonProcess.h"
-#include "QRVRunAs.h"
+#include "client/QRVClient.h"
+#include "integration/QRVDaemonProcess.h"
+#include "integration/QRVRunAs.h"
 
 namespace {
 

@@ -15,10 +15,10 @@
 #include <functional>
 #include <map>
 
-#include "QRVClient.h"
-#include "QRVDaemonProcess.h"
+#include "client/QRVClient.h"
+#include "integration/QRVDaemonProcess.h"
+#include "integration/QRVRunAs.h"
 #include "support/QRVEventually.h"
-#include "QRVRunAs.h"
 
 namespace fs = std::filesystem;
 

@@ -1,4 +1,4 @@
-#include "QRVDaemonProcess.h"
+#include "integration/QRVDaemonProcess.h"
 
 #include <semaphore.h>
 #include <signal.h>
@@ -15,8 +15,8 @@
 #include <sstream>
 #include <thread>
 
-#include "QRVClient.h"
-#include "linux/QRVLinuxFirstBootMarker.h"
+#include "client/QRVClient.h"
+#include "platform/linux/QRVLinuxFirstBootMarker.h"
 
 QRVDaemonProcess::QRVDaemonProcess() {
   std::string pattern = (std::filesystem::temp_directory_path() / "quorvad-it-XXXXXX").string();

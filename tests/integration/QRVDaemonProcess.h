@@ -13,7 +13,7 @@
 #include <string>
 #include <vector>
 
-#include "QRVPlist.h"
+#include "base/QRVPlist.h"
 
 class QRVDaemonProcess {
  public:

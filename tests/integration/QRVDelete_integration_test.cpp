@@ -8,9 +8,9 @@
 #include <filesystem>
 #include <fstream>
 
-#include "QRVClient.h"
-#include "QRVDaemonProcess.h"
-#include "QRVRunAs.h"
+#include "client/QRVClient.h"
+#include "integration/QRVDaemonProcess.h"
+#include "integration/QRVRunAs.h"
 
 namespace fs = std::filesystem;
 

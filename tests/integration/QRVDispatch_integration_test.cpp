@@ -9,10 +9,10 @@
 
 #include <filesystem>
 
-#include "QRVClient.h"
-#include "QRVDaemonProcess.h"
-#include "QRVRunAs.h"
-#include "QRVWireFrame.h"
+#include "base/QRVWireFrame.h"
+#include "client/QRVClient.h"
+#include "integration/QRVDaemonProcess.h"
+#include "integration/QRVRunAs.h"
 #include "support/QRVEventually.h"
 
 namespace {

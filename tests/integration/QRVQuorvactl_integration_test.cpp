@@ -7,7 +7,7 @@
 #include <cstdio>
 #include <filesystem>
 
-#include "QRVDaemonProcess.h"
+#include "integration/QRVDaemonProcess.h"
 
 namespace {
 

@@ -1,4 +1,4 @@
-#include "QRVRunAs.h"
+#include "integration/QRVRunAs.h"
 
 #include <grp.h>
 #include <poll.h>
@@ -8,9 +8,9 @@
 
 #include <chrono>
 
-#include "QRVClient.h"
-#include "QRVDaemonProcess.h"
-#include "QRVPlist.h"
+#include "base/QRVPlist.h"
+#include "client/QRVClient.h"
+#include "integration/QRVDaemonProcess.h"
 
 std::optional<std::string> QRVRunAs(uid_t uid, gid_t gid, const std::function<std::string()>& body,
                                     int timeoutSeconds) {

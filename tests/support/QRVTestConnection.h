@@ -6,7 +6,7 @@
 #include <utility>
 #include <vector>
 
-#include "QRVMessageService.h"
+#include "platform/QRVMessageService.h"
 
 class QRVTestConnection : public QRVConnection {
  public:

@@ -9,10 +9,10 @@
 
 #include <unistd.h>
 
-#include "QRVServices.h"
-#include "fake/QRVFakeFileSystemExtras.h"
-#include "fake/QRVFakePlatform.h"
-#include "linux/QRVLinuxFileSystemExtras.h"
+#include "core/QRVServices.h"
+#include "platform/fake/QRVFakeFileSystemExtras.h"
+#include "platform/fake/QRVFakePlatform.h"
+#include "platform/linux/QRVLinuxFileSystemExtras.h"
 
 class QRVTemporaryDirectory {
  public:

@@ -1,0 +1,61 @@
+#include "core/QRVCommandQueue.h"
+
+#include "base/QRVLog.h"
+
+QRVCommandQueue::QRVCommandQueue() : queue_(QRVSerialQueue::create("com.kelva.quorvad.QRVCommandQueue")) {}
+
+void QRVCommandQueue::insertCommand(std::shared_ptr<QRVCommand> command) {
+  uint64_t type = command->command();
+  const void* address = command.get();
+  {
+    std::lock_guard<std::mutex> lock(mutex_);
+    commands_.push_back(std::move(command));
+  }
+  QRVLogInfo("Added command <{}; {}> to queue", address, type);
+}
+
+bool QRVCommandQueue::executeNextCommandWithError(uint64_t* result) {
+  std::shared_ptr<QRVCommand> command;
+  {
+    std::lock_guard<std::mutex> lock(mutex_);
+    if (!commands_.empty()) {
+      command = std::move(commands_.front());
+      commands_.pop_front();
+    }
+  }
+  if (!command) {
+    if (result) *result = kExhausted;
+    return false;
+  }
+  uint64_t code = 1;
+  bool success = false;
+  queue_->sync([&] {
+    QRVLogInfo("Executing command <{}; {}>...", static_cast<const void*>(command.get()), command->command());
+    success = command->fromQueue(*this, &code);
+    QRVLogInfo("Completed command <{}; {}>: success = {}, error = {}", static_cast<const void*>(command.get()),
+               command->command(), success ? 1 : 0, code);
+  });
+  if (!success && result) *result = code;
+  return success;
+}
+
+bool QRVCommandQueue::executeAllUntilExhaustedOrError(uint64_t* result) {
+  uint64_t code = 1;
+  while (executeNextCommandWithError(&code)) {
+  }
+  if (code == kExhausted) return true;
+  if (result) *result = code;
+  // The commands after a failure belong to a request that has failed. They
+  // are destroyed outside the lock, which their destructors may want.
+  std::deque<std::shared_ptr<QRVCommand>> dropped;
+  {
+    std::lock_guard<std::mutex> lock(mutex_);
+    dropped.swap(commands_);
+  }
+  return false;
+}
+
+size_t QRVCommandQueue::pendingCount() {
+  std::lock_guard<std::mutex> lock(mutex_);
+  return commands_.size();
+}

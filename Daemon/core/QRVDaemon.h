@@ -1,0 +1,63 @@
+// Start-up and the daemon-wide state: the listener, death-row, lock-state and
+// main queues, the log, first-boot detection, the lock-state gate and the
+// "cleanup complete" notifications.
+//
+// `start` does what the entry point does before it parks in the run loop:
+// start-up (`quorvad_init`) is the first job of the listener queue, and the
+// listener announces connections on that same queue, so no request is served
+// before start-up has finished.
+#pragma once
+
+#include <atomic>
+#include <memory>
+#include <mutex>
+
+#include "base/QRVSerialQueue.h"
+#include "core/QRVRelayDispatcher.h"
+#include "core/QRVServices.h"
+#include "operations/QRVClientConnection.h"
+#include "upcall/QRVUpcallServer.h"
+
+class QRVDaemon {
+ public:
+  // The name under which lock-state changes are observed.
+  static constexpr const char* kLockStateNotification = "com.kelva.quorva.lockstate";
+
+  struct Options {
+    // Log level of the handle (5 = notice; 7 adds debug lines).
+    int logLevel = 5;
+  };
+
+  QRVDaemon(std::shared_ptr<QRVServices> services, Options options);
+
+  // Schedules start-up and opens the listener. Returns false when the
+  // listener could not be created (the daemon then runs without serving).
+  bool start();
+
+  // The steps of start-up and the callbacks it installs.
+  void quorvad_init();
+  void lockStateCallback();
+  void set_first_boot_work_completed();
+  void cleanupComplete();
+
+  const std::shared_ptr<QRVSerialQueue>& listenerQueue() const { return listenerQueue_; }
+  const std::shared_ptr<QRVSerialQueue>& lockStateQueue() const { return services_->lockStateQueue; }
+  const std::shared_ptr<QRVSerialQueue>& deathRowQueue() const { return services_->deathRowQueue; }
+  const std::shared_ptr<QRVClientConnection>& sharedClientConnection() const { return sharedConnection_; }
+  QRVRelayDispatcher& dispatcher() { return dispatcher_; }
+  bool isFirstBoot() const { return firstBoot_; }
+
+ private:
+  const std::shared_ptr<QRVServices> services_;
+  const Options options_;
+  QRVRelayDispatcher dispatcher_;
+  QRVUpcallServer upcallServer_;
+
+  std::shared_ptr<QRVSerialQueue> listenerQueue_;
+  std::shared_ptr<QRVSerialQueue> mainQueue_;
+  std::shared_ptr<QRVClientConnection> sharedConnection_;
+  bool firstBoot_ = false;
+
+  std::mutex lockStateMutex_;
+  int lockStateFlag_ = 0;  // GUARDED_BY(lockStateMutex_): 1 = lock-state queue suspended by us
+};

@@ -1,0 +1,363 @@
+// Deleting, replacing and wiping containers.
+//
+// A replace is three renames on one volume: old directory to a parking place
+// in staging, new directory to the destination, parked directory to death
+// row. Before the first rename a journal naming all four places is written
+// (atomically, flushed), and it is removed only after the last, so that at
+// any instant one of these holds on disk: the old directory is at its place,
+// or the new one is at the destination, or the old one is parked and the
+// journal says where it came from. Start-up recovery reads the journals left
+// behind and puts the old directory back when neither is in place.
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstdlib>
+#include <cstring>
+#include <exception>
+
+#include "base/QRVLog.h"
+#include "core/QRVCommandStageForDelete.h"
+#include "core/QRVCrashPoints.h"
+#include "core/QRVExceptionReporter.h"
+#include "core/QRVLocks.h"
+#include "fs/QRVDictionaryAdditions.h"
+#include "model/QRVContainerCache.h"
+#include "operations/QRVClientConnection.h"
+
+namespace {
+
+constexpr const char* kOldURLKey = "QRVReplaceOperationOldURL";
+constexpr const char* kNewURLKey = "QRVReplaceOperationNewURL";
+constexpr const char* kStagingURLKey = "QRVReplaceOperationStagingURL";
+constexpr const char* kDestURLKey = "QRVReplaceOperationDestURL";
+
+// The data classes: the only ones whose contents belong to an application's
+// user and may be wiped.
+bool isWipeableDataClass(QRVContainerClass c) {
+  return c == QRVContainerClassAppData || c == QRVContainerClassPluginData || c == QRVContainerClassVPNPluginData ||
+         c == QRVContainerClassSystemData;
+}
+
+// Widens a connection for the span of a wipe, whose look-up and creation
+// are on behalf of an identifier the caller was found entitled to wipe.
+class UnrestrictedScope {
+ public:
+  explicit UnrestrictedScope(QRVClientConnection& c) : connection_(c), was_(c.isUnrestricted()) {
+    c.setUnrestricted(true);
+  }
+  ~UnrestrictedScope() { connection_.setUnrestricted(was_); }
+
+ private:
+  QRVClientConnection& connection_;
+  const bool was_;
+};
+
+}  // namespace
+
+bool QRVClientConnection::deleteContainerWithContainerIdentity(const QRVContainerIdentityRef& containerIdentity,
+                                                               bool transient, QRVError* error) {
+  QRVMetadataRef metadata =
+      createOrLookupContainerWithContainerIdentity(containerIdentity, false, transient, true, error);
+  if (!metadata) return false;
+  stageContainerIdentitiesForDelete({metadata->containerIdentity()});
+  return true;
+}
+
+void QRVClientConnection::stageContainerIdentitiesForDelete(std::vector<QRVContainerIdentityRef> identities) {
+  commandQueue_->insertCommand(QRVCommandStageForDelete::commandForStageForDeleteWithContainerIdentities(
+      std::move(identities), true, nullptr, services_));
+}
+
+bool QRVClientConnection::_writeToDiskReplaceAt(const std::string& url, const std::string& oldURL,
+                                                const std::string& newURL, const std::string& stagingURL,
+                                                const std::string& destinationURL, QRVError* error) {
+  if (oldURL.empty() || newURL.empty() || stagingURL.empty() || destinationURL.empty())
+    return QRVFail(error, QRV_ERROR(33, "Invalid Replace File Info: old: {}, new: {}, staging: {}, dest: {}", oldURL,
+                                    newURL, stagingURL, destinationURL));
+  QRVPlist journal = QRVPlist::dictionary()
+                         .set(kOldURLKey, QRVPlist::string(oldURL))
+                         .set(kNewURLKey, QRVPlist::string(newURL))
+                         .set(kStagingURLKey, QRVPlist::string(stagingURL))
+                         .set(kDestURLKey, QRVPlist::string(destinationURL));
+  QRVError underlying;
+  if (!QRV_writeToURL(*services_->fileManager, journal, url, &underlying))
+    return QRVFail(error, QRV_ERROR_UNDERLYING(34, underlying, "Failed to write replace dictionary to URL {}", url));
+  return true;
+}
+
+std::optional<QRVPlist> QRVClientConnection::_readAndValidateReplaceFileAtUrl(const std::string& url, QRVError* error) {
+  QRVError underlying;
+  std::optional<QRVPlist> journal = QRV_dictionaryWithContentsOfURL(*services_->fileManager, url, &underlying);
+  if (!journal) {
+    if (underlying.isPOSIX()) {
+      QRVFail(error, QRV_ERROR_UNDERLYING(35, underlying, "Failed to read replace file at URL {}", url));
+    } else {
+      QRVFail(error, QRV_ERROR_UNDERLYING(35, underlying, "Bad Data in replace file: {}", url));
+    }
+    return std::nullopt;
+  }
+  auto path = [&](const char* key) -> std::string {
+    const QRVPlist* v = journal->get(key);
+    return v && v->isString() && !v->stringValue().empty() && v->stringValue()[0] == '/' ? v->stringValue()
+                                                                                         : std::string();
+  };
+  std::string oldURL = path(kOldURLKey), newURL = path(kNewURLKey), staging = path(kStagingURLKey),
+              dest = path(kDestURLKey);
+  if (oldURL.empty() || newURL.empty() || staging.empty() || dest.empty()) {
+    QRVFail(error, QRV_ERROR(35, "Invalid replace data: Old: {}, New: {}, Staging: {}, Dest: {}", oldURL, newURL,
+                             staging, dest));
+    return std::nullopt;
+  }
+  return QRVPlist::dictionary()
+      .set(kOldURLKey, QRVPlist::string(QRVPathWithoutTrailingSlashes(oldURL)))
+      .set(kNewURLKey, QRVPlist::string(QRVPathWithoutTrailingSlashes(newURL)))
+      .set(kStagingURLKey, QRVPlist::string(QRVPathWithoutTrailingSlashes(staging)))
+      .set(kDestURLKey, QRVPlist::string(QRVPathWithoutTrailingSlashes(dest)));
+}
+
+bool QRVClientConnection::_recoverFromReplaceOperationsWithError(QRVError* error) {
+  QRVFileManager& fm = *services_->fileManager;
+  const std::string replaceDirectory = services_->globalConfiguration->replaceDirectory();
+  QRVError listError;
+  std::optional<std::vector<std::string>> journals = fm.urlsForItemsInDirectoryAtURL(replaceDirectory, &listError);
+  if (!journals) {
+    if (listError.isPOSIX() && listError.code() == ENOENT) return true;
+    QRVLogError("Failed to get items at replace URL {} : {}", replaceDirectory, listError.description());
+    return QRVFail(error, listError);
+  }
+  for (const std::string& journalURL : *journals) {
+    QRVError readError;
+    std::optional<QRVPlist> journal = _readAndValidateReplaceFileAtUrl(journalURL, &readError);
+    if (journal) {
+      const std::string& oldURL = journal->stringForKey(kOldURLKey);
+      const std::string& staging = journal->stringForKey(kStagingURLKey);
+      const std::string& dest = journal->stringForKey(kDestURLKey);
+      QRVLogDebug("Doing a replace of {} with info: {}", oldURL, journalURL);
+      // The old directory in place: the swap never started. The new one at
+      // the destination: it finished, and the parked directory is left for
+      // the next cleanup. Neither: the old directory is parked; put it back.
+      if (!fm.directoryExistsAtURL(oldURL) && !fm.directoryExistsAtURL(dest)) {
+        QRVLogNotice("Recovering from failed replace by moving: {} to {}", staging, oldURL);
+        QRVError moveError;
+        if (!fm.moveItemAtURL(staging, oldURL, &moveError))
+          return QRVFail(
+              error, QRV_ERROR_UNDERLYING(35, moveError, "Failed to recover replace move: {} to {}", staging, oldURL));
+      }
+    } else {
+      QRVLogError("Discarding replace file {}: {}", journalURL, readError.description());
+    }
+    QRVError discardError;
+    if (!_moveItemAtURLToDeathRow(journalURL, false, false, &discardError))
+      return QRVFail(error, QRV_ERROR_UNDERLYING(36, discardError, "Failed to remove replace file at {}", journalURL));
+  }
+  return true;
+}
+
+bool QRVClientConnection::replaceContainerIdentity(const QRVContainerIdentityRef& oldIdentity,
+                                                   const QRVContainerIdentityRef& newIdentity, bool preserveOldUUID,
+                                                   bool startDeletionThread, QRVError* error) {
+  if (!oldIdentity || !newIdentity) return QRVFail(error, QRV_ERROR(38, "Cannot lookup a nil container identity."));
+  const QRVContainerClass containerClass = newIdentity->containerClass();
+  if (!newIdentity->uuid())
+    return QRVFail(error,
+                   QRV_ERROR(11, "Can't act on an invalid object: newUUID: {}, Class: {}", "(null)", containerClass));
+  if (!QRVContainerClassIsValid(containerClass))
+    return QRVFail(error, QRV_ERROR(11, "Can't act on an invalid container class: {}", containerClass));
+  if (oldIdentity->containerClass() != containerClass)
+    return QRVFail(error, QRV_ERROR(23, "Can't replace containers of different class types: {} and {}",
+                                    oldIdentity->containerClass(), containerClass));
+  if (preserveOldUUID && !oldIdentity->uuid())
+    return QRVFail(error, QRV_ERROR(11, "Can't have a nil oldContainerUUID when preserving the UUID"));
+  const QRVUserIdentityRef& userIdentity = oldIdentity->userIdentity();
+  if (!QRVUserIdentityEqual()(userIdentity, newIdentity->userIdentity()))
+    return QRVFail(error,
+                   QRV_ERROR(76, "Can't replace containers of different personas: {} and {}",
+                             userIdentity ? userIdentity->description() : "(null)",
+                             newIdentity->userIdentity() ? newIdentity->userIdentity()->description() : "(null)"));
+
+  QRVFileManager& fm = *services_->fileManager;
+  QRVGlobalConfiguration& config = *services_->globalConfiguration;
+  QRVContainerCache& cache = *services_->containerCache;
+  try {
+    QRVGlobalWriteLock lock;
+
+    // The old container is the live one; the new one is usually a transient
+    // container prepared for the purpose, else another live one.
+    // A cache that cannot answer (unreadable class directory, vanished
+    // metadata) is reported as such, not as a missing container.
+    QRVError cacheError;
+    auto find = [&](const QRVContainerIdentity& identity, bool transientFirst) -> QRVMetadataRef {
+      for (bool transient : {transientFirst, !transientFirst}) {
+        QRVError e;
+        QRVMetadataRef m = cache.containerForContainerIdentity(identity, transient, false, &e);
+        if (m && (!identity.uuid() || m->uuid() == *identity.uuid())) return m->withTransient(transient);
+        if (!m && !QRVContainerCache::isNotFoundError(e)) cacheError = e;
+      }
+      return nullptr;
+    };
+    auto notFound = [&](const QRVContainerIdentity& identity) {
+      if (!cacheError.code())
+        return QRVFail(error, QRV_ERROR(21, "No Container with identity: {}", identity.description()));
+      return QRVFail(error, cacheError);
+    };
+    QRVMetadataRef oldMetadata = find(*oldIdentity, false);
+    if (!oldMetadata) return notFound(*oldIdentity);
+    QRVMetadataRef newMetadata = find(*newIdentity, true);
+    if (!newMetadata) return notFound(*newIdentity);
+    const std::string oldURL = QRVPathWithoutTrailingSlashes(oldMetadata->url());
+    const std::string newURL = QRVPathWithoutTrailingSlashes(newMetadata->url());
+    if (oldURL == newURL) return QRVFail(error, QRV_ERROR(22, "Can't replace the same container at {}", oldURL));
+    if (!QRVUUID::fromString(QRVLastPathComponent(newURL)))
+      return QRVFail(error, QRV_ERROR(10, "Invalid URL (last path component not UUID): {}", newURL));
+
+    const QRVUUID keptUUID = preserveOldUUID ? *oldIdentity->uuid() : *newIdentity->uuid();
+    const bool transient = oldMetadata->transient();
+    std::optional<std::string> parent =
+        config.containerDirectoryURLForUserIdentity(userIdentity, containerClass, transient);
+    if (!parent) return QRVFail(error, QRV_ERROR(11, "Can't act on an invalid container class: {}", containerClass));
+    const std::string dest = QRVPathWithoutTrailingSlashes(*parent) + "/" + keptUUID.string();
+    // When the old UUID is kept the destination is the old directory's own
+    // place, which the first rename empties.
+    if (dest != oldURL) {
+      if (fm.itemExistsAtURL(dest)) return QRVFail(error, QRV_ERROR(27, "Container already exists at {}", dest));
+      QRVError listError;
+      auto existing = cache.allContainersForUserIdentity(userIdentity, containerClass, transient, &listError);
+      if (existing) {
+        for (const QRVMetadataRef& m : *existing) {
+          if (QRVPathWithoutTrailingSlashes(m->url()) == dest)
+            return QRVFail(error,
+                           QRV_ERROR(27, "Container with identifier: {}, class: {}, transient: {} already exists",
+                                     m->identifier(), containerClass, transient ? 1 : 0));
+        }
+      }
+    }
+
+    const std::string stagingParent = config.stagingDirectoryURLForUserIdentity(userIdentity, containerClass);
+    const std::string staging = QRVPathWithoutTrailingSlashes(stagingParent) + "/" + QRVUUID::random().string();
+    const std::string replaceDirectory = config.replaceDirectory();
+    const std::string journalURL = QRVPathWithoutTrailingSlashes(replaceDirectory) + "/" + QRVUUID::random().string() + ".plist";
+    QRVError step;
+    if (!fm.createDirectoryAtURL(replaceDirectory, true, 0755, &step) ||
+        !fm.createDirectoryAtURL(stagingParent, true, 0755, &step) ||
+        !_writeToDiskReplaceAt(journalURL, oldURL, newURL, staging, dest, &step)) {
+      QRVLogError("Failed to write replace file: {}", step.description());
+      return QRVFail(error, step);
+    }
+    QRVCrashPoint(*services_, "replace.journal-written");
+
+    // Park the old directory; from here on the journal knows where it is.
+    if (!fm.moveItemAtURL(oldURL, staging, &step))
+      return QRVFail(error, QRV_ERROR_UNDERLYING(14, step, "Failed to move old {} to staging {}", oldURL, staging));
+    if (!cache.removeContainerForUserIdentity(userIdentity, containerClass, oldMetadata->identifier(), transient,
+                                              &step))
+      return QRVFail(error,
+                     QRV_ERROR_UNDERLYING(46, step, "Failed to remove from cache id: {}, class: {}, transient: {}",
+                                          oldMetadata->identifier(), containerClass, transient ? 1 : 0));
+    if (services_->codeSigning->invalidateCodeSigningInfoForIdentifierAndItsChildren(oldMetadata->identifier()) !=
+        QRVError::kSuccess)
+      QRVLogError("Failed to invalidate code signing info for {}", oldMetadata->identifier());
+    QRVCrashPoint(*services_, "replace.old-parked");
+
+    // The kept UUID goes into the new container's metadata before it moves,
+    // so that whenever it is at the destination its metadata is right.
+    QRVMetadataRef placed = newMetadata->withUUID(keptUUID)->withURL(dest)->withTransient(transient);
+    if (keptUUID != newMetadata->uuid() && !placed->withURL(newURL)->writeMetadataToDisk(fm, config, &step)) {
+      QRVError backError;
+      if (!fm.moveItemAtURL(staging, oldURL, &backError))
+        return QRVFail(
+            error, QRV_ERROR_UNDERLYING(35, backError, "Failed to recover replace move: {} to {}", staging, oldURL));
+      cache.addContainerMetadata(oldMetadata, oldURL, transient, true, nullptr);
+      _moveItemAtURLToDeathRow(journalURL, false, false, nullptr);
+      return QRVFail(error, QRV_ERROR_UNDERLYING(45, step, "Failed to add to cache: {}, url: {}, transient: {}",
+                                                 newIdentity->description(), dest, transient ? 1 : 0));
+    }
+
+    if (!fm.moveItemAtURL(newURL, dest, &step)) {
+      QRVError replaceError =
+          QRV_ERROR_UNDERLYING(15, step, "Failed to replace: {} with: {} at: {}", oldURL, newURL, dest);
+      QRVError backError;
+      if (!fm.moveItemAtURL(staging, oldURL, &backError))
+        return QRVFail(
+            error, QRV_ERROR_UNDERLYING(35, backError, "Failed to recover replace move: {} to {}", staging, oldURL));
+      // The old container is back where it was: the journal is moot, and
+      // the cache learns of it again.
+      cache.addContainerMetadata(oldMetadata, oldURL, transient, true, nullptr);
+      // The new container keeps its own identity where it is.
+      if (keptUUID != newMetadata->uuid()) newMetadata->writeMetadataToDisk(fm, config, nullptr);
+      _moveItemAtURLToDeathRow(journalURL, false, false, nullptr);
+      return QRVFail(error, replaceError);
+    }
+    QRVCrashPoint(*services_, "replace.new-placed");
+
+    if (!cache.removeContainerForUserIdentity(userIdentity, containerClass, newMetadata->identifier(),
+                                              newMetadata->transient(), &step))
+      return QRVFail(error,
+                     QRV_ERROR_UNDERLYING(46, step, "Failed to remove from cache id: {}, class: {}, transient: {}",
+                                          newMetadata->identifier(), containerClass, newMetadata->transient() ? 1 : 0));
+    if (oldMetadata->identifier() != newMetadata->identifier())
+      cache.setSandboxContainerMappingForUserIdentity(userIdentity, oldMetadata->identifier(), containerClass,
+                                                      std::nullopt);
+    if (!cache.addContainerMetadata(placed, dest, transient, true, &step))
+      return QRVFail(error, QRV_ERROR_UNDERLYING(45, step, "Failed to add to cache: {}, url: {}, transient: {}",
+                                                 newIdentity->description(), dest, transient ? 1 : 0));
+    QRVCrashPoint(*services_, "replace.cache-updated");
+
+    if (!_moveItemAtURLToDeathRow(staging, true, startDeletionThread, &step))
+      return QRVFail(error, QRV_ERROR_UNDERLYING(36, step, "Failed to remove staging dir: {}", staging));
+    QRVCrashPoint(*services_, "replace.staging-removed");
+    if (!_moveItemAtURLToDeathRow(journalURL, false, false, &step))
+      return QRVFail(error, QRV_ERROR_UNDERLYING(36, step, "Failed to remove replace file: {}", journalURL));
+    return true;
+  } catch (...) {
+    if (config.isInternalImage()) QRVReportUncaughtException(std::current_exception());
+    return QRVFail(error, QRV_ERROR(40, "Got exception: {} : {}", QRVExceptionDescription(std::current_exception()),
+                                    "(no call stack)"));
+  }
+}
+
+bool QRVClientConnection::deleteDataContainerContentWithContainerIdentity(
+    const QRVContainerIdentityRef& containerIdentity, QRVError* error) {
+  if (!containerIdentity || containerIdentity->identifier().empty())
+    return QRVFail(error, QRV_ERROR(38, "Can't wipe container with nil identifier: {}",
+                                    containerIdentity ? containerIdentity->description() : "(null)"));
+  const std::string& identifier = containerIdentity->identifier();
+  const QRVContainerClass containerClass = containerIdentity->containerClass();
+  if (!QRVContainerClassIsValid(containerClass))
+    return QRVFail(error,
+                   QRV_ERROR(11, "Can't wipe container with of type: {}, identifier: {}", containerClass, identifier));
+  if (!isWipeableDataClass(containerClass))
+    return QRVFail(error, QRV_ERROR(11, "Can't wipe container non-data container of type: {}, identifier: {}",
+                                    containerClass, identifier));
+  bool entitled = unrestricted_;
+  if (!entitled && entitledWipeIdentifiers_) {
+    for (const QRVPlist& v : *entitledWipeIdentifiers_)
+      if (v.isString() && v.stringValue() == identifier) entitled = true;
+  }
+  if (!entitled) return QRVFail(error, QRV_ERROR(55, "Not entitled to wipe container with identifier: {}", identifier));
+
+  try {
+    UnrestrictedScope widened(*this);
+    QRVError step;
+    QRVMetadataRef existing =
+        createOrLookupContainerWithContainerIdentity(containerIdentity, false, false, true, &step);
+    if (!existing) {
+      if (!QRVContainerCache::isNotFoundError(step)) QRVLogError("Failed to lookup existing container to wipe-identifier: {}", identifier);
+      return QRVFail(error, step);
+    }
+    QRVMetadataRef fresh = createOrLookupContainerWithContainerIdentity(containerIdentity, true, true, true, &step);
+    if (!fresh) {
+      QRVLogError("Failed to create transient container for wipe-identifier: {}", identifier);
+      return QRVFail(error, step);
+    }
+    if (!replaceContainerIdentity(existing->containerIdentity(), fresh->containerIdentity(), true, true, &step)) {
+      QRVLogError("Failed replace operation during delete all content: {}", step.description());
+      return QRVFail(error, step);
+    }
+    return true;
+  } catch (...) {
+    if (services_->globalConfiguration->isInternalImage()) QRVReportUncaughtException(std::current_exception());
+    return QRVFail(error, QRV_ERROR(40, "Got exception: {} : {}", QRVExceptionDescription(std::current_exception()),
+                                    "(no call stack)"));
+  }
+}

@@ -1,0 +1,116 @@
+#include "core/QRVDaemon.h"
+
+#include <gtest/gtest.h>
+
+#include <chrono>
+#include <thread>
+
+#include "base/QRVLog.h"
+#include "support/QRVEventually.h"
+#include "support/QRVTestServices.h"
+
+namespace {
+
+class DaemonTest : public testing::Test {
+ protected:
+  void TearDown() override { QRVLog::close(); }
+
+  // Runs start-up and waits for its cleanups, which run on their own queue and
+  // whose completions refer to the daemon, to post their notifications.
+  std::unique_ptr<QRVDaemon> startDaemon() {
+    size_t before = env_.notifications->posted().size();
+    auto daemon = std::make_unique<QRVDaemon>(env_.services, QRVDaemon::Options{});
+    env_.messages->beginTransaction();  // as the entry point does; start-up closes it
+    daemon->quorvad_init();
+    size_t expected = before + (daemon->isFirstBoot() ? 2 : 1);
+    EXPECT_TRUE(QRVEventually([&] { return env_.notifications->posted().size() >= expected; }));
+    // The cleanups hold transactions of their own for a while; the entry
+    // point's one must be closed for the daemon ever to fall idle.
+    EXPECT_TRUE(QRVEventually([&] { return env_.messages->isIdle(); }));
+    return daemon;
+  }
+
+  QRVTestServices env_;
+};
+
+TEST_F(DaemonTest, FirstStartSinceBootRunsBootWorkOnceAndMarksIt) {
+  auto first = startDaemon();
+  EXPECT_TRUE(first->isFirstBoot());
+  auto posted = env_.notifications->posted();
+  EXPECT_NE(std::find(posted.begin(), posted.end(), kRebootCleanupCompleteNotification), posted.end());
+  EXPECT_NE(std::find(posted.begin(), posted.end(), kCleanupCompleteNotification), posted.end());
+  EXPECT_TRUE(env_.firstBootMarker->present);
+  // The log was opened in the daemon's log directory.
+  EXPECT_TRUE(std::filesystem::exists(env_.root.path() + "/private/var/root/Library/Logs/Quorva/quorvad.log"));
+
+  // A second start in the same boot does only the ordinary cleanup.
+  auto second = startDaemon();
+  EXPECT_FALSE(second->isFirstBoot());
+  ASSERT_EQ(env_.notifications->posted().size(), 3u);
+  EXPECT_EQ(env_.notifications->posted().back(), kCleanupCompleteNotification);
+  std::this_thread::sleep_for(std::chrono::milliseconds(50));
+  EXPECT_EQ(env_.notifications->posted().size(), 3u);
+}
+
+TEST_F(DaemonTest, MarkerThatCannotBeCreatedMeansBootWorkRunsAgain) {
+  env_.firstBootMarker->createError = EACCES;
+  auto daemon = startDaemon();
+  EXPECT_EQ(env_.notifications->posted().size(), 2u);
+  EXPECT_FALSE(env_.firstBootMarker->present);
+  EXPECT_TRUE(startDaemon()->isFirstBoot());
+}
+
+TEST_F(DaemonTest, LockStateSuspendsAndResumesTheQueueInBalance) {
+  auto daemon = startDaemon();
+  QRVSerialQueue& queue = *daemon->lockStateQueue();
+  EXPECT_FALSE(queue.isSuspended());
+
+  // An unlock with no lock before it changes nothing (a resume here would
+  // abort: more resumes than suspensions).
+  env_.lockState->state = 0;
+  daemon->lockStateCallback();
+  EXPECT_FALSE(queue.isSuspended());
+
+  // Two locked notifications suspend once: one unlock resumes.
+  env_.lockState->state = 1;
+  daemon->lockStateCallback();
+  daemon->lockStateCallback();
+  EXPECT_TRUE(queue.isSuspended());
+  // A transitional state leaves the queue as it is.
+  env_.lockState->state = 2;
+  daemon->lockStateCallback();
+  EXPECT_TRUE(queue.isSuspended());
+  env_.lockState->state = 0;
+  daemon->lockStateCallback();
+  EXPECT_FALSE(queue.isSuspended());
+}
+
+TEST_F(DaemonTest, StartsLockedWhenTheDeviceIsLockedAndFollowsNotifications) {
+  env_.lockState->state = 1;
+  auto daemon = startDaemon();
+  EXPECT_TRUE(daemon->lockStateQueue()->isSuspended());
+  // A change notification reaches the callback (on the main queue).
+  env_.lockState->change(0);
+  EXPECT_TRUE(QRVEventually([&] { return !daemon->lockStateQueue()->isSuspended(); }));
+}
+
+TEST_F(DaemonTest, FailedLockStateRegistrationStillAppliesTheCurrentState) {
+  env_.lockState->registrationResult = 5;
+  env_.lockState->state = 1;
+  auto daemon = startDaemon();
+  EXPECT_TRUE(daemon->lockStateQueue()->isSuspended());
+  EXPECT_FALSE(env_.lockState->onChange);
+}
+
+TEST_F(DaemonTest, KeepAliveCoversAsynchronousJobs) {
+  auto daemon = startDaemon();
+  std::atomic<bool> release{false};
+  env_.services->asyncWithKeepAlive(daemon->deathRowQueue(), [&] {
+    while (!release) std::this_thread::sleep_for(std::chrono::milliseconds(1));
+  });
+  EXPECT_FALSE(env_.messages->isIdle());
+  release = true;
+  EXPECT_TRUE(QRVEventually([&] { return env_.messages->isIdle(); }));
+}
+
+}  // namespace

@@ -1,0 +1,364 @@
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <chrono>
+#include <filesystem>
+#include <fstream>
+#include <thread>
+
+#include "model/QRVContainerCache.h"
+#include "operations/QRVClientConnection.h"
+#include "support/QRVTestServices.h"
+
+namespace fs = std::filesystem;
+
+namespace {
+
+class GrantsOneGroup : public QRVNoSystemGroupQueries {
+ public:
+  std::vector<std::string> systemGroupIdentifiersForIdentifier(const std::string& id) override {
+    if (id == "com.example.daemon") return {"systemgroup.com.example.shared"};
+    return {};
+  }
+};
+
+class KnowsOneName : public QRVNoWellKnownNames {
+ public:
+  std::optional<std::string> wellknownSystemContainerForId(const std::string& id) override {
+    return id == "com.example.wellknown" ? std::optional<std::string>("com.example.wellknown") : std::nullopt;
+  }
+  bool systemContainerIdIsWellknown(const std::string& id) override { return id == "com.example.wellknown"; }
+};
+
+void writeFile(const std::string& path, size_t bytes) {
+  std::ofstream out(path, std::ios::binary);
+  std::string block(4096, 'x');
+  for (size_t written = 0; written < bytes; written += block.size()) out.write(block.data(), block.size());
+}
+
+QRVPlist key(const std::string& k) { return QRVPlist::string(k); }
+
+class ContentsTest : public testing::Test {
+ protected:
+  void SetUp() override {
+    if (geteuid() != 0) GTEST_SKIP() << "needs root: containers are given to their owners";
+  }
+
+  std::shared_ptr<QRVClientConnection> connectionFor(const std::string& caller, bool entitled = true,
+                                                     bool powerful = false) {
+    auto user = env_.services->userIdentityCache->userIdentityForPersonalPersonaWithUID(501, 501);
+    auto identity = std::make_shared<const QRVClientIdentity>(caller, 501, 501, 42, user, QRVPlist::dictionary(), false,
+                                                              QRVAuditToken::make(501, 501, 42, 1));
+    return std::make_shared<QRVClientConnection>(identity, entitled, powerful, powerful, std::nullopt, std::nullopt,
+                                                 std::make_shared<QRVCommandQueue>(), env_.services);
+  }
+  std::shared_ptr<QRVClientConnection> admin() { return connectionFor("com.example.installer", true, true); }
+
+  QRVContainerIdentityRef identity(const std::string& id, QRVContainerClass c = QRVContainerClassAppData) {
+    QRVError error;
+    auto user = QRVUserIdentity::isUserIdentityRequiredForContainerClass(c)
+                    ? env_.services->userIdentityCache->userIdentityForPersonalPersonaWithUID(501, 501)
+                    : env_.services->userIdentityCache->defaultUserIdentity();
+    return QRVContainerIdentity::containerIdentityWithUserIdentity(user, id, c, &error);
+  }
+  QRVMetadataRef create(const QRVContainerIdentityRef& id) {
+    QRVError error;
+    auto m = admin()->createOrLookupContainerWithContainerIdentity(id, true, false, true, &error);
+    EXPECT_NE(m, nullptr) << error.description();
+    return m;
+  }
+  // The assets path as `by` (default the installer) asks for it; a failure
+  // leaves its error in error_.
+  std::optional<std::string> assets(const QRVContainerIdentityRef& id, bool relative, bool createIfNecessary,
+                                    std::shared_ptr<QRVClientConnection> by = nullptr) {
+    error_ = QRVError();
+    return (by ? by : admin())
+        ->userManagedAssetsPathWithContainerIdentity(id, relative, createIfNecessary, &existed_, &error_);
+  }
+  // Forgets everything in memory, so that what follows sees only the disk.
+  void freshCache() {
+    env_.services->containerCache = std::make_shared<QRVContainerCache>(
+        env_.services->fileManager, env_.services->globalConfiguration, env_.services->userIdentityCache,
+        env_.services->platform.sandbox, nullptr, env_.services->wellKnownNames);
+  }
+
+  QRVTestServices env_;
+  QRVError error_;
+  bool existed_ = false;
+};
+
+TEST_F(ContentsTest, InfoValuesAreSetReadAndRemovedAndSurviveAFreshCache) {
+  auto app = identity("com.example.app");
+  QRVError error;
+  EXPECT_FALSE(admin()->setInfoValue(QRVPlist::string("v"), key("k"), app, true, &error));
+  EXPECT_EQ(error.code(), 21u);
+  create(app);
+
+  ASSERT_TRUE(admin()->setInfoValue(QRVPlist::string("v"), key("k"), app, true, &error)) << error.description();
+  ASSERT_TRUE(admin()->setInfoValue(QRVPlist::uinteger(7), key("n"), app, true, &error));
+  freshCache();
+  EXPECT_EQ(admin()->infoValueForKey(key("k"), app, true, &error), QRVPlist::string("v")) << error.description();
+  EXPECT_EQ(admin()->infoValueForKey(key("n"), app, false, &error), QRVPlist::uinteger(7));
+
+  // Setting nothing removes the key, on disk too.
+  ASSERT_TRUE(admin()->removeInfoValueForKey(key("k"), app, true, &error));
+  freshCache();
+  EXPECT_FALSE(admin()->infoValueForKey(key("k"), app, true, &error).has_value());
+  EXPECT_EQ(error.code(), 24u);
+  EXPECT_EQ(admin()->infoValueForKey(key("n"), app, true, &error), QRVPlist::uinteger(7));
+
+  // Keys must be strings.
+  EXPECT_FALSE(admin()->infoValueForKey(QRVPlist::uinteger(1), app, true, &error).has_value());
+  EXPECT_EQ(error.code(), 38u);
+  EXPECT_FALSE(admin()->setInfoValue(QRVPlist::string("v"), QRVPlist(), app, true, &error));
+  EXPECT_EQ(error.code(), 38u);
+}
+
+TEST_F(ContentsTest, ConcurrentWritersOfDifferentKeysKeepBothValues) {
+  auto app = identity("com.example.app");
+  create(app);
+  std::vector<std::thread> threads;
+  for (int t = 0; t < 4; t++)
+    threads.emplace_back([&, t] {
+      for (int i = 0; i < 10; i++) {
+        QRVError e;
+        EXPECT_TRUE(admin()->setInfoValue(QRVPlist::uinteger(i), key("key" + std::to_string(t)), app, true, &e));
+      }
+    });
+  for (auto& t : threads) t.join();
+  freshCache();
+  QRVError error;
+  for (int t = 0; t < 4; t++)
+    EXPECT_EQ(admin()->infoValueForKey(key("key" + std::to_string(t)), app, true, &error), QRVPlist::uinteger(9));
+}
+
+TEST_F(ContentsTest, AssetsPathIsCreatedOnceOwnedByTheUserAndAnsweredRelativeOrAbsolute) {
+  auto app = identity("com.example.app");
+  EXPECT_FALSE(assets(app, false, false));
+  EXPECT_EQ(error_.code(), 21u);
+  // Asked to create, it makes the application data container as well.
+  existed_ = true;
+  auto path = assets(app, false, true);
+  ASSERT_TRUE(path.has_value()) << error_.description();
+  EXPECT_FALSE(existed_);
+  QRVError error;
+  auto container = admin()->metadataWithContainerIdentity(app, &error);
+  ASSERT_NE(container, nullptr) << error.description();
+  const std::string name = fs::path(*path).filename().string();
+  EXPECT_EQ(*path, container->url() + "/" + name);
+  EXPECT_EQ(name.rfind("com.kelva.UserManagedAssets.", 0), 0u) << name;
+  struct stat st;
+  ASSERT_EQ(stat(path->c_str(), &st), 0);
+  EXPECT_TRUE(S_ISDIR(st.st_mode));
+  EXPECT_EQ(st.st_uid, 501u);
+  EXPECT_EQ(st.st_gid, 501u);
+  EXPECT_EQ(st.st_mode & 07777, 0755u);
+
+  // The name is in the metadata file: a fresh cache answers the same.
+  freshCache();
+  EXPECT_EQ(assets(app, true, true), name) << error_.description();
+  EXPECT_TRUE(existed_);
+
+  // Without the entitlement only one's own identifier.
+  EXPECT_EQ(assets(app, true, false, connectionFor("com.example.app", false)), name);
+  EXPECT_FALSE(assets(app, true, false, connectionFor("com.example.other", false)));
+  EXPECT_EQ(error_.code(), 38u);
+
+  // A container without the directory is not given one by a mere look-up.
+  auto plain = identity("com.example.plain");
+  create(plain);
+  EXPECT_FALSE(assets(plain, false, false));
+  EXPECT_EQ(error_.code(), 71u);
+}
+
+class AssetDeletionTest : public ContentsTest {
+ protected:
+  void SetUp() override {
+    ContentsTest::SetUp();
+    if (IsSkipped()) return;
+    app_ = identity("com.example.app");
+    container_ = create(app_);
+    assets_ = assets(app_, false, true).value_or("");
+    ASSERT_FALSE(assets_.empty()) << error_.description();
+    // Outside the container entirely, and inside it but outside the assets.
+    outside_ = env_.root.path() + "/victim";
+    writeFile(outside_, 10);
+    writeFile(container_->url() + "/Documents/precious", 10);
+    fs::create_directories(assets_ + "/sub/deeper");
+    writeFile(assets_ + "/sub/deeper/file", 10);
+    writeFile(assets_ + "/file", 10);
+    fs::create_symlink("../Documents", assets_ + "/climb");
+    fs::create_symlink(outside_, assets_ + "/absolute");
+    fs::create_symlink("sub/deeper/file", assets_ + "/inner");
+  }
+  uint64_t remove(const std::string& relativePath, const QRVContainerIdentityRef& id = nullptr) {
+    QRVError error;
+    return admin()->deleteUserManagedAssetWithContainerIdentity(id ? id : app_, relativePath, &error) ? 1
+                                                                                                      : error.code();
+  }
+  void expectNothingOutsideTouched() {
+    EXPECT_TRUE(fs::exists(outside_));
+    EXPECT_TRUE(fs::exists(container_->url() + "/Documents/precious"));
+    EXPECT_TRUE(fs::is_directory(assets_));
+  }
+
+  QRVContainerIdentityRef app_;
+  QRVMetadataRef container_;
+  std::string assets_, outside_;
+};
+
+TEST_F(AssetDeletionTest, RemovesOnlyWhatLiesInsideTheAssetsDirectory) {
+  // The directory itself, anything outside it, through links or not, and
+  // what is not a relative path at all.
+  for (const char* path : {".", "./", "sub/..", "..", "../Documents/precious", "climb", "climb/precious", "absolute"})
+    EXPECT_EQ(remove(path), 10u) << path;
+  EXPECT_EQ(remove(""), 11u);
+  EXPECT_EQ(remove(outside_), 11u);
+  expectNothingOutsideTouched();
+  EXPECT_TRUE(fs::is_symlink(assets_ + "/climb"));
+  EXPECT_TRUE(fs::is_symlink(assets_ + "/absolute"));
+
+  EXPECT_EQ(remove("file"), 1u);
+  EXPECT_FALSE(fs::exists(assets_ + "/file"));
+  // A link inside is removed itself, not what it names.
+  EXPECT_EQ(remove("inner"), 1u);
+  EXPECT_FALSE(fs::is_symlink(assets_ + "/inner"));
+  EXPECT_TRUE(fs::exists(assets_ + "/sub/deeper/file"));
+  EXPECT_EQ(remove("sub/"), 1u);
+  EXPECT_FALSE(fs::exists(assets_ + "/sub"));
+  // Removing what is already gone is no failure.
+  EXPECT_EQ(remove("nothing-here"), 1u);
+  expectNothingOutsideTouched();
+}
+
+TEST_F(AssetDeletionTest, FailuresAndAnAssetsDirectorySwappedForALink) {
+  env_.fileSystem->failNext(QRVFakeFileSystemExtras::Operation::kRemoveTree, EIO);
+  EXPECT_EQ(remove("file"), 41u);
+  auto plain = identity("com.example.plain");
+  create(plain);
+  EXPECT_EQ(remove("file", plain), 11u);  // no assets directory
+
+  fs::remove_all(assets_);
+  fs::create_symlink("Documents", assets_);
+  EXPECT_EQ(remove("precious"), 10u);
+  EXPECT_TRUE(fs::exists(container_->url() + "/Documents/precious"));
+}
+
+TEST_F(ContentsTest, DataContainersAreMeasuredEveryTimeBundlesOnce) {
+  auto data = identity("com.example.app");
+  auto dataContainer = create(data);
+  QRVError error;
+  auto before = admin()->diskUsageWithContainerIdentity(data, &error);
+  ASSERT_TRUE(before.has_value()) << error.description();
+  writeFile(dataContainer->url() + "/Documents/big", 1 << 20);
+  auto after = admin()->diskUsageWithContainerIdentity(data, &error);
+  ASSERT_TRUE(after.has_value());
+  EXPECT_GE(*after, *before + (1 << 20));
+  EXPECT_FALSE(admin()->infoValueForKey(key("com.kelva.Verdane.StaticDiskUsage"), data, true, &error));
+
+  auto bundle = identity("com.example.app", QRVContainerClassAppBundle);
+  auto bundleContainer = create(bundle);
+  writeFile(bundleContainer->url() + "/binary", 1 << 20);
+  auto first = admin()->diskUsageWithContainerIdentity(bundle, &error);
+  ASSERT_TRUE(first.has_value()) << error.description();
+  EXPECT_GE(*first, 1u << 20);
+  EXPECT_EQ(admin()->infoValueForKey(key("com.kelva.Verdane.StaticDiskUsage"), bundle, true, &error),
+            QRVPlist::uinteger(*first));
+  writeFile(bundleContainer->url() + "/more", 1 << 20);
+  EXPECT_EQ(admin()->diskUsageWithContainerIdentity(bundle, &error), first);
+
+  EXPECT_FALSE(admin()->diskUsageWithContainerIdentity(identity("com.example.none"), &error));
+  EXPECT_EQ(error.code(), 21u);
+
+  // Measuring waits at test lock point 2.
+  QRVTestLocks& locks = *env_.services->testLocks;
+  locks.setEnabled(true);
+  ASSERT_TRUE(locks.acquireLock(2));
+  std::atomic<bool> done{false};
+  std::thread measuring([&] {
+    QRVError e;
+    EXPECT_TRUE(admin()->diskUsageWithContainerIdentity(data, &e).has_value());
+    done = true;
+  });
+  std::this_thread::sleep_for(std::chrono::milliseconds(200));
+  EXPECT_FALSE(done.load());
+  locks.releaseLock(2);
+  measuring.join();
+  locks.setEnabled(false);
+}
+
+TEST_F(ContentsTest, NewDirectoryUUIDKeepsTheContainerReachable) {
+  auto app = identity("com.example.app");
+  auto old = create(app);
+  writeFile(old->url() + "/Documents/kept", 10);
+  QRVError error;
+  auto concreteOld = old->containerIdentity();
+  auto moved = admin()->regenerateDirectoryUUIDWithContainerIdentity(concreteOld, &error);
+  ASSERT_NE(moved, nullptr) << error.description();
+  EXPECT_NE(moved->uuid(), old->uuid());
+  EXPECT_EQ(fs::path(moved->url()).filename().string(), moved->uuid().string());
+  EXPECT_EQ(fs::path(moved->url()).parent_path(), fs::path(old->url()).parent_path());
+  EXPECT_FALSE(fs::exists(old->url()));
+  EXPECT_TRUE(fs::exists(moved->url() + "/Documents/kept"));
+
+  for (bool fresh : {false, true}) {
+    if (fresh) freshCache();
+    auto found = admin()->metadataWithContainerIdentity(app, &error);
+    ASSERT_NE(found, nullptr) << error.description();
+    EXPECT_EQ(found->uuid(), moved->uuid());
+    EXPECT_EQ(found->url(), moved->url());
+    // The old UUID names nothing any more.
+    EXPECT_EQ(admin()->metadataWithContainerIdentity(concreteOld, &error), nullptr);
+    EXPECT_EQ(error.code(), 21u);
+  }
+
+  // A directory not named by a UUID (a well-known name) keeps its name.
+  env_.services->wellKnownNames = std::make_shared<KnowsOneName>();
+  freshCache();
+  auto wellKnown = identity("com.example.wellknown", QRVContainerClassSystemData);
+  auto container = create(wellKnown);
+  ASSERT_NE(container, nullptr);
+  EXPECT_EQ(admin()->regenerateDirectoryUUIDWithContainerIdentity(wellKnown, &error), nullptr);
+  EXPECT_EQ(error.code(), 11u);
+  EXPECT_TRUE(fs::exists(container->url()));
+}
+
+TEST_F(ContentsTest, SharedContentGoesOnlyToAGrantedGroupAndNeverLeavesEitherContainer) {
+  auto own = create(identity("com.example.daemon", QRVContainerClassSystemData));
+  auto group = create(identity("systemgroup.com.example.shared", QRVContainerClassSystemGroup));
+  const std::string payload = own->url() + "/Library/out/payload";
+  fs::create_directories(fs::path(payload).parent_path());
+  writeFile(payload, 10);
+  auto stage = [&](const std::string& groupId, const std::string& source, const std::string& dest) -> uint64_t {
+    QRVError error;
+    return connectionFor("com.example.daemon")->stageSharedContentForIdentifier(groupId, source, dest, &error)
+               ? 1
+               : error.code();
+  };
+  const std::string shared = "systemgroup.com.example.shared";
+  // Without code signing no group is granted.
+  EXPECT_EQ(stage(shared, "Library/out/payload", "payload"), 55u);
+  EXPECT_EQ(stage(shared, "Library/../../x", "payload"), 38u);
+  EXPECT_EQ(stage("", "Library/out/payload", "payload"), 11u);
+
+  env_.services->systemGroups = std::make_shared<GrantsOneGroup>();
+  EXPECT_EQ(stage("systemgroup.com.example.other", "Library/out/payload", "payload"), 55u);
+  fs::create_symlink("../../..", own->url() + "/Library/up");
+  EXPECT_EQ(stage(shared, "Library/up", "payload"), 10u);
+  fs::create_symlink("/", group->url() + "/root");
+  EXPECT_EQ(stage(shared, "Library/out/payload", "root/payload"), 10u);
+  EXPECT_EQ(stage(shared, "Library/out/payload", "../payload"), 38u);
+  EXPECT_TRUE(fs::exists(payload));
+
+  QRVError error;
+  auto dest = connectionFor("com.example.daemon")
+                  ->stageSharedContentForIdentifier(shared, "Library/out/payload", "payload", &error);
+  ASSERT_TRUE(dest.has_value()) << error.description();
+  EXPECT_EQ(*dest, group->url() + "/payload");
+  EXPECT_TRUE(fs::exists(*dest));
+  EXPECT_FALSE(fs::exists(payload));
+}
+
+}  // namespace

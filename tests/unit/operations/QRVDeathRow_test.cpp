@@ -1,0 +1,115 @@
+#include <gtest/gtest.h>
+
+#include <filesystem>
+#include <fstream>
+#include <future>
+
+#include "operations/QRVClientConnection.h"
+#include "support/QRVEventually.h"
+#include "support/QRVTestServices.h"
+
+namespace fs = std::filesystem;
+
+namespace {
+
+class DeathRowTest : public testing::Test {
+ protected:
+  DeathRowTest() : connection_(QRVClientConnection::makeSharedClientConnection(env_.services)) {}
+
+  std::string deathRow() { return env_.services->globalConfiguration->deathrowDirectory(); }
+  std::string make(const std::string& name, bool dir) {
+    std::string path = env_.root.path() + "/" + name;
+    if (dir) {
+      fs::create_directories(path + "/inner");
+      std::ofstream(path + "/inner/file") << "data";
+    } else {
+      std::ofstream(path) << "data";
+    }
+    return path;
+  }
+  // Empties death row and waits for it.
+  void emptyDeathRow() {
+    std::promise<void> done;
+    connection_->deleteContainersOnDeathRowWithCompletion([&] { done.set_value(); });
+    ASSERT_EQ(done.get_future().wait_for(std::chrono::seconds(10)), std::future_status::ready);
+  }
+  size_t itemsOnDeathRow() {
+    size_t n = 0;
+    std::error_code gone;  // the background deletion may remove a directory while it is counted
+    for (auto& unique : fs::directory_iterator(deathRow(), gone))
+      n += static_cast<size_t>(std::distance(fs::directory_iterator(unique.path(), gone), fs::directory_iterator()));
+    return n;
+  }
+
+  QRVTestServices env_;
+  std::shared_ptr<QRVClientConnection> connection_;
+};
+
+TEST_F(DeathRowTest, ItemsOfOneNameNeverCollideAndNoPlaceThereIs41) {
+  QRVError error;
+  std::string a = make("same", true);
+  ASSERT_TRUE(connection_->_moveItemAtURLToDeathRow(a, true, false, &error)) << error.description();
+  std::string b = make("same", false);
+  ASSERT_TRUE(connection_->_moveItemAtURLToDeathRow(b, false, false, &error)) << error.description();
+  EXPECT_FALSE(fs::exists(a));
+  EXPECT_EQ(itemsOnDeathRow(), 2u);
+  // An item that is already gone counts as moved.
+  EXPECT_TRUE(connection_->_moveItemAtURLToDeathRow(env_.root.path() + "/never-was", true, false, &error));
+
+  emptyDeathRow();
+  EXPECT_EQ(itemsOnDeathRow(), 0u);
+
+  // A file where death row should be: no place can be made in it, 41.
+  std::string item = make("x", true), dead = deathRow();  // asking again would remake it
+  fs::remove_all(dead);
+  std::ofstream(dead) << "in the way";
+  EXPECT_FALSE(connection_->_moveItemAtURLToDeathRow(item, true, false, &error));
+  EXPECT_EQ(error.code(), 41u);
+  EXPECT_TRUE(fs::exists(item));
+}
+
+TEST_F(DeathRowTest, StartingTheDeletionEmptiesDeathRowInTheBackground) {
+  QRVError error;
+  ASSERT_TRUE(connection_->_moveItemAtURLToDeathRow(make("c", true), true, true, &error));
+  EXPECT_TRUE(QRVEventually([&] { return itemsOnDeathRow() == 0; }));
+  // The work held the daemon awake until it finished.
+  EXPECT_TRUE(QRVEventually([&] { return env_.messages->isIdle(); }));
+}
+
+TEST_F(DeathRowTest, WhatCannotBeRemovedIsParkedInTmp) {
+  QRVError error;
+  std::string item = make("stubborn", true);
+  env_.fileSystem->failNext(QRVFakeFileSystemExtras::Operation::kRemoveTree, EBUSY);
+  fs::create_directories(env_.root.path() + "/tmp");
+  ASSERT_TRUE(connection_->_removeItemOrMoveToTempAtURL(item, &error)) << error.description();
+  EXPECT_FALSE(fs::exists(item));
+  EXPECT_TRUE(fs::exists(env_.root.path() + "/tmp/stubborn/inner/file"));
+
+  // Without a place in /tmp either, the failure is reported as 4.
+  std::string other = make("stubborn2", true);
+  fs::remove_all(env_.root.path() + "/tmp");
+  env_.fileSystem->failNext(QRVFakeFileSystemExtras::Operation::kRemoveTree, EBUSY);
+  EXPECT_FALSE(connection_->_removeItemOrMoveToTempAtURL(other, &error));
+  EXPECT_EQ(error.code(), 4u);
+  EXPECT_TRUE(fs::exists(other));
+  // A missing item counts as removed.
+  EXPECT_TRUE(connection_->_removeItemOrMoveToTempAtURL(env_.root.path() + "/gone", &error));
+}
+
+TEST_F(DeathRowTest, StartUpCleanupEmptiesEveryStagingDirectory) {
+  QRVGlobalConfiguration& config = *env_.services->globalConfiguration;
+  auto user = env_.services->userIdentityCache->defaultUserIdentity();
+  std::string global = config.stagingDirectory(), perUser = config.stagingDirectoryURLForUserIdentity(user, 2);
+  fs::create_directories(global + "/half-built/Library");
+  fs::create_directories(perUser + "/another");
+  std::ofstream(perUser + "/temp_metadata-x.plist") << "x";
+  std::promise<void> done;
+  connection_->quorvaCleanupWithCompletion([&] { done.set_value(); });
+  ASSERT_EQ(done.get_future().wait_for(std::chrono::seconds(10)), std::future_status::ready);
+  EXPECT_TRUE(fs::is_empty(global));
+  EXPECT_TRUE(fs::is_empty(perUser));
+  // And what went to death row is deleted in the background.
+  EXPECT_TRUE(QRVEventually([&] { return itemsOnDeathRow() == 0; }));
+}
+
+}  // namespace

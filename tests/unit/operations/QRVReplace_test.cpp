@@ -1,0 +1,351 @@
+#include <gtest/gtest.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <filesystem>
+#include <fstream>
+
+#include "core/QRVDeleteHandlers.h"
+#include "fs/QRVDictionaryAdditions.h"
+#include "model/QRVContainerCache.h"
+#include "operations/QRVApplicationTerminationAssertion.h"
+#include "operations/QRVClientConnection.h"
+#include "platform/linux/QRVLinuxApplicationTermination.h"
+#include "support/QRVTestServices.h"
+
+namespace fs = std::filesystem;
+
+namespace {
+
+void writeText(const std::string& path, const std::string& text) { std::ofstream(path) << text; }
+std::string readText(const std::string& path) {
+  std::ifstream in(path);
+  return std::string(std::istreambuf_iterator<char>(in), {});
+}
+size_t entriesIn(const std::string& dir) {
+  std::error_code ec;
+  if (!fs::exists(dir, ec)) return 0;
+  return std::distance(fs::directory_iterator(dir), fs::directory_iterator());
+}
+
+class ReplaceTest : public testing::Test {
+ protected:
+  void SetUp() override {
+    if (geteuid() != 0) GTEST_SKIP() << "needs root: containers are given to their owners";
+  }
+
+  std::shared_ptr<QRVClientConnection> connection(const std::string& caller, bool unrestricted,
+                                                  std::optional<QRVPlist::Array> wipe = std::nullopt) {
+    auto identity = std::make_shared<const QRVClientIdentity>(caller, 501, 501, 42, mobile(), QRVPlist::dictionary(),
+                                                              false, QRVAuditToken::make(501, 501, 42, 1));
+    return std::make_shared<QRVClientConnection>(identity, true, unrestricted, unrestricted, std::nullopt, wipe,
+                                                 std::make_shared<QRVCommandQueue>(), env_.services);
+  }
+  std::shared_ptr<QRVClientConnection> admin() { return connection("com.example.installer", true); }
+
+  QRVUserIdentityRef mobile() {
+    return env_.services->userIdentityCache->userIdentityForPersonalPersonaWithUID(501, 501);
+  }
+  QRVContainerIdentityRef identity(const std::string& id, QRVContainerClass c = QRVContainerClassAppData,
+                                   QRVUserIdentityRef user = nullptr) {
+    QRVError error;
+    return QRVContainerIdentity::containerIdentityWithUserIdentity(user ? user : mobile(), id, c, &error);
+  }
+  QRVMetadataRef create(const QRVContainerIdentityRef& id, bool transient = false) {
+    QRVError error;
+    auto m = admin()->createOrLookupContainerWithContainerIdentity(id, true, transient, true, &error);
+    EXPECT_NE(m, nullptr) << error.description();
+    return m;
+  }
+  QRVMetadataRef lookup(const QRVContainerIdentityRef& id, QRVError* error) {
+    return admin()->createOrLookupContainerWithContainerIdentity(id, false, false, true, error);
+  }
+  uint64_t replaceCode(const QRVContainerIdentityRef& o, const QRVContainerIdentityRef& n, bool preserve = false) {
+    QRVError error;
+    return admin()->replaceContainerIdentity(o, n, preserve, false, &error) ? 1 : error.code();
+  }
+  std::string replaceDir() { return env_.services->globalConfiguration->replaceDirectory(); }
+
+  QRVTestServices env_;
+};
+
+TEST_F(ReplaceTest, ReplacePutsNewContentInPlaceAndLeavesNoJournal) {
+  for (bool preserve : {false, true}) {
+    SCOPED_TRACE(preserve ? "preserving the old UUID" : "taking the new UUID");
+    auto app = identity(preserve ? "com.example.kept" : "com.example.app");
+    auto old = create(app);
+    writeText(old->url() + "/old.txt", "old");
+    auto fresh = create(app, true);
+    writeText(fresh->url() + "/new.txt", "new");
+
+    ASSERT_EQ(replaceCode(old->containerIdentity(), fresh->containerIdentity(), preserve), 1u);
+    // Kept, the old UUID keeps the old path; else the new UUID names it.
+    const QRVUUID uuid = preserve ? old->uuid() : fresh->uuid();
+    const std::string dest = fs::path(old->url()).parent_path().string() + "/" + uuid.string();
+    EXPECT_EQ(readText(dest + "/new.txt"), "new");
+    EXPECT_FALSE(fs::exists(dest + "/old.txt"));
+    EXPECT_EQ(fs::exists(old->url()), preserve);
+    EXPECT_FALSE(fs::exists(fresh->url()));
+    EXPECT_EQ(entriesIn(replaceDir()), 0u);
+
+    QRVError error;
+    auto onDisk = QRVMetadata::readAndValidateMetadataAtUrl(dest, mobile(), true, *env_.services->fileManager,
+                                                            *env_.services->userIdentityCache, &error);
+    ASSERT_NE(onDisk, nullptr) << error.description();
+    EXPECT_EQ(onDisk->uuid(), uuid);
+    auto found = lookup(app, &error);
+    ASSERT_NE(found, nullptr) << error.description();
+    EXPECT_EQ(found->uuid(), uuid);
+    EXPECT_EQ(found->url(), dest);
+  }
+  // The old directories went to death row, not away.
+  EXPECT_GE(entriesIn(env_.services->globalConfiguration->deathrowDirectory()), 2u);
+}
+
+TEST_F(ReplaceTest, EachCheckAnswersItsCodeAndMovesNothing) {
+  auto a = create(identity("com.example.app")), b = create(identity("com.example.other"));
+  auto p = create(identity("com.example.plugin", QRVContainerClassPluginData));
+  writeText(a->url() + "/keep.txt", "a");
+
+  QRVError error;
+  auto elsewhere = QRVConcreteContainerIdentity::containerIdentityWithUUID(
+      b->uuid(),
+      QRVUserIdentity::make(502, 502, env_.root.path() + "/private/var/other", "", QRVPersonaTypePersonal, 502),
+      "com.example.other", QRVContainerClassAppData, &error);
+  ASSERT_NE(elsewhere, nullptr) << error.description();
+  auto ghost = QRVConcreteContainerIdentity::containerIdentityWithUUID(QRVUUID::random(), mobile(), "com.example.ghost",
+                                                                       QRVContainerClassAppData, &error);
+  EXPECT_EQ(replaceCode(nullptr, b->containerIdentity()), 38u);
+  EXPECT_EQ(replaceCode(a->containerIdentity(), identity("com.example.other")), 11u);  // no UUID on the new side
+  EXPECT_EQ(replaceCode(identity("com.example.app"), b->containerIdentity(), true), 11u);  // preserving, no old UUID
+  EXPECT_EQ(replaceCode(a->containerIdentity(), p->containerIdentity()), 23u);
+  EXPECT_EQ(replaceCode(a->containerIdentity(), a->containerIdentity()), 22u);
+  EXPECT_EQ(replaceCode(a->containerIdentity(), elsewhere), 76u);  // same identifier, another user
+  EXPECT_EQ(replaceCode(a->containerIdentity(), ghost), 21u);
+  // A live new container already sits at its own destination.
+  EXPECT_EQ(replaceCode(a->containerIdentity(), b->containerIdentity()), 27u);
+
+  EXPECT_EQ(readText(a->url() + "/keep.txt"), "a");
+  EXPECT_TRUE(fs::exists(b->url()));
+  EXPECT_EQ(entriesIn(replaceDir()), 0u);
+}
+
+class RecoveryTest : public ReplaceTest {
+ protected:
+  void SetUp() override {
+    ReplaceTest::SetUp();
+    if (IsSkipped()) return;
+    const std::string base = env_.root.path() + "/replace-test";
+    oldURL_ = base + "/live/" + QRVUUID::random().string();
+    staging_ = base + "/staging/" + QRVUUID::random().string();
+    dest_ = base + "/live/" + QRVUUID::random().string();
+    newURL_ = base + "/transient/" + QRVUUID::random().string();
+    for (const char* d : {"/live", "/staging", "/transient"}) fs::create_directories(base + d);
+    fs::create_directories(replaceDir());
+  }
+  void writeJournal() {
+    QRVError error;
+    ASSERT_TRUE(admin()->_writeToDiskReplaceAt(replaceDir() + "/j.plist", oldURL_, newURL_, staging_, dest_, &error))
+        << error.description();
+  }
+  void marked(const std::string& dir, const std::string& mark) {
+    fs::create_directories(dir);
+    writeText(dir + "/mark", mark);
+  }
+  void recover() {
+    QRVError error;
+    ASSERT_TRUE(admin()->_recoverFromReplaceOperationsWithError(&error)) << error.description();
+    EXPECT_EQ(entriesIn(replaceDir()), 0u);
+  }
+
+  std::string oldURL_, staging_, dest_, newURL_;
+};
+
+TEST_F(RecoveryTest, EachOfTheFourStatesEndsWithOneContainerInPlace) {
+  // Not started: the old directory is still in place.
+  marked(oldURL_, "old");
+  marked(newURL_, "new");
+  writeJournal();
+  recover();
+  EXPECT_EQ(readText(oldURL_ + "/mark"), "old");
+  EXPECT_EQ(readText(newURL_ + "/mark"), "new");
+  EXPECT_FALSE(fs::exists(staging_));
+
+  // Old parked in staging: it is put back.
+  fs::rename(oldURL_, staging_);
+  writeJournal();
+  recover();
+  EXPECT_EQ(readText(oldURL_ + "/mark"), "old");
+  EXPECT_FALSE(fs::exists(staging_));
+
+  // New at the destination: nothing moves; staging is left for cleanup.
+  fs::rename(oldURL_, staging_);
+  fs::rename(newURL_, dest_);
+  writeJournal();
+  recover();
+  EXPECT_EQ(readText(dest_ + "/mark"), "new");
+  EXPECT_EQ(readText(staging_ + "/mark"), "old");
+  EXPECT_FALSE(fs::exists(oldURL_));
+}
+
+TEST_F(RecoveryTest, BootSetUpRunsTheRecoveryAndNoReplaceDirectoryIsNothingToDo) {
+  marked(staging_, "old");
+  writeJournal();
+  admin()->quorvaSetup();
+  EXPECT_EQ(readText(oldURL_ + "/mark"), "old");
+  EXPECT_EQ(entriesIn(replaceDir()), 0u);
+
+  fs::remove_all(replaceDir());
+  QRVError error;
+  EXPECT_TRUE(admin()->_recoverFromReplaceOperationsWithError(&error)) << error.description();
+}
+
+TEST_F(RecoveryTest, UnreadableOrIncompleteJournalsAreDiscardedWithoutAMove) {
+  marked(staging_, "old");
+  writeText(replaceDir() + "/garbage.plist", "this is not a property list");
+  QRVPlist partial = QRVPlist::dictionary()
+                         .set("QRVReplaceOperationOldURL", QRVPlist::string(oldURL_))
+                         .set("QRVReplaceOperationStagingURL", QRVPlist::string(staging_))
+                         .set("QRVReplaceOperationDestURL", QRVPlist::string(dest_));
+  QRVError error;
+  ASSERT_TRUE(QRV_writeToURL(*env_.services->fileManager, partial, replaceDir() + "/partial.plist", &error));
+  ASSERT_TRUE(QRV_writeToURL(*env_.services->fileManager, QRVPlist::array(), replaceDir() + "/array.plist", &error));
+
+  for (const char* name : {"/partial.plist", "/garbage.plist"}) {
+    EXPECT_FALSE(admin()->_readAndValidateReplaceFileAtUrl(replaceDir() + name, &error));
+    EXPECT_EQ(error.code(), 35u) << name;
+  }
+  EXPECT_FALSE(admin()->_writeToDiskReplaceAt(replaceDir() + "/x.plist", oldURL_, "", staging_, dest_, &error));
+  EXPECT_EQ(error.code(), 33u);
+
+  recover();
+  EXPECT_FALSE(fs::exists(oldURL_));
+  EXPECT_EQ(readText(staging_ + "/mark"), "old");
+}
+
+TEST_F(ReplaceTest, WipeKeepsUUIDAndPathAndLeavesOnlyTheDefaultStructure) {
+  auto app = identity("com.example.app");
+  auto old = create(app);
+  writeText(old->url() + "/old.txt", "old");
+  auto subdirectories = env_.fileSystem->defaultSubdirectories(QRVContainerClassAppData);
+  ASSERT_FALSE(subdirectories.empty());
+  writeText(old->url() + "/" + subdirectories.front() + "/deep.txt", "old");
+
+  // Refused outside the caller's list, without a list, and for other classes.
+  QRVError error;
+  auto notListed = connection("com.example.settings", false, QRVPlist::Array{QRVPlist::string("com.example.other")});
+  EXPECT_FALSE(notListed->deleteDataContainerContentWithContainerIdentity(app, &error));
+  EXPECT_EQ(error.code(), 55u);
+  EXPECT_FALSE(connection("com.example.settings", false)->deleteDataContainerContentWithContainerIdentity(app, &error));
+  EXPECT_EQ(error.code(), 55u);
+  EXPECT_FALSE(admin()->deleteDataContainerContentWithContainerIdentity(
+      identity("com.example.app", QRVContainerClassAppBundle, env_.services->userIdentityCache->defaultUserIdentity()),
+      &error));
+  EXPECT_EQ(error.code(), 11u);
+  EXPECT_EQ(readText(old->url() + "/old.txt"), "old");
+
+  auto client = connection("com.example.settings", false, QRVPlist::Array{QRVPlist::string("com.example.app")});
+  ASSERT_TRUE(client->deleteDataContainerContentWithContainerIdentity(app, &error)) << error.description();
+  EXPECT_FALSE(client->isUnrestricted());  // widened only for the wipe itself
+  auto found = lookup(app, &error);
+  ASSERT_NE(found, nullptr) << error.description();
+  EXPECT_EQ(found->uuid(), old->uuid());
+  EXPECT_EQ(found->url(), old->url());
+  EXPECT_FALSE(fs::exists(old->url() + "/old.txt"));
+  for (const std::string& name : subdirectories) {
+    EXPECT_TRUE(fs::is_directory(old->url() + "/" + name)) << name;
+    // Only the default structure nested below it, nothing of the old content.
+    for (const auto& entry : fs::directory_iterator(old->url() + "/" + name)) {
+      std::string relative = name + "/" + entry.path().filename().string();
+      EXPECT_NE(std::find(subdirectories.begin(), subdirectories.end(), relative), subdirectories.end()) << relative;
+    }
+  }
+  EXPECT_EQ(entriesIn(replaceDir()), 0u);
+}
+
+TEST_F(ReplaceTest, DeleteCommandsStageThroughTheQueue) {
+  auto app = identity("com.example.app");
+  auto a = create(app), b = create(identity("com.example.other"));
+  auto client = admin();
+  auto uuidData = [](const QRVUUID& u) { return QRVPlist::data(QRVPlist::Bytes(u.bytes().begin(), u.bytes().end())); };
+
+  // Arrays of lengths 2, 2, 2, 1: refused, nothing queued.
+  QRVPlist request =
+      QRVPlist::dictionary()
+          .set("ContainerClassesArray", QRVPlist::array({QRVPlist::uinteger(2), QRVPlist::uinteger(2)}))
+          .set("UUIDsArray", QRVPlist::array({uuidData(a->uuid()), uuidData(b->uuid())}))
+          .set("IdentifiersArray",
+               QRVPlist::array({QRVPlist::string("com.example.app"), QRVPlist::string("com.example.other")}))
+          .set("PersonaUniqueStringsArray", QRVPlist::array({QRVPlist::string("")}));
+  uint64_t result = 1;
+  QRVHandleStageContainerForDelete(request, nullptr, *client, &result);
+  EXPECT_EQ(result, 38u);
+  EXPECT_EQ(client->commandQueue().pendingCount(), 0u);
+  EXPECT_TRUE(fs::exists(a->url()));
+
+  // Equal lengths: one command, which removes both when the queue drains.
+  request.set("PersonaUniqueStringsArray", QRVPlist::array({QRVPlist::string(""), QRVPlist::string("")}));
+  result = 1;
+  QRVHandleStageContainerForDelete(request, nullptr, *client, &result);
+  EXPECT_EQ(result, 1u);
+  EXPECT_EQ(client->commandQueue().pendingCount(), 1u);
+  EXPECT_TRUE(client->completeWithError(&result));
+  EXPECT_FALSE(fs::exists(a->url()));
+  EXPECT_FALSE(fs::exists(b->url()));
+
+  // deleteContainer: a look-up, then the same staged deletion.
+  auto c = create(app);
+  QRVError error;
+  ASSERT_TRUE(client->deleteContainerWithContainerIdentity(app, false, &error)) << error.description();
+  EXPECT_TRUE(fs::exists(c->url()));
+  EXPECT_TRUE(client->completeWithError(&result));
+  EXPECT_FALSE(fs::exists(c->url()));
+  EXPECT_FALSE(client->deleteContainerWithContainerIdentity(app, false, &error));
+  EXPECT_EQ(error.code(), 21u);
+}
+
+TEST(ApplicationTerminationTest, AssertionHoldsUntilInvalidatedAndChecksTheReason) {
+  auto service = std::make_shared<QRVFakeApplicationTermination>();
+  {
+    QRVApplicationTerminationAssertion assertion(service, "com.example.app", 1);
+    EXPECT_TRUE(assertion.isHeld());
+    EXPECT_EQ(service->held, 1);
+    assertion.invalidate();
+    EXPECT_EQ(service->held, 0);
+  }
+  service->refuse = true;
+  EXPECT_FALSE(QRVApplicationTerminationAssertion(service, "com.example.app", 0).isHeld());
+  EXPECT_FALSE(QRVApplicationTerminationAssertion(nullptr, "com.example.app", -1).isHeld());
+
+  EXPECT_DEATH(QRVApplicationTerminationAssertion(service, "com.example.app", 7), "");
+  EXPECT_DEATH(
+      {
+        service->refuse = false;
+        QRVApplicationTerminationAssertion leaked(service, "com.example.app", 1);
+      },
+      "");
+}
+
+TEST(ApplicationTerminationTest, LinuxFreezesAndKillsTheScopeWhileHeld) {
+  QRVTemporaryDirectory slice;
+  const std::string scope = slice.path() + "/app-com.example.app.scope";
+  fs::create_directories(scope);
+  writeText(scope + "/cgroup.freeze", "0");
+  writeText(scope + "/cgroup.kill", "");
+
+  QRVLinuxApplicationTermination termination(slice.path());
+  QRVError error;
+  auto held = termination.terminate("com.example.app", "container change", &error);
+  ASSERT_NE(held, nullptr) << error.description();
+  EXPECT_EQ(readText(scope + "/cgroup.freeze"), "1");
+  EXPECT_EQ(readText(scope + "/cgroup.kill"), "1");
+  held.reset();
+  EXPECT_EQ(readText(scope + "/cgroup.freeze"), "0");
+
+  // No cgroup: nothing runs, nothing to stop.
+  EXPECT_NE(termination.terminate("com.example.absent", "container change", &error), nullptr);
+  EXPECT_FALSE(fs::exists(slice.path() + "/app-com.example.absent.scope"));
+  EXPECT_EQ(termination.terminate("../escape", "container change", &error), nullptr);
+}
+
+}  // namespace
