@@ -9,10 +9,9 @@
 #include "client/QRVClient.h"
 #include "integration/QRVDaemonProcess.h"
 #include "integration/QRVRunAs.h"
+#include "support/QRVRequests.h"
 
 namespace {
-
-QRVPlist request(uint64_t command) { return QRVPlist::dictionary().set("Command", QRVPlist::uinteger(command)); }
 
 std::string selfExecutable() {
   char buf[4096];
@@ -54,7 +53,7 @@ TEST_F(ClientIdentityIntegrationTest, MatchedByExecutableAndByUID) {
                                   .set("Executable", QRVPlist::string("/nonexistent/tool"))
                                   .set("Entitlements", QRVPlist::dictionary()));
   daemon_.start();
-  auto testCodeAs = [&](uid_t uid) { return QRVClient::resultCode(QRVRepliesAs(daemon_, uid, {request(25)})[0]); };
+  auto testCodeAs = [&](uid_t uid) { return QRVClient::resultCode(QRVRepliesAs(daemon_, uid, {QRVRequest(25)})[0]); };
   EXPECT_EQ(testCodeAs(3001), 1u);
   EXPECT_EQ(testCodeAs(3002), 55u);
   EXPECT_EQ(testCodeAs(3003), 55u);
@@ -76,7 +75,7 @@ TEST_F(ClientIdentityIntegrationTest, RestartedInstallerGetsAFreshIdentity) {
   daemon_.start();
   // One process asks three times, then a new process twice.
   for (size_t count : {3, 2})
-    for (const QRVPlist& reply : QRVRepliesAs(daemon_, 3010, std::vector<QRVPlist>(count, request(32))))
+    for (const QRVPlist& reply : QRVRepliesAs(daemon_, 3010, std::vector<QRVPlist>(count, QRVRequest(32))))
       EXPECT_EQ(QRVClient::resultCode(reply), 49u);
   std::vector<std::string> ids = loggedIdentities(daemon_.readLog(), "com.kelva.verdaned");
   ASSERT_EQ(ids.size(), 5u);

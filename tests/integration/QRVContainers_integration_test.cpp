@@ -6,39 +6,26 @@
 #include <filesystem>
 
 #include "client/QRVClient.h"
-#include "integration/QRVDaemonProcess.h"
 #include "integration/QRVRunAs.h"
+#include "support/QRVDaemonTest.h"
 
 namespace {
 
 constexpr uid_t kAppUID = 2101;        // "com.example.app", no entitlements
 constexpr uid_t kInstallerUID = 2102;  // "allowed"
 
-QRVPlist createRequest(const std::string& identifier, uint64_t containerClass, bool transient = false) {
-  return QRVPlist::dictionary()
-      .set("Command", QRVPlist::uinteger(0))
-      .set("Identifier", QRVPlist::string(identifier))
-      .set("ContainerClass", QRVPlist::uinteger(containerClass))
-      .set("CreateIfNecessary", QRVPlist::boolean(true))
-      .set("Transient", QRVPlist::boolean(transient));
-}
-
-class ContainersIntegrationTest : public testing::Test {
+class ContainersIntegrationTest : public QRVDaemonTest {
  protected:
   void SetUp() override {
-    if (geteuid() != 0) GTEST_SKIP() << "needs root: clients run under other uids";
-    daemon_.trustUID(kAppUID, "com.example.app", QRVPlist::dictionary());
-    daemon_.trustUID(kInstallerUID, "com.example.installer",
-                     QRVPlist::dictionary().set("com.kelva.private.Quorva.allowed", QRVPlist::boolean(true)));
-    daemon_.start();
+    startDaemon({{kAppUID, "com.example.app", QRVPlist::dictionary()},
+                 {kInstallerUID, "com.example.installer", QRVEntitlements({"allowed"})}});
   }
-  QRVDaemonProcess daemon_;
 };
 
 TEST_F(ContainersIntegrationTest, AnApplicationGetsItsOwnDataContainer) {
   auto r = QRVRepliesAs(daemon_, kAppUID,
-                        {createRequest("com.example.app", 2), createRequest("com.example.app", 2),
-                         createRequest("com.example.other", 2)});
+                        {QRVCreateRequest("com.example.app", 2), QRVCreateRequest("com.example.app", 2),
+                         QRVCreateRequest("com.example.other", 2)});
   ASSERT_EQ(QRVClient::resultCode(r[0]), 1u) << r[0].description();
   EXPECT_FALSE(r[0].boolForKey("ReplyExisted"));
   EXPECT_TRUE(r[1].boolForKey("ReplyExisted"));
@@ -62,8 +49,8 @@ TEST_F(ContainersIntegrationTest, InstallerCreatesListsAndLooksUpForOthers) {
   QRVPlist list =
       QRVPlist::dictionary().set("Command", QRVPlist::uinteger(1)).set("ContainerClass", QRVPlist::uinteger(1));
   auto r = QRVRepliesAs(daemon_, kInstallerUID,
-                        {createRequest("com.example.a", 1), createRequest("com.example.b", 1), list,
-                         createRequest("com.example.a", 2, true), createRequest("com.example.a", 2, true)});
+                        {QRVCreateRequest("com.example.a", 1), QRVCreateRequest("com.example.b", 1), list,
+                         QRVCreateRequest("com.example.a", 2, true), QRVCreateRequest("com.example.a", 2, true)});
   ASSERT_EQ(QRVClient::resultCode(r[0]), 1u) << r[0].description();
   EXPECT_EQ(QRVClient::resultCode(r[2]), 1u);
   EXPECT_EQ(r[2].arrayForKey("ReplyIdsArray").size(), 2u);  // two bundle containers

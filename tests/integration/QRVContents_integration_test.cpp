@@ -6,8 +6,8 @@
 #include <filesystem>
 
 #include "client/QRVClient.h"
-#include "integration/QRVDaemonProcess.h"
 #include "integration/QRVRunAs.h"
+#include "support/QRVDaemonTest.h"
 
 namespace fs = std::filesystem;
 
@@ -16,25 +16,16 @@ namespace {
 constexpr uid_t kInstallerUID = 2112;
 const char* const kInstaller = "com.example.installer";
 
-QRVPlist request(uint64_t command) { return QRVPlist::dictionary().set("Command", QRVPlist::uinteger(command)); }
-
-class ContentsIntegrationTest : public testing::Test {
+class ContentsIntegrationTest : public QRVDaemonTest {
  protected:
   void SetUp() override {
-    if (geteuid() != 0) GTEST_SKIP() << "needs root: clients run under other uids";
-    daemon_.trustUID(kInstallerUID, kInstaller,
-                     QRVPlist::dictionary()
-                         .set("com.kelva.private.Quorva.allowed", QRVPlist::boolean(true))
-                         .set("com.kelva.private.Quorva.userManagedAssets", QRVPlist::boolean(true))
-                         .set("com.kelva.private.Quorva.stageSharedContent", QRVPlist::boolean(true)));
-    daemon_.start();
+    startDaemon({{kInstallerUID, kInstaller, QRVEntitlements({"allowed", "userManagedAssets", "stageSharedContent"})}});
   }
-  QRVDaemonProcess daemon_;
 };
 
 TEST_F(ContentsIntegrationTest, TheContentsCommandsWorkAndRefuseBadInputWhileTheDaemonKeepsServing) {
   QRVPlist lookup =
-      request(0).set("Identifier", QRVPlist::string(kInstaller)).set("ContainerClass", QRVPlist::uinteger(2));
+      QRVRequest(0).set("Identifier", QRVPlist::string(kInstaller)).set("ContainerClass", QRVPlist::uinteger(2));
   QRVPlist created =
       QRVRepliesAs(daemon_, kInstallerUID, {QRVPlist(lookup).set("CreateIfNecessary", QRVPlist::boolean(true))})[0];
   ASSERT_EQ(QRVClient::resultCode(created), 1u) << created.description();
@@ -46,9 +37,9 @@ TEST_F(ContentsIntegrationTest, TheContentsCommandsWorkAndRefuseBadInputWhileThe
         .set("UUID", QRVPlist::data(created.dataForKey("ReplyUUID")));
   };
   auto key = [](const char* k) { return QRVPlist::string(k); };
-  QRVPlist assets = request(28).set("Identifier", key(kInstaller));
+  QRVPlist assets = QRVRequest(28).set("Identifier", key(kInstaller));
   auto source = [&](const char* path) {
-    return request(29).set("Identifier", key(kInstaller)).set("SourcePath", key(path));
+    return QRVRequest(29).set("Identifier", key(kInstaller)).set("SourcePath", key(path));
   };
   std::vector<QRVPlist> requests = {
       in(5).set("Key", key("k")).set("Value", key("v")),                    // 0
@@ -63,7 +54,7 @@ TEST_F(ContentsIntegrationTest, TheContentsCommandsWorkAndRefuseBadInputWhileThe
       source(".."),                                                         // 9
       source("../Documents"),                                               // 10
       source("/etc/passwd"),                                                // 11
-      request(26)                                                           // 12
+      QRVRequest(26)                                                           // 12
           .set("Identifier", key("systemgroup.com.example.shared"))
           .set("SourcePath", key("Library"))
           .set("DestPath", key("Library")),

@@ -19,6 +19,8 @@
 #include "integration/QRVDaemonProcess.h"
 #include "integration/QRVRunAs.h"
 #include "support/QRVEventually.h"
+#include "support/QRVFiles.h"
+#include "support/QRVRequests.h"
 
 namespace fs = std::filesystem;
 
@@ -33,17 +35,10 @@ constexpr const char* kUserStaging = "/private/var/mobile/Containers/Staging";
 constexpr const char* kCaches = "/private/var/root/Library/Caches/com.kelva.quorvad";
 constexpr const char* kReplaceDirectory = "/private/var/root/Library/Quorva/Replace";
 
-QRVPlist command(uint64_t number) { return QRVPlist::dictionary().set("Command", QRVPlist::uinteger(number)); }
-
-QRVPlist createRequest(const std::string& identifier, bool createIfNecessary = true, bool transient = false) {
-  return command(0)
-      .set("Identifier", QRVPlist::string(identifier))
-      .set("ContainerClass", QRVPlist::uinteger(2))
-      .set("CreateIfNecessary", QRVPlist::boolean(createIfNecessary))
-      .set("Transient", QRVPlist::boolean(transient));
+// The data container of `identifier`, looked up but never created.
+QRVPlist lookupRequest(const std::string& identifier) {
+  return QRVCreateRequest(identifier, 2, /*transient=*/false, /*createIfNecessary=*/false);
 }
-
-void writeText(const std::string& path, const std::string& text) { std::ofstream(path) << text; }
 
 bool isEmptyOrAbsent(const std::string& path) { return !fs::exists(path) || fs::is_empty(path); }
 
@@ -139,13 +134,13 @@ TEST(CrashIntegrationTest, AReplaceKilledAtAnyStepLeavesOneWholeContainer) {
       daemon.start();
       std::vector<QRVPlist> made = QRVRepliesAs(
           daemon, kInstallerUID,
-          {createRequest("com.example.r"), createRequest("com.example.r", true, true), createRequest("com.example.o")});
+          {QRVCreateRequest("com.example.r", 2), QRVCreateRequest("com.example.r", 2, /*transient=*/true), QRVCreateRequest("com.example.o", 2)});
       for (const QRVPlist& reply : made) ASSERT_EQ(QRVClient::resultCode(reply), 1u);
       const std::string oldPath = made[0].stringForKey("ReplyPath"), newPath = made[1].stringForKey("ReplyPath");
       const QRVPlist::Bytes oldUUID = made[0].dataForKey("ReplyUUID"), newUUID = made[1].dataForKey("ReplyUUID");
-      writeText(oldPath + "/old.txt", "old");
-      writeText(newPath + "/new.txt", "new");
-      writeText(made[2].stringForKey("ReplyPath") + "/other.txt", "other");
+      QRVWriteText(oldPath + "/old.txt", "old");
+      QRVWriteText(newPath + "/new.txt", "new");
+      QRVWriteText(made[2].stringForKey("ReplyPath") + "/other.txt", "other");
       daemon.stop();
       // The two containers of the swap, and in a wipe the transient tree:
       // a wipe stopped before its swap leaves the fresh transient container
@@ -157,10 +152,10 @@ TEST(CrashIntegrationTest, AReplaceKilledAtAnyStepLeavesOneWholeContainer) {
 
       startArmed(daemon, point);
       expectStoppedDeadBy(daemon,
-              wipe ? command(12)
+              wipe ? QRVRequest(12)
                           .set("Identifier", QRVPlist::string("com.example.r"))
                           .set("ContainerClass", QRVPlist::uinteger(2))
-                    : command(2)
+                    : QRVRequest(2)
                           .set("OldIdentifier", QRVPlist::string("com.example.r"))
                           .set("OldContainerClass", QRVPlist::uinteger(2))
                           .set("OldContainerUUID", QRVPlist::data(oldUUID))
@@ -169,7 +164,7 @@ TEST(CrashIntegrationTest, AReplaceKilledAtAnyStepLeavesOneWholeContainer) {
                           .set("NewContainerUUID", QRVPlist::data(newUUID)));
       restartAndExpectCleanedUp(daemon);
 
-      QRVPlist found = QRVRepliesAs(daemon, kInstallerUID, {createRequest("com.example.r", false)})[0];
+      QRVPlist found = QRVRepliesAs(daemon, kInstallerUID, {lookupRequest("com.example.r")})[0];
       ASSERT_EQ(QRVClient::resultCode(found), 1u);
       const std::string live = found.stringForKey("ReplyPath");
       const bool isOld = fs::exists(live + "/old.txt");
@@ -205,10 +200,10 @@ TEST(CrashIntegrationTest, ACreationKilledAtAnyStepLeavesAWholeContainerOrNone) 
     QRVDaemonProcess daemon;
     trustInstaller(daemon);
     startArmed(daemon, point);
-    expectStoppedDeadBy(daemon, createRequest("com.example.c"));
+    expectStoppedDeadBy(daemon, QRVCreateRequest("com.example.c", 2));
     restartAndExpectCleanedUp(daemon);
 
-    QRVPlist found = QRVRepliesAs(daemon, kInstallerUID, {createRequest("com.example.c", false)})[0];
+    QRVPlist found = QRVRepliesAs(daemon, kInstallerUID, {lookupRequest("com.example.c")})[0];
     size_t live = 0;
     for (const auto& entry : fs::directory_iterator(daemon.root() + kDataClassDirectory)) {
       live++;
@@ -235,9 +230,9 @@ TEST(CrashIntegrationTest, DeathRowEmptyingKilledHalfwayIsFinishedAtTheNextStart
   // passes no crash point; command 4 below does.
   startArmed(daemon, "deathrow.item-removed");
   std::vector<QRVPlist> made = QRVRepliesAs(
-      daemon, kInstallerUID, {createRequest("com.example.a"), createRequest("com.example.b"), createRequest("com.example.k")});
+      daemon, kInstallerUID, {QRVCreateRequest("com.example.a", 2), QRVCreateRequest("com.example.b", 2), QRVCreateRequest("com.example.k", 2)});
   for (const QRVPlist& reply : made) ASSERT_EQ(QRVClient::resultCode(reply), 1u);
-  writeText(made[2].stringForKey("ReplyPath") + "/kept.txt", "kept");
+  QRVWriteText(made[2].stringForKey("ReplyPath") + "/kept.txt", "kept");
   QRVPlist::Array classes, uuids, identifiers, personas;
   for (int i = 0; i < 2; i++) {
     classes.push_back(QRVPlist::uinteger(2));
@@ -246,7 +241,7 @@ TEST(CrashIntegrationTest, DeathRowEmptyingKilledHalfwayIsFinishedAtTheNextStart
     personas.push_back(QRVPlist::string(""));
   }
   QRVPlist staged = QRVRepliesAs(daemon, kInstallerUID,
-                                 {command(3)
+                                 {QRVRequest(3)
                                       .set("ContainerClassesArray", QRVPlist::array(classes))
                                       .set("UUIDsArray", QRVPlist::array(uuids))
                                       .set("IdentifiersArray", QRVPlist::array(identifiers))
@@ -256,14 +251,14 @@ TEST(CrashIntegrationTest, DeathRowEmptyingKilledHalfwayIsFinishedAtTheNextStart
   ASSERT_EQ(std::distance(fs::directory_iterator(deathRow), fs::directory_iterator()), 2);
   const Snapshot before = snapshotOf(daemon.root(), {});
 
-  expectStoppedDeadBy(daemon, command(4));
+  expectStoppedDeadBy(daemon, QRVRequest(4));
   EXPECT_EQ(std::distance(fs::directory_iterator(deathRow), fs::directory_iterator()), 1)
       << "the daemon should have stopped after the first item";
 
   restartAndExpectCleanedUp(daemon);
   std::vector<QRVPlist> found = QRVRepliesAs(
       daemon, kInstallerUID,
-      {createRequest("com.example.a", false), createRequest("com.example.b", false), createRequest("com.example.k", false)});
+      {lookupRequest("com.example.a"), lookupRequest("com.example.b"), lookupRequest("com.example.k")});
   EXPECT_EQ(QRVClient::resultCode(found[0]), 21u);
   EXPECT_EQ(QRVClient::resultCode(found[1]), 21u);
   EXPECT_EQ(QRVClient::resultCode(found[2]), 1u);
@@ -282,11 +277,11 @@ TEST(CrashIntegrationTest, HandWrittenJournalsOfEachStateAreRecoveredAtTheNextSt
     trustInstaller(daemon);
     daemon.start();
     std::vector<QRVPlist> made =
-        QRVRepliesAs(daemon, kInstallerUID, {createRequest("com.example.r"), createRequest("com.example.r", true, true)});
+        QRVRepliesAs(daemon, kInstallerUID, {QRVCreateRequest("com.example.r", 2), QRVCreateRequest("com.example.r", 2, /*transient=*/true)});
     for (const QRVPlist& reply : made) ASSERT_EQ(QRVClient::resultCode(reply), 1u);
     const std::string oldPath = made[0].stringForKey("ReplyPath"), newPath = made[1].stringForKey("ReplyPath");
-    writeText(oldPath + "/old.txt", "old");
-    writeText(newPath + "/new.txt", "new");
+    QRVWriteText(oldPath + "/old.txt", "old");
+    QRVWriteText(newPath + "/new.txt", "new");
     daemon.stop();
 
     const std::string root = daemon.root();
@@ -309,7 +304,7 @@ TEST(CrashIntegrationTest, HandWrittenJournalsOfEachStateAreRecoveredAtTheNextSt
     }
 
     restartAndExpectCleanedUp(daemon);
-    QRVPlist found = QRVRepliesAs(daemon, kInstallerUID, {createRequest("com.example.r", false)})[0];
+    QRVPlist found = QRVRepliesAs(daemon, kInstallerUID, {lookupRequest("com.example.r")})[0];
     ASSERT_EQ(QRVClient::resultCode(found), 1u);
     const std::string live = found.stringForKey("ReplyPath");
     EXPECT_TRUE(fs::exists(live + "/" + kMetadataFile));

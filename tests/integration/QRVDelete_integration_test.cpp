@@ -9,8 +9,9 @@
 #include <fstream>
 
 #include "client/QRVClient.h"
-#include "integration/QRVDaemonProcess.h"
 #include "integration/QRVRunAs.h"
+#include "support/QRVDaemonTest.h"
+#include "support/QRVFiles.h"
 
 namespace fs = std::filesystem;
 
@@ -19,24 +20,9 @@ namespace {
 constexpr uid_t kInstallerUID = 2102;  // "allowed": unrestricted
 constexpr uid_t kSettingsUID = 2103;   // "com.example.wiped", may wipe itself only
 
-QRVPlist command(uint64_t number) { return QRVPlist::dictionary().set("Command", QRVPlist::uinteger(number)); }
-QRVPlist createRequest(const std::string& identifier, uint64_t containerClass, bool transient = false) {
-  return command(0)
-      .set("Identifier", QRVPlist::string(identifier))
-      .set("ContainerClass", QRVPlist::uinteger(containerClass))
-      .set("CreateIfNecessary", QRVPlist::boolean(true))
-      .set("Transient", QRVPlist::boolean(transient));
-}
-
 uint64_t code(const QRVPlist& reply) { return QRVClient::resultCode(reply); }
 std::string path(const QRVPlist& reply) { return reply.stringForKey("ReplyPath"); }
 QRVPlist::Bytes uuid(const QRVPlist& reply) { return reply.dataForKey("ReplyUUID"); }
-
-void writeText(const std::string& path, const std::string& text) { std::ofstream(path) << text; }
-std::string readText(const std::string& path) {
-  std::ifstream in(path);
-  return std::string(std::istreambuf_iterator<char>(in), {});
-}
 
 // Sets the immutable flag as an application's root-owned helper could;
 // false where the file system does not support it.
@@ -51,34 +37,30 @@ bool setImmutable(const std::string& file) {
   return ok;
 }
 
-class DeleteIntegrationTest : public testing::Test {
+class DeleteIntegrationTest : public QRVDaemonTest {
  protected:
   void SetUp() override {
-    if (geteuid() != 0) GTEST_SKIP() << "needs root: clients run under other uids";
-    daemon_.trustUID(kInstallerUID, "com.example.installer",
-                     QRVPlist::dictionary().set("com.kelva.private.Quorva.allowed", QRVPlist::boolean(true)));
-    daemon_.trustUID(kSettingsUID, "com.example.wiped",
-                     QRVPlist::dictionary().set("com.kelva.private.Quorva.wipeContainer",
-                                                QRVPlist::array({QRVPlist::string("com.example.wiped")})));
-    daemon_.start();
+    startDaemon({{kInstallerUID, "com.example.installer", QRVEntitlements({"allowed"})},
+                 {kSettingsUID, "com.example.wiped",
+                  QRVPlist::dictionary().set("com.kelva.private.Quorva.wipeContainer",
+                                             QRVPlist::array({QRVPlist::string("com.example.wiped")}))}});
   }
-  QRVDaemonProcess daemon_;
 };
 
 }  // namespace
 
 TEST_F(DeleteIntegrationTest, WipeStageForDeleteAndDeleteContainer) {
   // The wiping client's own container: listed in its wipe right.
-  auto own = QRVRepliesAs(daemon_, kSettingsUID, {createRequest("com.example.wiped", 4)});
+  auto own = QRVRepliesAs(daemon_, kSettingsUID, {QRVCreateRequest("com.example.wiped", 4)});
   ASSERT_EQ(code(own[0]), 1u);
   const std::string wiped = path(own[0]);
-  writeText(wiped + "/Documents/secret.txt", "old");
+  QRVWriteText(wiped + "/Documents/secret.txt", "old");
 
   // It may wipe its listed identifier and nothing else.
   auto wipes =
       QRVRepliesAs(daemon_, kSettingsUID,
-           {command(11).set("Identifier", QRVPlist::string("com.example.wiped")),
-            command(11).set("Identifier", QRVPlist::string("com.example.a")), createRequest("com.example.wiped", 4)});
+           {QRVRequest(11).set("Identifier", QRVPlist::string("com.example.wiped")),
+            QRVRequest(11).set("Identifier", QRVPlist::string("com.example.a")), QRVCreateRequest("com.example.wiped", 4)});
   EXPECT_EQ(code(wipes[0]), 1u);
   EXPECT_EQ(code(wipes[1]), 55u);
   EXPECT_FALSE(fs::exists(wiped + "/Documents/secret.txt"));
@@ -86,7 +68,7 @@ TEST_F(DeleteIntegrationTest, WipeStageForDeleteAndDeleteContainer) {
   EXPECT_EQ(path(wipes[2]), wiped);
   EXPECT_EQ(uuid(wipes[2]), uuid(own[0]));
 
-  auto created = QRVRepliesAs(daemon_, kInstallerUID, {createRequest("com.example.a", 2), createRequest("com.example.b", 2)});
+  auto created = QRVRepliesAs(daemon_, kInstallerUID, {QRVCreateRequest("com.example.a", 2), QRVCreateRequest("com.example.b", 2)});
   ASSERT_EQ(code(created[0]), 1u);
   ASSERT_EQ(code(created[1]), 1u);
   const std::string a = path(created[0]), b = path(created[1]);
@@ -94,7 +76,7 @@ TEST_F(DeleteIntegrationTest, WipeStageForDeleteAndDeleteContainer) {
   // Stage for delete: arrays of unequal lengths stage nothing.
   auto stage = [&](size_t personas) {
     QRVPlist::Array p(personas, QRVPlist::string(""));
-    return command(3)
+    return QRVRequest(3)
         .set("ContainerClassesArray", QRVPlist::array({QRVPlist::uinteger(2)}))
         .set("UUIDsArray", QRVPlist::array({QRVPlist::data(uuid(created[0]))}))
         .set("IdentifiersArray", QRVPlist::array({QRVPlist::string("com.example.a")}))
@@ -103,7 +85,7 @@ TEST_F(DeleteIntegrationTest, WipeStageForDeleteAndDeleteContainer) {
   auto staged = QRVRepliesAs(
       daemon_, kInstallerUID,
       {stage(2),
-       command(10).set("Identifier", QRVPlist::string("com.example.b")).set("ContainerClass", QRVPlist::uinteger(2))});
+       QRVRequest(10).set("Identifier", QRVPlist::string("com.example.b")).set("ContainerClass", QRVPlist::uinteger(2))});
   EXPECT_EQ(code(staged[0]), 38u);
   EXPECT_TRUE(fs::exists(a));
   EXPECT_EQ(code(staged[1]), 1u);
@@ -111,31 +93,31 @@ TEST_F(DeleteIntegrationTest, WipeStageForDeleteAndDeleteContainer) {
 
   // A file the application made immutable does not keep its container
   // alive, and nothing outside the container goes with it.
-  writeText(a + "/Documents/stuck.txt", "stuck");
+  QRVWriteText(a + "/Documents/stuck.txt", "stuck");
   const bool immutable = setImmutable(a + "/Documents/stuck.txt");
   const std::string bystander = daemon_.root() + "/private/var/mobile/bystander.txt";
-  writeText(bystander, "still here");
+  QRVWriteText(bystander, "still here");
   fs::create_symlink(bystander, a + "/Documents/link-out");
 
-  staged = QRVRepliesAs(daemon_, kInstallerUID, {stage(1), command(4)});
+  staged = QRVRepliesAs(daemon_, kInstallerUID, {stage(1), QRVRequest(4)});
   EXPECT_EQ(code(staged[0]), 1u);
   EXPECT_FALSE(fs::exists(a));
   // Death row is empty once the reply to command 4 arrives.
   EXPECT_EQ(code(staged[1]), 1u);
   const std::string deathRow = daemon_.root() + "/private/var/root/Library/Caches/com.kelva.quorvad/Dead";
   EXPECT_TRUE(!fs::exists(deathRow) || fs::is_empty(deathRow)) << (immutable ? "with an immutable file" : "");
-  EXPECT_EQ(readText(bystander), "still here");
+  EXPECT_EQ(QRVReadText(bystander), "still here");
 }
 
 TEST_F(DeleteIntegrationTest, ReplaceSwapsInTheNewContainer) {
   auto made =
-      QRVRepliesAs(daemon_, kInstallerUID, {createRequest("com.example.r", 2), createRequest("com.example.r", 2, true)});
+      QRVRepliesAs(daemon_, kInstallerUID, {QRVCreateRequest("com.example.r", 2), QRVCreateRequest("com.example.r", 2, true)});
   ASSERT_EQ(code(made[0]), 1u);
   ASSERT_EQ(code(made[1]), 1u);
-  writeText(path(made[0]) + "/old.txt", "old");
-  writeText(path(made[1]) + "/new.txt", "new");
+  QRVWriteText(path(made[0]) + "/old.txt", "old");
+  QRVWriteText(path(made[1]) + "/new.txt", "new");
 
-  QRVPlist replace = command(2)
+  QRVPlist replace = QRVRequest(2)
                          .set("OldIdentifier", QRVPlist::string("com.example.r"))
                          .set("OldContainerClass", QRVPlist::uinteger(2))
                          .set("OldContainerUUID", QRVPlist::data(uuid(made[0])))
@@ -144,19 +126,19 @@ TEST_F(DeleteIntegrationTest, ReplaceSwapsInTheNewContainer) {
                          .set("NewContainerUUID", QRVPlist::data(uuid(made[1])));
   QRVPlist acrossClasses = replace;
   acrossClasses.set("NewContainerClass", QRVPlist::uinteger(4));
-  auto replies = QRVRepliesAs(daemon_, kInstallerUID, {acrossClasses, replace, createRequest("com.example.r", 2)});
+  auto replies = QRVRepliesAs(daemon_, kInstallerUID, {acrossClasses, replace, QRVCreateRequest("com.example.r", 2)});
   EXPECT_EQ(code(replies[0]), 23u);
   EXPECT_EQ(code(replies[1]), 1u);
   EXPECT_EQ(uuid(replies[2]), uuid(made[1]));
-  EXPECT_EQ(readText(path(replies[2]) + "/new.txt"), "new");
+  EXPECT_EQ(QRVReadText(path(replies[2]) + "/new.txt"), "new");
   EXPECT_FALSE(fs::exists(path(made[0])));
   EXPECT_TRUE(fs::is_empty(daemon_.root() + "/private/var/root/Library/Quorva/Replace"));
 
   // Command 12 empties it again, keeping its UUID and path.
   auto emptied = QRVRepliesAs(
       daemon_, kInstallerUID,
-      {command(12).set("Identifier", QRVPlist::string("com.example.r")).set("ContainerClass", QRVPlist::uinteger(2)),
-       createRequest("com.example.r", 2)});
+      {QRVRequest(12).set("Identifier", QRVPlist::string("com.example.r")).set("ContainerClass", QRVPlist::uinteger(2)),
+       QRVCreateRequest("com.example.r", 2)});
   EXPECT_EQ(code(emptied[0]), 1u);
   EXPECT_EQ(path(emptied[1]), path(replies[2]));
   EXPECT_EQ(uuid(emptied[1]), uuid(made[1]));

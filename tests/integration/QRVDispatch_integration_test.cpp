@@ -14,6 +14,7 @@
 #include "integration/QRVDaemonProcess.h"
 #include "integration/QRVRunAs.h"
 #include "support/QRVEventually.h"
+#include "support/QRVRequests.h"
 
 namespace {
 
@@ -21,8 +22,6 @@ constexpr uid_t kAllowedUID = 2001;   // "com.kelva.private.Quorva.allowed"
 constexpr uid_t kPlainUID = 2002;     // known, no entitlements
 constexpr uid_t kTesterUID = 2003;    // testability only
 constexpr uid_t kStrangerUID = 2004;  // not in the trust store
-
-QRVPlist request(uint64_t command) { return QRVPlist::dictionary().set("Command", QRVPlist::uinteger(command)); }
 
 // The result codes of the replies to `requests` sent from a process of `uid`.
 std::vector<uint64_t> codesAs(const QRVDaemonProcess& daemon, uid_t uid, const std::vector<QRVPlist>& requests) {
@@ -74,7 +73,7 @@ class DispatchIntegrationTest : public testing::Test {
 
 TEST_F(DispatchIntegrationTest, CommandsAreDispatchedByNumberAndGatedByTheCallersEntitlements) {
   RecordProperty("startup_ms", static_cast<int>(startup_.count()));
-  QRVPlist retry = request(25).set("NumRetryCrashes", QRVPlist::uinteger(0));
+  QRVPlist retry = QRVRequest(25).set("NumRetryCrashes", QRVPlist::uinteger(0));
   // Without "Command" the request is a create-or-lookup: the caller gets its
   // own container, and a request without an identifier is refused with 18.
   QRVPlist create = QRVPlist::dictionary()
@@ -83,8 +82,8 @@ TEST_F(DispatchIntegrationTest, CommandsAreDispatchedByNumberAndGatedByTheCaller
                         .set("CreateIfNecessary", QRVPlist::boolean(true));
   // Unknown numbers and the retired command are invalid for everybody,
   // entitled or not.
-  EXPECT_EQ(codesAs(daemon_, kAllowedUID, {request(32), request(27), retry}), Codes({49, 49, 55}));
-  EXPECT_EQ(codesAs(daemon_, kPlainUID, {request(27), request(32), retry, create, QRVPlist::dictionary()}),
+  EXPECT_EQ(codesAs(daemon_, kAllowedUID, {QRVRequest(32), QRVRequest(27), retry}), Codes({49, 49, 55}));
+  EXPECT_EQ(codesAs(daemon_, kPlainUID, {QRVRequest(27), QRVRequest(32), retry, create, QRVPlist::dictionary()}),
             Codes({49, 49, 55, 1, 18}));
   // A stranger has no identity at all; the open command 0 refuses it too.
   EXPECT_EQ(codesAs(daemon_, kStrangerUID, {retry, create}), Codes({55, 55}));
@@ -101,7 +100,7 @@ TEST_F(DispatchIntegrationTest, PipelinedRequestsAreAnsweredInOrder) {
   ASSERT_TRUE(client) << error.message;
   std::vector<uint64_t> ids;
   for (int i = 0; i < 200; i++) {
-    auto id = client->send(request(i % 2 ? 25 : 32), std::chrono::seconds(10), &error);
+    auto id = client->send(QRVRequest(i % 2 ? 25 : 32), std::chrono::seconds(10), &error);
     ASSERT_TRUE(id) << error.message;
     ids.push_back(*id);
   }
@@ -119,7 +118,7 @@ TEST_F(DispatchIntegrationTest, BadFramesCloseOnlyTheirOwnConnection) {
   auto good = QRVClient::connect(daemon_.root(), &error);
   ASSERT_TRUE(good) << error.message;
 
-  std::vector<uint8_t> dict = request(32).toBinary();
+  std::vector<uint8_t> dict = QRVRequest(32).toBinary();
   std::vector<uint8_t> array = QRVPlist::array({QRVPlist::uinteger(1)}).toBinary();
   const std::vector<std::pair<std::string, std::vector<uint8_t>>> bad = {
       {"oversized", frame(QRVWireFrame::kMaxBodySize + 1, 1, 1, {})},
@@ -140,7 +139,7 @@ TEST_F(DispatchIntegrationTest, BadFramesCloseOnlyTheirOwnConnection) {
   ASSERT_TRUE(gone && sendRaw(*gone, frame(static_cast<uint32_t>(dict.size()), 1, 1, dict)));
   gone.reset();
 
-  auto reply = good->sendRequest(request(32), std::chrono::seconds(5), &error);
+  auto reply = good->sendRequest(QRVRequest(32), std::chrono::seconds(5), &error);
   ASSERT_TRUE(reply) << error.message;
   EXPECT_EQ(QRVClient::resultCode(*reply), 49u);
   EXPECT_TRUE(daemon_.isRunning());
@@ -154,7 +153,7 @@ TEST_F(DispatchIntegrationTest, ClientThatNeverReadsIsCutOffWithoutSlowingOthers
   ASSERT_TRUE(slow) << error.message;
   int flags = fcntl(slow->fd(), F_GETFL);
   fcntl(slow->fd(), F_SETFL, flags | O_NONBLOCK);
-  std::vector<uint8_t> dict = request(32).toBinary();
+  std::vector<uint8_t> dict = QRVRequest(32).toBinary();
   std::vector<uint8_t> one = frame(static_cast<uint32_t>(dict.size()), 1, 1, dict);
   // Ask until the daemon stops taking requests (for 300 ms): its replies are
   // not being read, so it has stopped reading.
@@ -170,7 +169,7 @@ TEST_F(DispatchIntegrationTest, ClientThatNeverReadsIsCutOffWithoutSlowingOthers
   }
   EXPECT_GT(sent, 0u);
   // Everybody else is still served at once.
-  EXPECT_EQ(codesAs(daemon_, kPlainUID, {request(27)}), Codes({49}));
+  EXPECT_EQ(codesAs(daemon_, kPlainUID, {QRVRequest(27)}), Codes({49}));
   // After the stall timeout the slow client is closed.
   fcntl(slow->fd(), F_SETFL, flags);
   EXPECT_TRUE(daemon_.logEventuallyContains("client is not reading its replies", std::chrono::seconds(10)));
@@ -179,7 +178,7 @@ TEST_F(DispatchIntegrationTest, ClientThatNeverReadsIsCutOffWithoutSlowingOthers
 }
 
 TEST_F(DispatchIntegrationTest, RetryTestCrashesTheDaemonAsOftenAsAsked) {
-  QRVPlist retry = request(25).set("NumRetryCrashes", QRVPlist::uinteger(1));
+  QRVPlist retry = QRVRequest(25).set("NumRetryCrashes", QRVPlist::uinteger(1));
   // The first attempt takes the daemon down without a reply...
   EXPECT_EQ(codesAs(daemon_, kTesterUID, {retry}), Codes({0}));
   auto status = daemon_.waitForExit(std::chrono::seconds(10));

@@ -10,7 +10,7 @@
 
 #include "model/QRVContainerCache.h"
 #include "operations/QRVClientConnection.h"
-#include "support/QRVTestServices.h"
+#include "support/QRVContainerTest.h"
 
 namespace fs = std::filesystem;
 
@@ -24,14 +24,6 @@ class GrantsOneGroup : public QRVNoSystemGroupQueries {
   }
 };
 
-class KnowsOneName : public QRVNoWellKnownNames {
- public:
-  std::optional<std::string> wellknownSystemContainerForId(const std::string& id) override {
-    return id == "com.example.wellknown" ? std::optional<std::string>("com.example.wellknown") : std::nullopt;
-  }
-  bool systemContainerIdIsWellknown(const std::string& id) override { return id == "com.example.wellknown"; }
-};
-
 void writeFile(const std::string& path, size_t bytes) {
   std::ofstream out(path, std::ios::binary);
   std::string block(4096, 'x');
@@ -40,34 +32,10 @@ void writeFile(const std::string& path, size_t bytes) {
 
 QRVPlist key(const std::string& k) { return QRVPlist::string(k); }
 
-class ContentsTest : public testing::Test {
+class ContentsTest : public QRVContainerTest {
  protected:
-  void SetUp() override {
-    if (geteuid() != 0) GTEST_SKIP() << "needs root: containers are given to their owners";
-  }
-
-  std::shared_ptr<QRVClientConnection> connectionFor(const std::string& caller, bool entitled = true,
-                                                     bool powerful = false) {
-    auto user = env_.services->userIdentityCache->userIdentityForPersonalPersonaWithUID(501, 501);
-    auto identity = std::make_shared<const QRVClientIdentity>(caller, 501, 501, 42, user, QRVPlist::dictionary(), false,
-                                                              QRVAuditToken::make(501, 501, 42, 1));
-    return std::make_shared<QRVClientConnection>(identity, entitled, powerful, powerful, std::nullopt, std::nullopt,
-                                                 std::make_shared<QRVCommandQueue>(), env_.services);
-  }
-  std::shared_ptr<QRVClientConnection> admin() { return connectionFor("com.example.installer", true, true); }
-
-  QRVContainerIdentityRef identity(const std::string& id, QRVContainerClass c = QRVContainerClassAppData) {
-    QRVError error;
-    auto user = QRVUserIdentity::isUserIdentityRequiredForContainerClass(c)
-                    ? env_.services->userIdentityCache->userIdentityForPersonalPersonaWithUID(501, 501)
-                    : env_.services->userIdentityCache->defaultUserIdentity();
-    return QRVContainerIdentity::containerIdentityWithUserIdentity(user, id, c, &error);
-  }
-  QRVMetadataRef create(const QRVContainerIdentityRef& id) {
-    QRVError error;
-    auto m = admin()->createOrLookupContainerWithContainerIdentity(id, true, false, true, &error);
-    EXPECT_NE(m, nullptr) << error.description();
-    return m;
+  std::shared_ptr<QRVClientConnection> connectionFor(const std::string& caller, bool entitled = true) {
+    return QRVContainerTest::connectionFor(caller, {.entitled = entitled});
   }
   // The assets path as `by` (default the installer) asks for it; a failure
   // leaves its error in error_.
@@ -77,14 +45,6 @@ class ContentsTest : public testing::Test {
     return (by ? by : admin())
         ->userManagedAssetsPathWithContainerIdentity(id, relative, createIfNecessary, &existed_, &error_);
   }
-  // Forgets everything in memory, so that what follows sees only the disk.
-  void freshCache() {
-    env_.services->containerCache = std::make_shared<QRVContainerCache>(
-        env_.services->fileManager, env_.services->globalConfiguration, env_.services->userIdentityCache,
-        env_.services->platform.sandbox, nullptr, env_.services->wellKnownNames);
-  }
-
-  QRVTestServices env_;
   QRVError error_;
   bool existed_ = false;
 };
@@ -315,7 +275,7 @@ TEST_F(ContentsTest, NewDirectoryUUIDKeepsTheContainerReachable) {
   }
 
   // A directory not named by a UUID (a well-known name) keeps its name.
-  env_.services->wellKnownNames = std::make_shared<KnowsOneName>();
+  env_.services->wellKnownNames = std::make_shared<QRVTestKnowsOneName>();
   freshCache();
   auto wellKnown = identity("com.example.wellknown", QRVContainerClassSystemData);
   auto container = create(wellKnown);

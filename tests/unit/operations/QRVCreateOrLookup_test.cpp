@@ -9,7 +9,7 @@
 
 #include "model/QRVContainerCache.h"
 #include "operations/QRVClientConnection.h"
-#include "support/QRVTestServices.h"
+#include "support/QRVContainerTest.h"
 
 namespace fs = std::filesystem;
 
@@ -20,50 +20,13 @@ class SaysHasSystemContainer : public QRVNoCodeSigningQueries {
   bool identifierHasSystemContainer(const std::string& id) override { return id == "com.example.daemon"; }
 };
 
-class KnowsOneName : public QRVNoWellKnownNames {
- public:
-  std::optional<std::string> wellknownSystemContainerForId(const std::string& id) override {
-    return id == "com.example.wellknown" ? std::optional<std::string>("com.example.wellknown") : std::nullopt;
-  }
-  bool systemContainerIdIsWellknown(const std::string& id) override { return id == "com.example.wellknown"; }
-};
-
 class AsksForClassThree : public QRVNoDataProtectionQueries {
  public:
   uint32_t intendedDataProtectionClassBasedOnEntitlementsForIdentifier(const std::string&) override { return 3; }
 };
 
-struct Powers {
-  bool allowOtherIdLookup = false, unrestricted = false, groups = false;
-  std::optional<QRVPlist> lookup;
-};
-
-class CreateOrLookupTest : public testing::Test {
+class CreateOrLookupTest : public QRVContainerTest {
  protected:
-  void SetUp() override {
-    if (geteuid() != 0) GTEST_SKIP() << "needs root: containers are given to their owners";
-  }
-
-  std::shared_ptr<QRVClientConnection> connectionFor(const std::string& caller, Powers p = {}) {
-    auto user = env_.services->userIdentityCache->userIdentityForPersonalPersonaWithUID(501, 501);
-    auto identity = std::make_shared<const QRVClientIdentity>(caller, 501, 501, 42, user, QRVPlist::dictionary(), false,
-                                                              QRVAuditToken::make(501, 501, 42, 1));
-    auto c = std::make_shared<QRVClientConnection>(identity, true, p.allowOtherIdLookup, p.unrestricted, p.lookup,
-                                                   std::nullopt, std::make_shared<QRVCommandQueue>(), env_.services);
-    c->setAllowGroupIdLookup(p.groups);
-    return c;
-  }
-  std::shared_ptr<QRVClientConnection> admin() {
-    return connectionFor("com.example.installer", {true, true, false, std::nullopt});
-  }
-
-  QRVContainerIdentityRef identity(const std::string& id, QRVContainerClass c) {
-    QRVError error;
-    auto user = QRVUserIdentity::isUserIdentityRequiredForContainerClass(c)
-                    ? env_.services->userIdentityCache->userIdentityForPersonalPersonaWithUID(501, 501)
-                    : env_.services->userIdentityCache->defaultUserIdentity();
-    return QRVContainerIdentity::containerIdentityWithUserIdentity(user, id, c, &error);
-  }
   // Creates (or with `create` false only looks up) as `by`, or as the
   // installer; a failure leaves its error in error_.
   QRVMetadataRef get(const QRVContainerIdentityRef& id, bool create = true, bool transient = false,
@@ -71,15 +34,8 @@ class CreateOrLookupTest : public testing::Test {
     error_ = QRVError();
     return (by ? by : admin())->createOrLookupContainerWithContainerIdentity(id, create, transient, true, &error_);
   }
-  // Forgets everything in memory, so that what follows sees only the disk.
-  void freshCache() {
-    env_.services->containerCache = std::make_shared<QRVContainerCache>(
-        env_.services->fileManager, env_.services->globalConfiguration, env_.services->userIdentityCache,
-        env_.services->platform.sandbox, nullptr, env_.services->wellKnownNames);
-  }
-  std::string mobile(const std::string& rest) { return env_.root.path() + "/private/var/mobile/Containers/" + rest; }
+  std::string mobilePath(const std::string& rest) { return env_.root.path() + "/private/var/mobile/Containers/" + rest; }
 
-  QRVTestServices env_;
   QRVError error_;
 };
 
@@ -91,14 +47,14 @@ TEST_F(CreateOrLookupTest, CreatesInStagingMovesLiveAndFindsItAgain) {
   auto created = get(app);
   ASSERT_NE(created, nullptr) << error_.description();
   EXPECT_FALSE(created->existed());
-  EXPECT_EQ(created->url(), mobile("Data/Application/") + created->uuid().string());
+  EXPECT_EQ(created->url(), mobilePath("Data/Application/") + created->uuid().string());
   struct stat st;
   ASSERT_EQ(stat(created->url().c_str(), &st), 0);
   EXPECT_EQ(st.st_uid, 501u);
   for (const char* sub : {"Documents", "Library", "Library/Caches", "Library/Preferences", "SystemData", "tmp"})
     EXPECT_TRUE(fs::is_directory(created->url() + "/" + sub)) << sub;
   // Staging holds nothing once the container is live.
-  EXPECT_TRUE(fs::is_empty(mobile("Staging")));
+  EXPECT_TRUE(fs::is_empty(mobilePath("Staging")));
 
   auto again = get(app);
   ASSERT_NE(again, nullptr);
@@ -173,9 +129,9 @@ TEST_F(CreateOrLookupTest, AccessRules) {
   auto other = identity("com.example.other", QRVContainerClassAppData);
   auto group = identity("group.example", QRVContainerClassAppGroup);
   auto me = connectionFor("com.example.me");
-  auto groups = connectionFor("com.example.me", {false, false, true, std::nullopt});
+  auto groups = connectionFor("com.example.me", {.groups = true});
   QRVPlist lookup = QRVPlist::dictionary().set("appData", QRVPlist::array({QRVPlist::string("com.example.other")}));
-  auto looker = connectionFor("com.example.looker", {false, false, false, lookup});
+  auto looker = connectionFor("com.example.looker", {.lookup = lookup});
 
   struct Case {
     std::shared_ptr<QRVClientConnection> by;
@@ -204,7 +160,7 @@ TEST_F(CreateOrLookupTest, AccessRules) {
 }
 
 TEST_F(CreateOrLookupTest, SystemContainersAndWellKnownNames) {
-  env_.services->wellKnownNames = std::make_shared<KnowsOneName>();
+  env_.services->wellKnownNames = std::make_shared<QRVTestKnowsOneName>();
   freshCache();
   auto wellKnown = identity("com.example.wellknown", QRVContainerClassSystemData);
   auto known = get(wellKnown);
@@ -229,7 +185,7 @@ TEST_F(CreateOrLookupTest, SystemContainersAndWellKnownNames) {
 
 TEST_F(CreateOrLookupTest, FailuresLeaveNothingLive) {
   // The class directory cannot exist: a file stands in its way.
-  const std::string parent = mobile("Data/Application"), staging = mobile("Staging");
+  const std::string parent = mobilePath("Data/Application"), staging = mobilePath("Staging");
   fs::create_directories(fs::path(parent).parent_path());
   std::ofstream(parent) << "in the way";
   auto app = identity("com.example.app", QRVContainerClassAppData);

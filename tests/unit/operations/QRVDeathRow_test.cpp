@@ -4,7 +4,9 @@
 #include <fstream>
 #include <future>
 
+#include "core/QRVCommandStageForDelete.h"
 #include "operations/QRVClientConnection.h"
+#include "support/QRVContainerTest.h"
 #include "support/QRVEventually.h"
 #include "support/QRVTestServices.h"
 
@@ -110,6 +112,63 @@ TEST_F(DeathRowTest, StartUpCleanupEmptiesEveryStagingDirectory) {
   EXPECT_TRUE(fs::is_empty(perUser));
   // And what went to death row is deleted in the background.
   EXPECT_TRUE(QRVEventually([&] { return itemsOnDeathRow() == 0; }));
+}
+
+// Deletion staged by a request: containers leave the cache and go to death
+// row through a command queue, as the delete commands run it.
+class StageForDeleteTest : public QRVContainerTest {
+ protected:
+  bool run(std::vector<QRVContainerIdentityRef> ids, uint64_t* result, uint64_t* reported = nullptr) {
+    QRVCommandQueue queue;
+    queue.insertCommand(QRVCommandStageForDelete::commandForStageForDeleteWithContainerIdentities(
+        std::move(ids), /*useLocking=*/true, [reported](uint64_t code) { if (reported) *reported = code; },
+        env_.services));
+    return queue.executeAllUntilExhaustedOrError(result);
+  }
+};
+
+TEST_F(StageForDeleteTest, ContainersGoToDeathRowAndLeaveTheCache) {
+  auto a = create(identity("com.example.a")), b = create(identity("com.example.b"));
+  auto t = create(identity("com.example.t"), /*transient=*/true);
+  ASSERT_TRUE(a && b && t);
+  QRVError error;
+  auto unknown = QRVContainerIdentity::containerIdentityWithUserIdentity(
+      env_.services->userIdentityCache->defaultUserIdentity(), "com.example.none", 2, &error);
+  uint64_t result = 1;
+  EXPECT_TRUE(run({a->containerIdentity(), unknown, b->containerIdentity(), t->containerIdentity()}, &result));
+  EXPECT_EQ(result, 1u);
+  std::string deathRow = env_.services->globalConfiguration->deathrowDirectory();
+  for (const auto& m : {a, b, t}) {
+    EXPECT_FALSE(fs::exists(m->url()));
+    EXPECT_TRUE(fs::exists(deathRow + "/" + m->uuid().string() + "/Documents"));
+    EXPECT_FALSE(known(m));
+  }
+  // The launcher's mapping of a removed container is withdrawn.
+  bool withdrawn = false;
+  for (const auto& item : env_.sandbox->userStateItems)
+    if (item.identifier == "com.example.a" && !item.path) withdrawn = true;
+  EXPECT_TRUE(withdrawn);
+}
+
+TEST_F(StageForDeleteTest, MoveFailureDeletesInPlaceAndDoubleFailureIs28) {
+  auto a = create(identity("com.example.a")), b = create(identity("com.example.b"));
+  ASSERT_TRUE(a && b);
+  // Something already lies on death row under a's name: the rename fails,
+  // and the container is deleted where it is.
+  std::string deathRow = env_.services->globalConfiguration->deathrowDirectory();
+  fs::create_directories(deathRow + "/" + a->uuid().string() + "/occupied");
+  uint64_t result = 1;
+  EXPECT_TRUE(run({a->containerIdentity()}, &result));
+  EXPECT_FALSE(fs::exists(a->url()));
+  EXPECT_FALSE(known(a));
+
+  fs::create_directories(deathRow + "/" + b->uuid().string() + "/occupied");
+  env_.fileSystem->failNext(QRVFakeFileSystemExtras::Operation::kRemoveTree, EBUSY);
+  uint64_t reported = 0;
+  EXPECT_FALSE(run({b->containerIdentity()}, &result, &reported));
+  EXPECT_EQ(result, 28u);
+  EXPECT_EQ(reported, 28u);
+  EXPECT_TRUE(known(b));
 }
 
 }  // namespace

@@ -11,62 +11,24 @@
 #include "operations/QRVApplicationTerminationAssertion.h"
 #include "operations/QRVClientConnection.h"
 #include "platform/linux/QRVLinuxApplicationTermination.h"
-#include "support/QRVTestServices.h"
+#include "support/QRVContainerTest.h"
 
 namespace fs = std::filesystem;
 
 namespace {
 
-void writeText(const std::string& path, const std::string& text) { std::ofstream(path) << text; }
-std::string readText(const std::string& path) {
-  std::ifstream in(path);
-  return std::string(std::istreambuf_iterator<char>(in), {});
-}
-size_t entriesIn(const std::string& dir) {
-  std::error_code ec;
-  if (!fs::exists(dir, ec)) return 0;
-  return std::distance(fs::directory_iterator(dir), fs::directory_iterator());
-}
-
-class ReplaceTest : public testing::Test {
+class ReplaceTest : public QRVContainerTest {
  protected:
-  void SetUp() override {
-    if (geteuid() != 0) GTEST_SKIP() << "needs root: containers are given to their owners";
-  }
-
   std::shared_ptr<QRVClientConnection> connection(const std::string& caller, bool unrestricted,
                                                   std::optional<QRVPlist::Array> wipe = std::nullopt) {
-    auto identity = std::make_shared<const QRVClientIdentity>(caller, 501, 501, 42, mobile(), QRVPlist::dictionary(),
-                                                              false, QRVAuditToken::make(501, 501, 42, 1));
-    return std::make_shared<QRVClientConnection>(identity, true, unrestricted, unrestricted, std::nullopt, wipe,
-                                                 std::make_shared<QRVCommandQueue>(), env_.services);
-  }
-  std::shared_ptr<QRVClientConnection> admin() { return connection("com.example.installer", true); }
-
-  QRVUserIdentityRef mobile() {
-    return env_.services->userIdentityCache->userIdentityForPersonalPersonaWithUID(501, 501);
-  }
-  QRVContainerIdentityRef identity(const std::string& id, QRVContainerClass c = QRVContainerClassAppData,
-                                   QRVUserIdentityRef user = nullptr) {
-    QRVError error;
-    return QRVContainerIdentity::containerIdentityWithUserIdentity(user ? user : mobile(), id, c, &error);
-  }
-  QRVMetadataRef create(const QRVContainerIdentityRef& id, bool transient = false) {
-    QRVError error;
-    auto m = admin()->createOrLookupContainerWithContainerIdentity(id, true, transient, true, &error);
-    EXPECT_NE(m, nullptr) << error.description();
-    return m;
-  }
-  QRVMetadataRef lookup(const QRVContainerIdentityRef& id, QRVError* error) {
-    return admin()->createOrLookupContainerWithContainerIdentity(id, false, false, true, error);
+    return connectionFor(caller, {.allowOtherIdLookup = unrestricted, .unrestricted = unrestricted, .wipe = wipe});
   }
   uint64_t replaceCode(const QRVContainerIdentityRef& o, const QRVContainerIdentityRef& n, bool preserve = false) {
     QRVError error;
-    return admin()->replaceContainerIdentity(o, n, preserve, false, &error) ? 1 : error.code();
+    bool replaced = admin()->replaceContainerIdentity(o, n, preserve, /*startDeletionThread=*/false, &error);
+    return replaced ? 1 : error.code();
   }
   std::string replaceDir() { return env_.services->globalConfiguration->replaceDirectory(); }
-
-  QRVTestServices env_;
 };
 
 TEST_F(ReplaceTest, ReplacePutsNewContentInPlaceAndLeavesNoJournal) {
@@ -74,19 +36,19 @@ TEST_F(ReplaceTest, ReplacePutsNewContentInPlaceAndLeavesNoJournal) {
     SCOPED_TRACE(preserve ? "preserving the old UUID" : "taking the new UUID");
     auto app = identity(preserve ? "com.example.kept" : "com.example.app");
     auto old = create(app);
-    writeText(old->url() + "/old.txt", "old");
+    QRVWriteText(old->url() + "/old.txt", "old");
     auto fresh = create(app, true);
-    writeText(fresh->url() + "/new.txt", "new");
+    QRVWriteText(fresh->url() + "/new.txt", "new");
 
     ASSERT_EQ(replaceCode(old->containerIdentity(), fresh->containerIdentity(), preserve), 1u);
     // Kept, the old UUID keeps the old path; else the new UUID names it.
     const QRVUUID uuid = preserve ? old->uuid() : fresh->uuid();
     const std::string dest = fs::path(old->url()).parent_path().string() + "/" + uuid.string();
-    EXPECT_EQ(readText(dest + "/new.txt"), "new");
+    EXPECT_EQ(QRVReadText(dest + "/new.txt"), "new");
     EXPECT_FALSE(fs::exists(dest + "/old.txt"));
     EXPECT_EQ(fs::exists(old->url()), preserve);
     EXPECT_FALSE(fs::exists(fresh->url()));
-    EXPECT_EQ(entriesIn(replaceDir()), 0u);
+    EXPECT_EQ(QRVEntriesIn(replaceDir()), 0u);
 
     QRVError error;
     auto onDisk = QRVMetadata::readAndValidateMetadataAtUrl(dest, mobile(), true, *env_.services->fileManager,
@@ -99,13 +61,13 @@ TEST_F(ReplaceTest, ReplacePutsNewContentInPlaceAndLeavesNoJournal) {
     EXPECT_EQ(found->url(), dest);
   }
   // The old directories went to death row, not away.
-  EXPECT_GE(entriesIn(env_.services->globalConfiguration->deathrowDirectory()), 2u);
+  EXPECT_GE(QRVEntriesIn(env_.services->globalConfiguration->deathrowDirectory()), 2u);
 }
 
 TEST_F(ReplaceTest, EachCheckAnswersItsCodeAndMovesNothing) {
   auto a = create(identity("com.example.app")), b = create(identity("com.example.other"));
   auto p = create(identity("com.example.plugin", QRVContainerClassPluginData));
-  writeText(a->url() + "/keep.txt", "a");
+  QRVWriteText(a->url() + "/keep.txt", "a");
 
   QRVError error;
   auto elsewhere = QRVConcreteContainerIdentity::containerIdentityWithUUID(
@@ -125,9 +87,9 @@ TEST_F(ReplaceTest, EachCheckAnswersItsCodeAndMovesNothing) {
   // A live new container already sits at its own destination.
   EXPECT_EQ(replaceCode(a->containerIdentity(), b->containerIdentity()), 27u);
 
-  EXPECT_EQ(readText(a->url() + "/keep.txt"), "a");
+  EXPECT_EQ(QRVReadText(a->url() + "/keep.txt"), "a");
   EXPECT_TRUE(fs::exists(b->url()));
-  EXPECT_EQ(entriesIn(replaceDir()), 0u);
+  EXPECT_EQ(QRVEntriesIn(replaceDir()), 0u);
 }
 
 class RecoveryTest : public ReplaceTest {
@@ -150,12 +112,12 @@ class RecoveryTest : public ReplaceTest {
   }
   void marked(const std::string& dir, const std::string& mark) {
     fs::create_directories(dir);
-    writeText(dir + "/mark", mark);
+    QRVWriteText(dir + "/mark", mark);
   }
   void recover() {
     QRVError error;
     ASSERT_TRUE(admin()->_recoverFromReplaceOperationsWithError(&error)) << error.description();
-    EXPECT_EQ(entriesIn(replaceDir()), 0u);
+    EXPECT_EQ(QRVEntriesIn(replaceDir()), 0u);
   }
 
   std::string oldURL_, staging_, dest_, newURL_;
@@ -167,15 +129,15 @@ TEST_F(RecoveryTest, EachOfTheFourStatesEndsWithOneContainerInPlace) {
   marked(newURL_, "new");
   writeJournal();
   recover();
-  EXPECT_EQ(readText(oldURL_ + "/mark"), "old");
-  EXPECT_EQ(readText(newURL_ + "/mark"), "new");
+  EXPECT_EQ(QRVReadText(oldURL_ + "/mark"), "old");
+  EXPECT_EQ(QRVReadText(newURL_ + "/mark"), "new");
   EXPECT_FALSE(fs::exists(staging_));
 
   // Old parked in staging: it is put back.
   fs::rename(oldURL_, staging_);
   writeJournal();
   recover();
-  EXPECT_EQ(readText(oldURL_ + "/mark"), "old");
+  EXPECT_EQ(QRVReadText(oldURL_ + "/mark"), "old");
   EXPECT_FALSE(fs::exists(staging_));
 
   // New at the destination: nothing moves; staging is left for cleanup.
@@ -183,8 +145,8 @@ TEST_F(RecoveryTest, EachOfTheFourStatesEndsWithOneContainerInPlace) {
   fs::rename(newURL_, dest_);
   writeJournal();
   recover();
-  EXPECT_EQ(readText(dest_ + "/mark"), "new");
-  EXPECT_EQ(readText(staging_ + "/mark"), "old");
+  EXPECT_EQ(QRVReadText(dest_ + "/mark"), "new");
+  EXPECT_EQ(QRVReadText(staging_ + "/mark"), "old");
   EXPECT_FALSE(fs::exists(oldURL_));
 }
 
@@ -192,8 +154,8 @@ TEST_F(RecoveryTest, BootSetUpRunsTheRecoveryAndNoReplaceDirectoryIsNothingToDo)
   marked(staging_, "old");
   writeJournal();
   admin()->quorvaSetup();
-  EXPECT_EQ(readText(oldURL_ + "/mark"), "old");
-  EXPECT_EQ(entriesIn(replaceDir()), 0u);
+  EXPECT_EQ(QRVReadText(oldURL_ + "/mark"), "old");
+  EXPECT_EQ(QRVEntriesIn(replaceDir()), 0u);
 
   fs::remove_all(replaceDir());
   QRVError error;
@@ -202,7 +164,7 @@ TEST_F(RecoveryTest, BootSetUpRunsTheRecoveryAndNoReplaceDirectoryIsNothingToDo)
 
 TEST_F(RecoveryTest, UnreadableOrIncompleteJournalsAreDiscardedWithoutAMove) {
   marked(staging_, "old");
-  writeText(replaceDir() + "/garbage.plist", "this is not a property list");
+  QRVWriteText(replaceDir() + "/garbage.plist", "this is not a property list");
   QRVPlist partial = QRVPlist::dictionary()
                          .set("QRVReplaceOperationOldURL", QRVPlist::string(oldURL_))
                          .set("QRVReplaceOperationStagingURL", QRVPlist::string(staging_))
@@ -220,16 +182,16 @@ TEST_F(RecoveryTest, UnreadableOrIncompleteJournalsAreDiscardedWithoutAMove) {
 
   recover();
   EXPECT_FALSE(fs::exists(oldURL_));
-  EXPECT_EQ(readText(staging_ + "/mark"), "old");
+  EXPECT_EQ(QRVReadText(staging_ + "/mark"), "old");
 }
 
 TEST_F(ReplaceTest, WipeKeepsUUIDAndPathAndLeavesOnlyTheDefaultStructure) {
   auto app = identity("com.example.app");
   auto old = create(app);
-  writeText(old->url() + "/old.txt", "old");
+  QRVWriteText(old->url() + "/old.txt", "old");
   auto subdirectories = env_.fileSystem->defaultSubdirectories(QRVContainerClassAppData);
   ASSERT_FALSE(subdirectories.empty());
-  writeText(old->url() + "/" + subdirectories.front() + "/deep.txt", "old");
+  QRVWriteText(old->url() + "/" + subdirectories.front() + "/deep.txt", "old");
 
   // Refused outside the caller's list, without a list, and for other classes.
   QRVError error;
@@ -242,7 +204,7 @@ TEST_F(ReplaceTest, WipeKeepsUUIDAndPathAndLeavesOnlyTheDefaultStructure) {
       identity("com.example.app", QRVContainerClassAppBundle, env_.services->userIdentityCache->defaultUserIdentity()),
       &error));
   EXPECT_EQ(error.code(), 11u);
-  EXPECT_EQ(readText(old->url() + "/old.txt"), "old");
+  EXPECT_EQ(QRVReadText(old->url() + "/old.txt"), "old");
 
   auto client = connection("com.example.settings", false, QRVPlist::Array{QRVPlist::string("com.example.app")});
   ASSERT_TRUE(client->deleteDataContainerContentWithContainerIdentity(app, &error)) << error.description();
@@ -260,7 +222,7 @@ TEST_F(ReplaceTest, WipeKeepsUUIDAndPathAndLeavesOnlyTheDefaultStructure) {
       EXPECT_NE(std::find(subdirectories.begin(), subdirectories.end(), relative), subdirectories.end()) << relative;
     }
   }
-  EXPECT_EQ(entriesIn(replaceDir()), 0u);
+  EXPECT_EQ(QRVEntriesIn(replaceDir()), 0u);
 }
 
 TEST_F(ReplaceTest, DeleteCommandsStageThroughTheQueue) {
@@ -330,17 +292,17 @@ TEST(ApplicationTerminationTest, LinuxFreezesAndKillsTheScopeWhileHeld) {
   QRVTemporaryDirectory slice;
   const std::string scope = slice.path() + "/app-com.example.app.scope";
   fs::create_directories(scope);
-  writeText(scope + "/cgroup.freeze", "0");
-  writeText(scope + "/cgroup.kill", "");
+  QRVWriteText(scope + "/cgroup.freeze", "0");
+  QRVWriteText(scope + "/cgroup.kill", "");
 
   QRVLinuxApplicationTermination termination(slice.path());
   QRVError error;
   auto held = termination.terminate("com.example.app", "container change", &error);
   ASSERT_NE(held, nullptr) << error.description();
-  EXPECT_EQ(readText(scope + "/cgroup.freeze"), "1");
-  EXPECT_EQ(readText(scope + "/cgroup.kill"), "1");
+  EXPECT_EQ(QRVReadText(scope + "/cgroup.freeze"), "1");
+  EXPECT_EQ(QRVReadText(scope + "/cgroup.kill"), "1");
   held.reset();
-  EXPECT_EQ(readText(scope + "/cgroup.freeze"), "0");
+  EXPECT_EQ(QRVReadText(scope + "/cgroup.freeze"), "0");
 
   // No cgroup: nothing runs, nothing to stop.
   EXPECT_NE(termination.terminate("com.example.absent", "container change", &error), nullptr);

@@ -1,0 +1,96 @@
+// The fixture of tests that drive container operations directly: daemon
+// services on a temporary root, callers with chosen powers, identities of the
+// mobile user and containers made as the installer makes them.
+#pragma once
+
+#include <gtest/gtest.h>
+#include <unistd.h>
+
+#include <memory>
+#include <optional>
+#include <string>
+
+#include "model/QRVContainerCache.h"
+#include "operations/QRVClientConnection.h"
+#include "support/QRVFiles.h"
+#include "support/QRVTestServices.h"
+
+// What a test caller may do, as the dispatcher would have worked it out from
+// its entitlements.
+struct QRVTestCallerPowers {
+  bool entitled = true;
+  bool allowOtherIdLookup = false;
+  bool unrestricted = false;
+  bool groups = false;
+  std::optional<QRVPlist> lookup;
+  std::optional<QRVPlist::Array> wipe;
+};
+
+// A well-known system container named "com.example.wellknown".
+class QRVTestKnowsOneName : public QRVNoWellKnownNames {
+ public:
+  std::optional<std::string> wellknownSystemContainerForId(const std::string& id) override {
+    return systemContainerIdIsWellknown(id) ? std::optional<std::string>(id) : std::nullopt;
+  }
+  bool systemContainerIdIsWellknown(const std::string& id) override { return id == "com.example.wellknown"; }
+};
+
+class QRVContainerTest : public testing::Test {
+ protected:
+  void SetUp() override {
+    if (geteuid() != 0) GTEST_SKIP() << "needs root: containers are given to their owners";
+  }
+
+  QRVUserIdentityRef mobile() {
+    return env_.services->userIdentityCache->userIdentityForPersonalPersonaWithUID(501, 501);
+  }
+  // A connection of `caller` (pid 42, running as the mobile user).
+  std::shared_ptr<QRVClientConnection> connectionFor(const std::string& caller, QRVTestCallerPowers p = {}) {
+    auto identity = std::make_shared<const QRVClientIdentity>(caller, 501, 501, 42, mobile(), QRVPlist::dictionary(),
+                                                              false, QRVAuditToken::make(501, 501, 42, 1));
+    auto c = std::make_shared<QRVClientConnection>(identity, p.entitled, p.allowOtherIdLookup, p.unrestricted, p.lookup,
+                                                   p.wipe, std::make_shared<QRVCommandQueue>(), env_.services);
+    c->setAllowGroupIdLookup(p.groups);
+    return c;
+  }
+  // The installer: may do anything to any container.
+  std::shared_ptr<QRVClientConnection> admin() {
+    return connectionFor("com.example.installer", {.allowOtherIdLookup = true, .unrestricted = true});
+  }
+
+  // The identity of `id` in class `c`, of `user` or else of the mobile user
+  // where the class belongs to a user and of the default user otherwise.
+  QRVContainerIdentityRef identity(const std::string& id, QRVContainerClass c = QRVContainerClassAppData,
+                                   QRVUserIdentityRef user = nullptr) {
+    QRVError error;
+    if (!user)
+      user = QRVUserIdentity::isUserIdentityRequiredForContainerClass(c)
+                 ? mobile()
+                 : env_.services->userIdentityCache->defaultUserIdentity();
+    return QRVContainerIdentity::containerIdentityWithUserIdentity(user, id, c, &error);
+  }
+  QRVMetadataRef create(const QRVContainerIdentityRef& id, bool transient = false) {
+    QRVError error;
+    auto m = admin()->createOrLookupContainerWithContainerIdentity(id, /*createIfNecessary=*/true, transient,
+                                                                   /*useLocking=*/true, &error);
+    EXPECT_NE(m, nullptr) << error.description();
+    return m;
+  }
+  QRVMetadataRef lookup(const QRVContainerIdentityRef& id, QRVError* error) {
+    return admin()->createOrLookupContainerWithContainerIdentity(id, /*createIfNecessary=*/false,
+                                                                 /*transient=*/false, /*useLocking=*/true, error);
+  }
+  // Whether the cache holds the container (without reading the disk).
+  bool known(const QRVMetadataRef& m) {
+    return env_.services->containerCache->containerForContainerIdentity(*m->containerIdentity(), m->transient(),
+                                                                        /*updateSandbox=*/false, nullptr) != nullptr;
+  }
+  // Forgets everything in memory, so that what follows sees only the disk.
+  void freshCache() {
+    env_.services->containerCache = std::make_shared<QRVContainerCache>(
+        env_.services->fileManager, env_.services->globalConfiguration, env_.services->userIdentityCache,
+        env_.services->platform.sandbox, nullptr, env_.services->wellKnownNames);
+  }
+
+  QRVTestServices env_;
+};
