@@ -79,12 +79,6 @@ class QRVClientConnection {
 
   // Whether the caller's lookup entitlement lists `identifier` for the class.
   bool isEntitledForLookupWithClass(QRVContainerClass containerClass, const std::string& identifier);
-  // The identifiers the lookup entitlement grants for a class (memoised).
-  const std::set<std::string>* _lookupForContainerClass(QRVContainerClass containerClass);
-  bool _createTopLevelContainerDirectory(const std::string& url, QRVContainerClass containerClass, uid_t owner,
-                                         QRVError* error);
-  bool _createSubDirectories(const std::string& url, const QRVMetadata& metadata, QRVError* error);
-  uint32_t _dataProtectionClassForContainerMetadata(const QRVMetadata& metadata);
 
   // ---- Death row ----
   // Removed containers are first renamed into a unique directory under the
@@ -92,16 +86,9 @@ class QRVClientConnection {
   // background. Both steps survive a crash: whatever is on death row stays
   // there until the next emptying.
 
-  // Moves `url` into a fresh directory on death row under its own name. A
-  // missing item is success. Fails with 41. With `startDeletionThread` the
-  // emptying of death row is started.
-  bool _moveItemAtURLToDeathRow(const std::string& url, bool isDir, bool startDeletionThread, QRVError* error);
   // Empties death row on the death-row queue, inside a keep-alive
   // transaction, then calls `completion` (may be empty) there.
   void deleteContainersOnDeathRowWithCompletion(std::function<void()> completion);
-  // Removes `url` recursively; what cannot be removed is moved to "/tmp"
-  // (under the root) instead, failing with 4 when even that fails.
-  bool _removeItemOrMoveToTempAtURL(const std::string& url, QRVError* error);
 
   // ---- Delete, replace and wipe ----
   // A replace swaps directories by renames only, and a small journal (the
@@ -122,14 +109,6 @@ class QRVClientConnection {
   bool replaceContainerIdentity(const QRVContainerIdentityRef& oldIdentity,
                                 const QRVContainerIdentityRef& newIdentity, bool preserveOldUUID,
                                 bool startDeletionThread, QRVError* error);
-  // The journal's four directories (old, new, staging, destination) as a
-  // dictionary of absolute paths; 35 when unreadable or incomplete.
-  std::optional<QRVPlist> _readAndValidateReplaceFileAtUrl(const std::string& url, QRVError* error);
-  // 33 when a path is empty, 34 when the write fails.
-  bool _writeToDiskReplaceAt(const std::string& url, const std::string& oldURL, const std::string& newURL,
-                             const std::string& stagingURL, const std::string& destinationURL, QRVError* error);
-  // Finishes or rolls back every replace left in the replace directory.
-  bool _recoverFromReplaceOperationsWithError(QRVError* error);
   // Wipe: the data container keeps its UUID and path and comes back empty,
   // with its default structure; the old contents go to death row.
   bool deleteDataContainerContentWithContainerIdentity(const QRVContainerIdentityRef& containerIdentity,
@@ -193,12 +172,6 @@ class QRVClientConnection {
   // directory name is not a UUID), 21, 40, 45, 48, and 34 from the file.
   QRVMetadataRef regenerateDirectoryUUIDWithContainerIdentity(const QRVContainerIdentityRef& containerIdentity,
                                                               QRVError* error);
-  // Look-up without creation for the operations above; 21 carries the
-  // identity. Without `useLocking` the caller holds the global lock.
-  QRVMetadataRef _existingContainer(const QRVContainerIdentityRef& containerIdentity, bool useLocking,
-                                    QRVError* error);
-  // Writes `metadata`'s file and replaces its cache entry (45).
-  bool _storeMetadata(const QRVMetadataRef& metadata, QRVError* error);
 
   // Test support for clients' retry logic: makes the daemon crash
   // `numCrashes` times in a row on this request (the count survives the
@@ -212,7 +185,53 @@ class QRVClientConnection {
   void rebootQuorvaCleanupWithCompletion(std::function<void()> completion);
   void quorvaCleanupWithCompletion(std::function<void()> completion);
 
+  // Test hooks: the steps above that tests drive on their own.
+  bool TEST_moveItemAtURLToDeathRow(const std::string& url, bool isDir, bool startDeletionThread, QRVError* error) {
+    return _moveItemAtURLToDeathRow(url, isDir, startDeletionThread, error);
+  }
+  bool TEST_removeItemOrMoveToTempAtURL(const std::string& url, QRVError* error) {
+    return _removeItemOrMoveToTempAtURL(url, error);
+  }
+  std::optional<QRVPlist> TEST_readAndValidateReplaceFileAtUrl(const std::string& url, QRVError* error) {
+    return _readAndValidateReplaceFileAtUrl(url, error);
+  }
+  bool TEST_writeToDiskReplaceAt(const std::string& url, const std::string& oldURL, const std::string& newURL,
+                                 const std::string& stagingURL, const std::string& destinationURL, QRVError* error) {
+    return _writeToDiskReplaceAt(url, oldURL, newURL, stagingURL, destinationURL, error);
+  }
+  bool TEST_recoverFromReplaceOperationsWithError(QRVError* error) {
+    return _recoverFromReplaceOperationsWithError(error);
+  }
+
  private:
+  // The identifiers the lookup entitlement grants for a class (memoised).
+  const std::set<std::string>* _lookupForContainerClass(QRVContainerClass containerClass);
+  bool _createTopLevelContainerDirectory(const std::string& url, QRVContainerClass containerClass, uid_t owner,
+                                         QRVError* error);
+  bool _createSubDirectories(const std::string& url, const QRVMetadata& metadata, QRVError* error);
+  uint32_t _dataProtectionClassForContainerMetadata(const QRVMetadata& metadata);
+  // Moves `url` into a fresh directory on death row under its own name. A
+  // missing item is success. Fails with 41. With `startDeletionThread` the
+  // emptying of death row is started.
+  bool _moveItemAtURLToDeathRow(const std::string& url, bool isDir, bool startDeletionThread, QRVError* error);
+  // Removes `url` recursively; what cannot be removed is moved to "/tmp"
+  // (under the root) instead, failing with 4 when even that fails.
+  bool _removeItemOrMoveToTempAtURL(const std::string& url, QRVError* error);
+  // The journal's four directories (old, new, staging, destination) as a
+  // dictionary of absolute paths; 35 when unreadable or incomplete.
+  std::optional<QRVPlist> _readAndValidateReplaceFileAtUrl(const std::string& url, QRVError* error);
+  // 33 when a path is empty, 34 when the write fails.
+  bool _writeToDiskReplaceAt(const std::string& url, const std::string& oldURL, const std::string& newURL,
+                             const std::string& stagingURL, const std::string& destinationURL, QRVError* error);
+  // Finishes or rolls back every replace left in the replace directory.
+  bool _recoverFromReplaceOperationsWithError(QRVError* error);
+  // Look-up without creation for the operations above; 21 carries the
+  // identity. Without `useLocking` the caller holds the global lock.
+  QRVMetadataRef _existingContainer(const QRVContainerIdentityRef& containerIdentity, bool useLocking,
+                                    QRVError* error);
+  // Writes `metadata`'s file and replaces its cache entry (45).
+  bool _storeMetadata(const QRVMetadataRef& metadata, QRVError* error);
+
   const std::shared_ptr<const QRVClientIdentity> clientIdentity_;
   const bool entitled_;
   bool allowOtherIdLookup_;

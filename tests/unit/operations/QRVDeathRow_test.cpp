@@ -50,13 +50,13 @@ class DeathRowTest : public testing::Test {
 TEST_F(DeathRowTest, ItemsOfOneNameNeverCollideAndNoPlaceThereIs41) {
   QRVError error;
   std::string a = make("same", true);
-  ASSERT_TRUE(connection_->_moveItemAtURLToDeathRow(a, true, false, &error)) << error.description();
+  ASSERT_TRUE(connection_->TEST_moveItemAtURLToDeathRow(a, true, false, &error)) << error.description();
   std::string b = make("same", false);
-  ASSERT_TRUE(connection_->_moveItemAtURLToDeathRow(b, false, false, &error)) << error.description();
+  ASSERT_TRUE(connection_->TEST_moveItemAtURLToDeathRow(b, false, false, &error)) << error.description();
   EXPECT_FALSE(fs::exists(a));
   EXPECT_EQ(itemsOnDeathRow(), 2u);
   // An item that is already gone counts as moved.
-  EXPECT_TRUE(connection_->_moveItemAtURLToDeathRow(env_.root.path() + "/never-was", true, false, &error));
+  EXPECT_TRUE(connection_->TEST_moveItemAtURLToDeathRow(env_.root.path() + "/never-was", true, false, &error));
 
   emptyDeathRow();
   EXPECT_EQ(itemsOnDeathRow(), 0u);
@@ -65,14 +65,14 @@ TEST_F(DeathRowTest, ItemsOfOneNameNeverCollideAndNoPlaceThereIs41) {
   std::string item = make("x", true), dead = deathRow();  // asking again would remake it
   fs::remove_all(dead);
   std::ofstream(dead) << "in the way";
-  EXPECT_FALSE(connection_->_moveItemAtURLToDeathRow(item, true, false, &error));
+  EXPECT_FALSE(connection_->TEST_moveItemAtURLToDeathRow(item, true, false, &error));
   EXPECT_EQ(error.code(), 41u);
   EXPECT_TRUE(fs::exists(item));
 }
 
 TEST_F(DeathRowTest, StartingTheDeletionEmptiesDeathRowInTheBackground) {
   QRVError error;
-  ASSERT_TRUE(connection_->_moveItemAtURLToDeathRow(make("c", true), true, true, &error));
+  ASSERT_TRUE(connection_->TEST_moveItemAtURLToDeathRow(make("c", true), true, true, &error));
   EXPECT_TRUE(QRVEventually([&] { return itemsOnDeathRow() == 0; }));
   // The work held the daemon awake until it finished.
   EXPECT_TRUE(QRVEventually([&] { return env_.messages->isIdle(); }));
@@ -83,7 +83,7 @@ TEST_F(DeathRowTest, WhatCannotBeRemovedIsParkedInTmp) {
   std::string item = make("stubborn", true);
   env_.fileSystem->failNext(QRVFakeFileSystemExtras::Operation::kRemoveTree, EBUSY);
   fs::create_directories(env_.root.path() + "/tmp");
-  ASSERT_TRUE(connection_->_removeItemOrMoveToTempAtURL(item, &error)) << error.description();
+  ASSERT_TRUE(connection_->TEST_removeItemOrMoveToTempAtURL(item, &error)) << error.description();
   EXPECT_FALSE(fs::exists(item));
   EXPECT_TRUE(fs::exists(env_.root.path() + "/tmp/stubborn/inner/file"));
 
@@ -91,11 +91,11 @@ TEST_F(DeathRowTest, WhatCannotBeRemovedIsParkedInTmp) {
   std::string other = make("stubborn2", true);
   fs::remove_all(env_.root.path() + "/tmp");
   env_.fileSystem->failNext(QRVFakeFileSystemExtras::Operation::kRemoveTree, EBUSY);
-  EXPECT_FALSE(connection_->_removeItemOrMoveToTempAtURL(other, &error));
+  EXPECT_FALSE(connection_->TEST_removeItemOrMoveToTempAtURL(other, &error));
   EXPECT_EQ(error.code(), 4u);
   EXPECT_TRUE(fs::exists(other));
   // A missing item counts as removed.
-  EXPECT_TRUE(connection_->_removeItemOrMoveToTempAtURL(env_.root.path() + "/gone", &error));
+  EXPECT_TRUE(connection_->TEST_removeItemOrMoveToTempAtURL(env_.root.path() + "/gone", &error));
 }
 
 TEST_F(DeathRowTest, StartUpCleanupEmptiesEveryStagingDirectory) {

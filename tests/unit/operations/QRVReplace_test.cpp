@@ -107,7 +107,7 @@ class RecoveryTest : public ReplaceTest {
   }
   void writeJournal() {
     QRVError error;
-    ASSERT_TRUE(admin()->_writeToDiskReplaceAt(replaceDir() + "/j.plist", oldURL_, newURL_, staging_, dest_, &error))
+    ASSERT_TRUE(admin()->TEST_writeToDiskReplaceAt(replaceDir() + "/j.plist", oldURL_, newURL_, staging_, dest_, &error))
         << error.description();
   }
   void marked(const std::string& dir, const std::string& mark) {
@@ -116,7 +116,7 @@ class RecoveryTest : public ReplaceTest {
   }
   void recover() {
     QRVError error;
-    ASSERT_TRUE(admin()->_recoverFromReplaceOperationsWithError(&error)) << error.description();
+    ASSERT_TRUE(admin()->TEST_recoverFromReplaceOperationsWithError(&error)) << error.description();
     EXPECT_EQ(QRVEntriesIn(replaceDir()), 0u);
   }
 
@@ -159,7 +159,7 @@ TEST_F(RecoveryTest, BootSetUpRunsTheRecoveryAndNoReplaceDirectoryIsNothingToDo)
 
   fs::remove_all(replaceDir());
   QRVError error;
-  EXPECT_TRUE(admin()->_recoverFromReplaceOperationsWithError(&error)) << error.description();
+  EXPECT_TRUE(admin()->TEST_recoverFromReplaceOperationsWithError(&error)) << error.description();
 }
 
 TEST_F(RecoveryTest, UnreadableOrIncompleteJournalsAreDiscardedWithoutAMove) {
@@ -174,10 +174,10 @@ TEST_F(RecoveryTest, UnreadableOrIncompleteJournalsAreDiscardedWithoutAMove) {
   ASSERT_TRUE(QRV_writeToURL(*env_.services->fileManager, QRVPlist::array(), replaceDir() + "/array.plist", &error));
 
   for (const char* name : {"/partial.plist", "/garbage.plist"}) {
-    EXPECT_FALSE(admin()->_readAndValidateReplaceFileAtUrl(replaceDir() + name, &error));
+    EXPECT_FALSE(admin()->TEST_readAndValidateReplaceFileAtUrl(replaceDir() + name, &error));
     EXPECT_EQ(error.code(), 35u) << name;
   }
-  EXPECT_FALSE(admin()->_writeToDiskReplaceAt(replaceDir() + "/x.plist", oldURL_, "", staging_, dest_, &error));
+  EXPECT_FALSE(admin()->TEST_writeToDiskReplaceAt(replaceDir() + "/x.plist", oldURL_, "", staging_, dest_, &error));
   EXPECT_EQ(error.code(), 33u);
 
   recover();
