@@ -36,7 +36,8 @@ bool QRVCommandStageForDelete::fromQueue(QRVCommandQueue& queue, uint64_t* resul
 bool QRVCommandStageForDelete::stage(const QRVContainerIdentity& identity, QRVCommandQueue& queue, uint64_t* result) {
   QRVContainerCache& cache = *services_->containerCache;
   QRVMetadataRef metadata = cache.containerForContainerIdentity(identity, nullptr);
-  if (!metadata) metadata = cache.containerForContainerIdentity(identity, true, false, nullptr);
+  if (!metadata)
+    metadata = cache.containerForContainerIdentity(identity, /*transient=*/true, /*updateSandbox=*/false, nullptr);
   if (!metadata) return true;  // nothing of that name to take away
 
   const std::string& url = metadata->url();

@@ -43,7 +43,8 @@ void QRVHandleReplaceContainer(const QRVPlist& request, const std::shared_ptr<QR
       oldIdentity ? identityOfSide(sideOfReplace(request, "New"), connection, &error) : nullptr;
   // The command names no preserved UUID: the new container keeps its own.
   if (!oldIdentity || !newIdentity ||
-      !connection.replaceContainerIdentity(oldIdentity, newIdentity, false, true, &error))
+      !connection.replaceContainerIdentity(oldIdentity, newIdentity, /*preserveOldUUID=*/false,
+                                           /*startDeletionThread=*/true, &error))
     *result = error.code();
 }
 

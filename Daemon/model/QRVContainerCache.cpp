@@ -143,7 +143,7 @@ QRVContainerCache::ClassMap* QRVContainerCache::_lock_getCacheForUserIdentity(co
 
 QRVMetadataRef QRVContainerCache::containerForContainerIdentity(const QRVContainerIdentity& containerIdentity,
                                                                 QRVError* error) {
-  return containerForContainerIdentity(containerIdentity, false, false, error);
+  return containerForContainerIdentity(containerIdentity, /*transient=*/false, /*updateSandbox=*/false, error);
 }
 
 QRVMetadataRef QRVContainerCache::containerForContainerIdentity(const QRVContainerIdentity& containerIdentity,

@@ -20,8 +20,8 @@ QRVClientConnection::QRVClientConnection(std::shared_ptr<const QRVClientIdentity
 std::shared_ptr<QRVClientConnection> QRVClientConnection::makeSharedClientConnection(
     std::shared_ptr<QRVServices> services) {
   auto identity = QRVClientIdentity::anonymousPrivilegedClientIdentity(*services->userIdentityCache);
-  return std::make_shared<QRVClientConnection>(std::move(identity), true, false,
-                                               true, std::nullopt, std::nullopt,
+  return std::make_shared<QRVClientConnection>(std::move(identity), /*entitled=*/true, /*allowOtherIdLookup=*/false,
+                                               /*unrestricted=*/true, std::nullopt, std::nullopt,
                                                std::make_shared<QRVCommandQueue>(), std::move(services));
 }
 
@@ -80,7 +80,7 @@ void QRVClientConnection::quorvaCleanupWithCompletion(std::function<void()> comp
       [worker, leftovers = std::move(leftovers), completion = std::move(completion)] {
         for (const std::string& item : leftovers) {
           QRVError error;
-          if (!worker->_moveItemAtURLToDeathRow(item, true, false, &error))
+          if (!worker->_moveItemAtURLToDeathRow(item, /*isDir=*/true, /*startDeletionThread=*/false, &error))
             QRVLogError("Failed to move staging leftover {} to death row: {}", item, error.description());
         }
         worker->deleteContainersOnDeathRowWithCompletion(nullptr);

@@ -58,8 +58,8 @@ Result guarded(QRVClientConnection& connection, QRVError* error, Result failed, 
 QRVMetadataRef QRVClientConnection::_existingContainer(const QRVContainerIdentityRef& containerIdentity,
                                                        bool useLocking, QRVError* error) {
   QRVError lookupError;
-  QRVMetadataRef metadata =
-      createOrLookupContainerWithContainerIdentity(containerIdentity, false, false, useLocking, &lookupError);
+  QRVMetadataRef metadata = createOrLookupContainerWithContainerIdentity(containerIdentity, /*createIfNecessary=*/false,
+                                                                         /*transient=*/false, useLocking, &lookupError);
   if (metadata && containerIdentity->uuid() && metadata->uuid() != *containerIdentity->uuid()) metadata = nullptr;
   if (metadata) return metadata;
   if (lookupError.code() == 0 || QRVContainerCache::isNotFoundError(lookupError))
@@ -140,7 +140,8 @@ std::optional<std::string> QRVClientConnection::userManagedAssetsPathWithContain
     QRVMetadataRef metadata;
     if (createIfNecessary) {
       QRVError createError;
-      metadata = createOrLookupContainerWithContainerIdentity(containerIdentity, true, false, true, &createError);
+      metadata = createOrLookupContainerWithContainerIdentity(containerIdentity, /*createIfNecessary=*/true,
+                                                              /*transient=*/false, /*useLocking=*/true, &createError);
       if (!metadata) {
         QRVFail(error, QRV_ERROR_UNDERLYING(11, createError,
                                             "Failed to create app data container for user managed assets path for "

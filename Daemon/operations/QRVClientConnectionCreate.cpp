@@ -128,7 +128,8 @@ QRVMetadataRef QRVClientConnection::createOrLookupContainerWithContainerIdentity
       std::optional<QRVGlobalReadLock> readLock;
       if (useLocking) readLock.emplace();
       QRVError lookupError;
-      QRVMetadataRef found = cache.containerForContainerIdentity(*containerIdentity, false, true, &lookupError);
+      QRVMetadataRef found = cache.containerForContainerIdentity(*containerIdentity, /*transient=*/false,
+                                                                 /*updateSandbox=*/true, &lookupError);
       if (found) return found->withExisted(true);
       if (!QRVContainerCache::isNotFoundError(lookupError)) {
         QRVFail(error, lookupError);
@@ -149,7 +150,7 @@ QRVMetadataRef QRVClientConnection::createOrLookupContainerWithContainerIdentity
     if (found) {
       // A transient request always gets a fresh, empty container.
       QRVError moveError;
-      if (!_moveItemAtURLToDeathRow(found->url(), true, true, &moveError)) {
+      if (!_moveItemAtURLToDeathRow(found->url(), /*isDir=*/true, /*startDeletionThread=*/true, &moveError)) {
         QRVFail(error, QRV_ERROR_UNDERLYING(5, moveError, "Failed to remove transient container at {}", found->url()));
         return nullptr;
       }
@@ -227,7 +228,8 @@ QRVMetadataRef QRVClientConnection::createOrLookupContainerWithContainerIdentity
 
 QRVMetadataRef QRVClientConnection::metadataWithContainerIdentity(const QRVContainerIdentityRef& containerIdentity,
                                                                   QRVError* error) {
-  QRVMetadataRef metadata = createOrLookupContainerWithContainerIdentity(containerIdentity, false, false, true, error);
+  QRVMetadataRef metadata = createOrLookupContainerWithContainerIdentity(
+      containerIdentity, /*createIfNecessary=*/false, /*transient=*/false, /*useLocking=*/true, error);
   if (metadata && containerIdentity->uuid() && metadata->uuid() != *containerIdentity->uuid()) {
     // The identifier has a container, but not the one the caller named.
     QRVFail(error, QRV_ERROR_QUIET(21, "Container with identifier: \"{}\" Not Found", containerIdentity->identifier()));

@@ -57,8 +57,8 @@ class UnrestrictedScope {
 
 bool QRVClientConnection::deleteContainerWithContainerIdentity(const QRVContainerIdentityRef& containerIdentity,
                                                                bool transient, QRVError* error) {
-  QRVMetadataRef metadata =
-      createOrLookupContainerWithContainerIdentity(containerIdentity, false, transient, true, error);
+  QRVMetadataRef metadata = createOrLookupContainerWithContainerIdentity(containerIdentity, /*createIfNecessary=*/false,
+                                                                         transient, /*useLocking=*/true, error);
   if (!metadata) return false;
   stageContainerIdentitiesForDelete({metadata->containerIdentity()});
   return true;
@@ -148,7 +148,7 @@ bool QRVClientConnection::_recoverFromReplaceOperationsWithError(QRVError* error
       QRVLogError("Discarding replace file {}: {}", journalURL, readError.description());
     }
     QRVError discardError;
-    if (!_moveItemAtURLToDeathRow(journalURL, false, false, &discardError))
+    if (!_moveItemAtURLToDeathRow(journalURL, /*isDir=*/false, /*startDeletionThread=*/false, &discardError))
       return QRVFail(error, QRV_ERROR_UNDERLYING(36, discardError, "Failed to remove replace file at {}", journalURL));
   }
   return true;
@@ -268,7 +268,7 @@ bool QRVClientConnection::replaceContainerIdentity(const QRVContainerIdentityRef
         return QRVFail(
             error, QRV_ERROR_UNDERLYING(35, backError, "Failed to recover replace move: {} to {}", staging, oldURL));
       cache.addContainerMetadata(oldMetadata, oldURL, transient, true, nullptr);
-      _moveItemAtURLToDeathRow(journalURL, false, false, nullptr);
+      _moveItemAtURLToDeathRow(journalURL, /*isDir=*/false, /*startDeletionThread=*/false, nullptr);
       return QRVFail(error, QRV_ERROR_UNDERLYING(45, step, "Failed to add to cache: {}, url: {}, transient: {}",
                                                  newIdentity->description(), dest, transient ? 1 : 0));
     }
@@ -285,7 +285,7 @@ bool QRVClientConnection::replaceContainerIdentity(const QRVContainerIdentityRef
       cache.addContainerMetadata(oldMetadata, oldURL, transient, true, nullptr);
       // The new container keeps its own identity where it is.
       if (keptUUID != newMetadata->uuid()) newMetadata->writeMetadataToDisk(fm, config, nullptr);
-      _moveItemAtURLToDeathRow(journalURL, false, false, nullptr);
+      _moveItemAtURLToDeathRow(journalURL, /*isDir=*/false, /*startDeletionThread=*/false, nullptr);
       return QRVFail(error, replaceError);
     }
     QRVCrashPoint(*services_, "replace.new-placed");
@@ -306,7 +306,7 @@ bool QRVClientConnection::replaceContainerIdentity(const QRVContainerIdentityRef
     if (!_moveItemAtURLToDeathRow(staging, true, startDeletionThread, &step))
       return QRVFail(error, QRV_ERROR_UNDERLYING(36, step, "Failed to remove staging dir: {}", staging));
     QRVCrashPoint(*services_, "replace.staging-removed");
-    if (!_moveItemAtURLToDeathRow(journalURL, false, false, &step))
+    if (!_moveItemAtURLToDeathRow(journalURL, /*isDir=*/false, /*startDeletionThread=*/false, &step))
       return QRVFail(error, QRV_ERROR_UNDERLYING(36, step, "Failed to remove replace file: {}", journalURL));
     return true;
   } catch (...) {
@@ -339,18 +339,20 @@ bool QRVClientConnection::deleteDataContainerContentWithContainerIdentity(
   try {
     UnrestrictedScope widened(*this);
     QRVError step;
-    QRVMetadataRef existing =
-        createOrLookupContainerWithContainerIdentity(containerIdentity, false, false, true, &step);
+    QRVMetadataRef existing = createOrLookupContainerWithContainerIdentity(
+        containerIdentity, /*createIfNecessary=*/false, /*transient=*/false, /*useLocking=*/true, &step);
     if (!existing) {
       if (!QRVContainerCache::isNotFoundError(step)) QRVLogError("Failed to lookup existing container to wipe-identifier: {}", identifier);
       return QRVFail(error, step);
     }
-    QRVMetadataRef fresh = createOrLookupContainerWithContainerIdentity(containerIdentity, true, true, true, &step);
+    QRVMetadataRef fresh = createOrLookupContainerWithContainerIdentity(containerIdentity, /*createIfNecessary=*/true,
+                                                                        /*transient=*/true, /*useLocking=*/true, &step);
     if (!fresh) {
       QRVLogError("Failed to create transient container for wipe-identifier: {}", identifier);
       return QRVFail(error, step);
     }
-    if (!replaceContainerIdentity(existing->containerIdentity(), fresh->containerIdentity(), true, true, &step)) {
+    if (!replaceContainerIdentity(existing->containerIdentity(), fresh->containerIdentity(), /*preserveOldUUID=*/true,
+                                  /*startDeletionThread=*/true, &step)) {
       QRVLogError("Failed replace operation during delete all content: {}", step.description());
       return QRVFail(error, step);
     }

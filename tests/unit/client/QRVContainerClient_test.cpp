@@ -153,7 +153,7 @@ TEST(ContainerClientTest, CallsSendTheRequestAndAFailureCodeIsStillAResult) {
   QRVContainerClient client(QRVClient::adoptSocket(fds[0]), 5s);
   const QRVContainerRef c{"com.example.a", 2, std::nullopt, kUUID};
   QRVClientError error;
-  auto looked = client.createOrLookupContainer(c, true, false, &error);
+  auto looked = client.createOrLookupContainer(c, /*create=*/true, /*transient=*/false, &error);
   ASSERT_TRUE(looked) << error.message;
   EXPECT_TRUE(looked->ok());
   EXPECT_EQ(looked->path, "/c");

@@ -163,7 +163,7 @@ TEST_F(ContainerCacheTest, AVanishedMetadataFileIs44ThenNotFound) {
   // Once the container is whole again and recorded, it is found.
   QRVError error;
   ASSERT_TRUE(a->writeMetadataToDisk(fm(), config(), &error));
-  ASSERT_TRUE(cache->addContainerMetadata(a, a->url(), false, false, &error));
+  ASSERT_TRUE(cache->addContainerMetadata(a, a->url(), /*transient=*/false, /*updateSandbox=*/false, &error));
   EXPECT_EQ(lookupCode(*cache, alice_, "com.example.a"), 0u);
 }
 
@@ -242,16 +242,17 @@ TEST_F(ContainerCacheTest, AdditionsAndRemovalsKeepTheMapsCurrent) {
   QRVError error;
   auto m = makeContainer(alice_, kData, "com.example.a");
   // An addition builds the map first (finding the container on disk too).
-  ASSERT_TRUE(cache->addContainerMetadata(m, m->url(), false, false, &error)) << error.description();
+  ASSERT_TRUE(cache->addContainerMetadata(m, m->url(), /*transient=*/false, /*updateSandbox=*/false, &error))
+      << error.description();
   EXPECT_EQ(allURLs(*cache, alice_), std::vector<std::string>{m->url()});
 
   // A moved container is recorded at its new place.
   const std::string moved = classDirectory(alice_, kData) + "/" + QRVUUID::random().string();
   fs::rename(m->url(), moved);
-  ASSERT_TRUE(cache->addContainerMetadata(m, moved, false, false, &error));
+  ASSERT_TRUE(cache->addContainerMetadata(m, moved, /*transient=*/false, /*updateSandbox=*/false, &error));
   EXPECT_EQ(allURLs(*cache, alice_), std::vector<std::string>{moved});
   // Stored transient entries say so.
-  ASSERT_TRUE(cache->addContainerMetadata(m, moved, true, false, &error));
+  ASSERT_TRUE(cache->addContainerMetadata(m, moved, /*transient=*/true, /*updateSandbox=*/false, &error));
   auto found = lookup(*cache, alice_, "com.example.a", kData, &error, true);
   ASSERT_NE(found, nullptr);
   EXPECT_TRUE(found->transient());
@@ -265,7 +266,8 @@ TEST_F(ContainerCacheTest, AdditionsAndRemovalsKeepTheMapsCurrent) {
   auto code = [&](bool ok) { return ok ? 0 : std::exchange(error, QRVError()).code(); };
   EXPECT_EQ(code(cache->removeContainerForUserIdentity(alice_, 14, "com.example.a", false, &error)), 46u);
   EXPECT_EQ(code(cache->removeContainerForUserIdentity(nullptr, kData, "x", false, &error)), 46u);
-  EXPECT_EQ(code(cache->addContainerMetadata(nullptr, "/x", false, false, &error)), 45u);
+  EXPECT_EQ(code(cache->addContainerMetadata(nullptr, "/x", /*transient=*/false, /*updateSandbox=*/false, &error)),
+            45u);
 }
 
 TEST_F(ContainerCacheTest, UnlistableDirectoriesAre43Or45AndUnusablePathsAre47) {
@@ -283,8 +285,8 @@ TEST_F(ContainerCacheTest, UnlistableDirectoriesAre43Or45AndUnusablePathsAre47) 
   EXPECT_EQ(error.code(), 43u);
   auto identity =
       QRVConcreteContainerIdentity::containerIdentityWithUUID(QRVUUID::random(), bob_, "com.example.a", kData, nullptr);
-  EXPECT_FALSE(
-      cache->addContainerMetadata(QRVMetadata::make(*identity, QRVPlist(), "/x", ""), "/x", false, false, &error));
+  EXPECT_FALSE(cache->addContainerMetadata(QRVMetadata::make(*identity, QRVPlist(), "/x", ""), "/x",
+                                           /*transient=*/false, /*updateSandbox=*/false, &error));
   EXPECT_EQ(error.code(), 45u);
   // Once the directory is back, the map is built (nothing failed was kept).
   fs::remove(dir);
@@ -293,7 +295,7 @@ TEST_F(ContainerCacheTest, UnlistableDirectoriesAre43Or45AndUnusablePathsAre47) 
 
   auto m = makeContainer(alice_, kData, "com.example.a");
   for (const char* unusable : {"", "relative/path"}) {
-    ASSERT_TRUE(cache->addContainerMetadata(m, unusable, false, false, &error));
+    ASSERT_TRUE(cache->addContainerMetadata(m, unusable, /*transient=*/false, /*updateSandbox=*/false, &error));
     EXPECT_EQ(lookupCode(*cache, alice_, "com.example.a"), 47u) << unusable;
   }
 }
@@ -336,7 +338,7 @@ TEST_F(ContainerCacheTest, ConcurrentUseKeepsEveryContainer) {
         const QRVMetadataRef& m = made[static_cast<size_t>(i)];
         if (!lookup(*cache, alice_, m->identifier(), kData, &error)) failures++;
         if (!cache->removeContainerForUserIdentity(alice_, kData, m->identifier(), false, &error)) failures++;
-        if (!cache->addContainerMetadata(m, m->url(), false, false, &error)) failures++;
+        if (!cache->addContainerMetadata(m, m->url(), /*transient=*/false, /*updateSandbox=*/false, &error)) failures++;
         if (!cache->allContainersForUserIdentity(alice_, kData, false, &error)) failures++;
       }
     });
@@ -440,21 +442,22 @@ TEST_F(ContainerCacheTest, LookupsPushEachContainerOncePerIdentityAndOnlyWhenAsk
   pushed().clear();
   auto fresh = makeCache();
   QRVError error;
-  ASSERT_TRUE(fresh->allContainersForUserIdentity(work_, kData, false, true, &error));
+  ASSERT_TRUE(
+      fresh->allContainersForUserIdentity(work_, kData, /*transient=*/false, /*populateSandboxCache=*/true, &error));
   ASSERT_EQ(pushed().size(), 2u);
   EXPECT_EQ(pushed()[1].identifier, "com.example.mail");
 
   // Additions push when asked, once per place.
   pushed().clear();
   auto group = makeContainer(other_, QRVContainerClassAppGroup, "group.example");
-  ASSERT_TRUE(fresh->addContainerMetadata(group, group->url(), false, true, &error));
+  ASSERT_TRUE(fresh->addContainerMetadata(group, group->url(), /*transient=*/false, /*updateSandbox=*/true, &error));
   ASSERT_EQ(pushed().size(), 2u);
   EXPECT_EQ(pushed()[1], (Item{501, 1002, 2, "group.example", group->url()}));
-  ASSERT_TRUE(fresh->addContainerMetadata(group, group->url(), false, true, &error));
+  ASSERT_TRUE(fresh->addContainerMetadata(group, group->url(), /*transient=*/false, /*updateSandbox=*/true, &error));
   EXPECT_EQ(pushed().size(), 2u);
   const std::string moved = classDirectory(other_, QRVContainerClassAppGroup) + "/" + QRVUUID::random().string();
   fs::rename(group->url(), moved);
-  ASSERT_TRUE(fresh->addContainerMetadata(group, moved, false, true, &error));
+  ASSERT_TRUE(fresh->addContainerMetadata(group, moved, /*transient=*/false, /*updateSandbox=*/true, &error));
   ASSERT_EQ(pushed().size(), 4u);
   EXPECT_EQ(pushed()[3].path, moved);
 

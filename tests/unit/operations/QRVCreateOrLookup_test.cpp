@@ -112,7 +112,8 @@ TEST_F(CreateOrLookupTest, ConcurrentCreatesMakeOneContainer) {
   for (int i = 0; i < 8; i++) {
     threads.emplace_back([&, i] {
       QRVError error;
-      auto m = admin()->createOrLookupContainerWithContainerIdentity(app, true, false, true, &error);
+      auto m = admin()->createOrLookupContainerWithContainerIdentity(app, /*createIfNecessary=*/true,
+                                                                     /*transient=*/false, /*useLocking=*/true, &error);
       if (!m) return;
       uuids[i] = m->uuid();
       (m->existed() ? existed : fresh)++;

@@ -50,13 +50,16 @@ class DeathRowTest : public testing::Test {
 TEST_F(DeathRowTest, ItemsOfOneNameNeverCollideAndNoPlaceThereIs41) {
   QRVError error;
   std::string a = make("same", true);
-  ASSERT_TRUE(connection_->TEST_moveItemAtURLToDeathRow(a, true, false, &error)) << error.description();
+  ASSERT_TRUE(connection_->TEST_moveItemAtURLToDeathRow(a, /*isDir=*/true, /*startDeletionThread=*/false, &error))
+      << error.description();
   std::string b = make("same", false);
-  ASSERT_TRUE(connection_->TEST_moveItemAtURLToDeathRow(b, false, false, &error)) << error.description();
+  ASSERT_TRUE(connection_->TEST_moveItemAtURLToDeathRow(b, /*isDir=*/false, /*startDeletionThread=*/false, &error))
+      << error.description();
   EXPECT_FALSE(fs::exists(a));
   EXPECT_EQ(itemsOnDeathRow(), 2u);
   // An item that is already gone counts as moved.
-  EXPECT_TRUE(connection_->TEST_moveItemAtURLToDeathRow(env_.root.path() + "/never-was", true, false, &error));
+  EXPECT_TRUE(connection_->TEST_moveItemAtURLToDeathRow(env_.root.path() + "/never-was", /*isDir=*/true,
+                                                        /*startDeletionThread=*/false, &error));
 
   emptyDeathRow();
   EXPECT_EQ(itemsOnDeathRow(), 0u);
@@ -65,14 +68,15 @@ TEST_F(DeathRowTest, ItemsOfOneNameNeverCollideAndNoPlaceThereIs41) {
   std::string item = make("x", true), dead = deathRow();  // asking again would remake it
   fs::remove_all(dead);
   std::ofstream(dead) << "in the way";
-  EXPECT_FALSE(connection_->TEST_moveItemAtURLToDeathRow(item, true, false, &error));
+  EXPECT_FALSE(connection_->TEST_moveItemAtURLToDeathRow(item, /*isDir=*/true, /*startDeletionThread=*/false, &error));
   EXPECT_EQ(error.code(), 41u);
   EXPECT_TRUE(fs::exists(item));
 }
 
 TEST_F(DeathRowTest, StartingTheDeletionEmptiesDeathRowInTheBackground) {
   QRVError error;
-  ASSERT_TRUE(connection_->TEST_moveItemAtURLToDeathRow(make("c", true), true, true, &error));
+  ASSERT_TRUE(
+      connection_->TEST_moveItemAtURLToDeathRow(make("c", true), /*isDir=*/true, /*startDeletionThread=*/true, &error));
   EXPECT_TRUE(QRVEventually([&] { return itemsOnDeathRow() == 0; }));
   // The work held the daemon awake until it finished.
   EXPECT_TRUE(QRVEventually([&] { return env_.messages->isIdle(); }));
