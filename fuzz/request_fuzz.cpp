@@ -507,8 +507,10 @@ void sendRequest(FuzzedDataProvider& in) {
   const QRVPlist* error = reply.get("ReplyError");
   check(error && error->type() == QRVPlist::Type::UInteger, "no numeric ReplyError");
   const uint64_t code = error->uint64Value();
-  // Handlers turn exceptions into 40; none should throw on any input.
-  check(code != QRVResultCode::kException, "handler threw for command", std::to_string(command));
+  // Handlers turn exceptions, and failures that carry no code, into 40;
+  // neither should happen on any input.
+  check(code != QRVResultCode::kException, "handler threw or failed without a code for command",
+        std::to_string(command));
   const QRVCommandTable& table = QRVDefaultCommandTable();
   const bool valid = command < kQRVCommandCount && table[command].handler;
   if (!valid) check(code == QRVResultCode::kInvalidCommand, "invalid command not refused with 49");
