@@ -2,6 +2,7 @@
 
 #include <algorithm>
 
+#include "base/QRVResultCode.h"
 #include "client/QRVProtocol.h"
 
 namespace {
@@ -53,7 +54,7 @@ void setAssetsOwner(QRVPlist& request, const std::string& identifier, const std:
 
 }  // namespace
 
-bool QRVContainerResult::ok() const { return code == QRVProtocol::kResultSuccess; }
+bool QRVContainerResult::ok() const { return code == QRVResultCode::kSuccess; }
 
 QRVContainerResult QRVContainerResult::fromReply(QRVPlist reply) {
   QRVContainerResult r;

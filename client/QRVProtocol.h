@@ -1,5 +1,6 @@
 // What a client needs to know about the daemon's request vocabulary: the
-// command numbers and their names, and what the result codes mean.
+// command numbers and their names. The result codes and their texts are in
+// base/QRVResultCode.h, shared with the daemon.
 //
 // The numbers are the wire contract and never change; the names are the
 // ones the command-line client accepts and prints.
@@ -48,18 +49,13 @@ namespace QRVProtocol {
 
 constexpr uint64_t kCommandCount = 32;
 
-// The reply key that carries the result code, and the code for success.
+// The reply key that carries the result code (a QRVResultCode).
 constexpr std::string_view kReplyErrorKey = "ReplyError";
 constexpr std::string_view kCommandKey = "Command";
-constexpr uint64_t kResultSuccess = 1;
 
 // The command's name, or an empty view for a number outside the table.
 std::string_view commandName(uint64_t command);
 // The number of the command called `name` (exact, case-sensitive match).
 std::optional<uint64_t> commandForName(std::string_view name);
-
-// A short English meaning of a result code, or an empty view for a code the
-// client does not know (the daemon may grow new ones; print the number).
-std::string_view resultCodeDescription(uint64_t code);
 
 }  // namespace QRVProtocol

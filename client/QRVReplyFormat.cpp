@@ -5,6 +5,7 @@
 #include <cmath>
 #include <ctime>
 
+#include "base/QRVResultCode.h"
 #include "base/QRVUUID.h"
 #include "client/QRVProtocol.h"
 
@@ -225,7 +226,7 @@ std::string human(const QRVPlist& reply) {
     out += " = ";
     out += humanValue(value, isUUIDKey(key), true);
     if (key == QRVProtocol::kReplyErrorKey && value.type() == QRVPlist::Type::UInteger) {
-      std::string_view meaning = QRVProtocol::resultCodeDescription(value.uint64Value());
+      std::string_view meaning = QRVResultCode::text(value.uint64Value());
       out += fmt::format(" ({})", meaning.empty() ? "unknown result code" : meaning);
     }
     out += '\n';

@@ -11,6 +11,7 @@
 #include <string_view>
 #include <vector>
 
+#include "base/QRVResultCode.h"
 #include "client/QRVClient.h"
 #include "client/QRVContainerClient.h"
 #include "client/QRVProtocol.h"
@@ -507,8 +508,7 @@ int sendAndPrint(const Options& options, const QRVPlist& request) {
     fmt::print("{}\n", QRVReplyFormat::json(*reply));
   else
     fmt::print("{}", QRVReplyFormat::human(*reply));
-  return QRVClient::resultCode(*reply) == QRVProtocol::kResultSuccess ? kExitSuccess
-                                                                      : kExitDaemonError;
+  return QRVClient::resultCode(*reply) == QRVResultCode::kSuccess ? kExitSuccess : kExitDaemonError;
 }
 
 }  // namespace

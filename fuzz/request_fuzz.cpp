@@ -507,16 +507,18 @@ void sendRequest(FuzzedDataProvider& in) {
   const QRVPlist* error = reply.get("ReplyError");
   check(error && error->type() == QRVPlist::Type::UInteger, "no numeric ReplyError");
   const uint64_t code = error->uint64Value();
-  // Handlers turn exceptions into 40; none should throw on any input.
-  check(code != QRVError::kException, "handler threw for command", std::to_string(command));
+  // Handlers turn exceptions, and failures that carry no code, into 40;
+  // neither should happen on any input.
+  check(code != QRVResultCode::kException, "handler threw or failed without a code for command",
+        std::to_string(command));
   const QRVCommandTable& table = QRVDefaultCommandTable();
   const bool valid = command < kQRVCommandCount && table[command].handler;
-  if (!valid) check(code == QRVError::kInvalidCommand, "invalid command not refused with 49");
+  if (!valid) check(code == QRVResultCode::kInvalidCommand, "invalid command not refused with 49");
   // Callers without any entitlement get only the open commands.
   if (valid && (pid == kPlain || pid == kNoEntitlements || pid == kUnknown) &&
       !table[command].allowedWithoutEntitlement)
-    check(code == QRVError::kNotEntitled, "unentitled caller ran command", std::to_string(command));
-  if (code != QRVError::kSuccess) return;
+    check(code == QRVResultCode::kNotEntitled, "unentitled caller ran command", std::to_string(command));
+  if (code != QRVResultCode::kSuccess) return;
 
   if (command == 0)
     check(mayLookUp(pid, reply.stringForKey("ReplyIdentifier")), "caller got another identifier's container",

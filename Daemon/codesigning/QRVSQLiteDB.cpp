@@ -74,10 +74,6 @@ constexpr const char* kInsertChildSQL =
     "INSERT OR REPLACE INTO child_bundles (parent_id, child_code_signing_id_text) SELECT id, ? "
     "FROM code_signing_info WHERE code_signing_id_text = ?;";
 
-// The code of the reason under a 66 for a stored dictionary that cannot be
-// read back: the content of the blob is invalid.
-constexpr uint64_t kErrorInvalidContent = 29;
-
 constexpr int kPlaceholderBit = 1;
 constexpr int kAdvanceCopyBit = 2;
 
@@ -205,12 +201,12 @@ void QRVSQLiteDB::closeDB() {
 
 bool QRVSQLiteDB::_sqliteExec(const char* statement, QRVError* error) {
   if (!db_) {
-    return QRVFail(error, QRV_ERROR(kErrorDatabase, "{} on {} failed: {}", statement, url_.native(),
+    return QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed, "{} on {} failed: {}", statement, url_.native(),
                                     errorMessage(db_)));
   }
   char* message = nullptr;
   if (sqlite3_exec(db_, statement, nullptr, nullptr, &message) == SQLITE_OK) return true;
-  QRVError e = QRV_ERROR(kErrorDatabase, "{} on {} failed: {}", statement, url_.native(),
+  QRVError e = QRV_ERROR(QRVResultCode::kDatabaseFailed, "{} on {} failed: {}", statement, url_.native(),
                          message ? message : errorMessage(db_));
   sqlite3_free(message);
   return QRVFail(error, std::move(e));
@@ -222,30 +218,30 @@ bool QRVSQLiteDB::_performTwoParameterQuery(const char* sql, std::string_view te
   const std::string& path = url_.native();
   Statement statement(db_, path);
   if (!statement.prepare(sql)) {
-    return QRVFail(error, QRV_ERROR(kErrorDatabase, "sqlite3_prepare(delete) for {} failed: {}",
-                                    path, statement.errmsg()));
+    return QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_prepare(delete) for {} failed: {}", path,
+                                    statement.errmsg()));
   }
   if (bindText(statement.get(), 1, textOne) != SQLITE_OK) {
     return QRVFail(error,
-                   QRV_ERROR(kErrorDatabase, "sqlite3_bind_text for identifier={} at {} failed: {}",
+                   QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_bind_text for identifier={} at {} failed: {}",
                              textOne, path, statement.errmsg()));
   }
   if (textTwo && bindText(statement.get(), 2, *textTwo) != SQLITE_OK) {
     return QRVFail(error,
-                   QRV_ERROR(kErrorDatabase, "sqlite3_bind_text for identifier={} at {} failed: {}",
+                   QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_bind_text for identifier={} at {} failed: {}",
                              *textTwo, path, statement.errmsg()));
   }
   if (sqlite3_step(statement.get()) != SQLITE_DONE) {
-    return QRVFail(error, QRV_ERROR(kErrorDatabase, "sqlite3_step for {} failed: {}", path,
-                                    statement.errmsg()));
+    return QRVFail(
+        error, QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_step for {} failed: {}", path, statement.errmsg()));
   }
   if (expectedChanges != -1) {
     int changes = sqlite3_changes(db_);
     // Quiet: the caller decides what a wrong count means and reports it.
     if (changes != expectedChanges) {
-      return QRVFail(error, QRV_ERROR_QUIET(kErrorChangeCount,
-                                            "sqlite3_changes for {} in {}: {}, but expecting {}",
-                                            sql, path, changes, expectedChanges));
+      return QRVFail(error, QRV_ERROR_QUIET(QRVResultCode::kDatabaseChangeCount,
+                                            "sqlite3_changes for {} in {}: {}, but expecting {}", sql, path, changes,
+                                            expectedChanges));
     }
   }
   return true;
@@ -267,8 +263,8 @@ bool QRVSQLiteDB::_performInsertOrUpdateQuery(const char* sql, const QRVCodeSign
   const std::string& path = url_.native();
   Statement statement(db_, path);
   if (!statement.prepare(sql)) {
-    return QRVFail(error, QRV_ERROR(kErrorDatabase, "sqlite3_prepare(insert) for {} failed: {}",
-                                    path, statement.errmsg()));
+    return QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_prepare(insert) for {} failed: {}", path,
+                                    statement.errmsg()));
   }
   sqlite3_stmt* s = statement.get();
   const int invalid = entry.isInvalid() ? 1 : 0;
@@ -279,46 +275,43 @@ bool QRVSQLiteDB::_performInsertOrUpdateQuery(const char* sql, const QRVCodeSign
   const uint64_t dataContainerClass = entry.dataContainerClass();
 
   if (sqlite3_bind_int(s, 1, invalid) != SQLITE_OK) {
-    return QRVFail(error,
-                   QRV_ERROR(kErrorDatabase, "sqlite3_bind_int for invalid={} at {} failed: {}",
-                             invalid, path, statement.errmsg()));
+    return QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_bind_int for invalid={} at {} failed: {}",
+                                    invalid, path, statement.errmsg()));
   }
   if (sqlite3_bind_int(s, 2, flags) != SQLITE_OK) {
-    return QRVFail(error, QRV_ERROR(kErrorDatabase,
+    return QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed,
                                     "sqlite3_bind_int for placeholder={}, advance_copy={} "
                                     "(flags={}) at {} failed: {}",
                                     placeholder, advanceCopy, flags, path, statement.errmsg()));
   }
   if (sqlite3_bind_int(s, 3, registeredByCaller) != SQLITE_OK) {
-    return QRVFail(error, QRV_ERROR(kErrorDatabase,
-                                    "sqlite3_bind_int for registered_by_caller={} at {} failed: {}",
-                                    registeredByCaller, path, statement.errmsg()));
+    return QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed,
+                                    "sqlite3_bind_int for registered_by_caller={} at {} failed: {}", registeredByCaller,
+                                    path, statement.errmsg()));
   }
   // The column has always held a 32-bit value; classes are small numbers.
   if (sqlite3_bind_int(s, 4, static_cast<int>(static_cast<uint32_t>(dataContainerClass))) !=
       SQLITE_OK) {
-    return QRVFail(error, QRV_ERROR(kErrorDatabase,
-                                    "sqlite3_bind_int for data_container_class={} at {} failed: {}",
-                                    dataContainerClass, path, statement.errmsg()));
+    return QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed,
+                                    "sqlite3_bind_int for data_container_class={} at {} failed: {}", dataContainerClass,
+                                    path, statement.errmsg()));
   }
   if (bindText(s, 5, identifier) != SQLITE_OK) {
-    return QRVFail(
-        error,
-        QRV_ERROR(kErrorDatabase, "sqlite3_bind_text for code_signing_id_text={} at {} failed: {}",
-                  identifier, path, statement.errmsg()));
+    return QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed,
+                                    "sqlite3_bind_text for code_signing_id_text={} at {} failed: {}", identifier, path,
+                                    statement.errmsg()));
   }
   if (sqlite3_step(s) != SQLITE_DONE) {
-    return QRVFail(error, QRV_ERROR(kErrorDatabase, "sqlite3_step for {} failed: {}", path,
-                                    statement.errmsg()));
+    return QRVFail(
+        error, QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_step for {} failed: {}", path, statement.errmsg()));
   }
   if (isUpdate) {
     int changes = sqlite3_changes(db_);
     // Quiet: an update that finds no row is how a new identifier is told
     // apart from a known one, not a failure.
     if (changes != 1) {
-      return QRVFail(error, QRV_ERROR_QUIET(kErrorChangeCount,
-                                            "sqlite3_changes for {} in {}: {}, but expecting 1",
-                                            sql, path, changes));
+      return QRVFail(error, QRV_ERROR_QUIET(QRVResultCode::kDatabaseChangeCount,
+                                            "sqlite3_changes for {} in {}: {}, but expecting 1", sql, path, changes));
     }
   }
   return true;
@@ -331,17 +324,15 @@ bool QRVSQLiteDB::_insertCodeSigningInfo(const QRVCodeSigningEntry& entry,
   QRVError updateError;
   if (_performInsertOrUpdateQuery(kUpdateInfoSQL, entry, identifier, true, &updateError))
     return true;
-  if (updateError.domain() != QRVError::kDomain || updateError.code() != kErrorChangeCount) {
-    return QRVFail(error,
-                   QRV_ERROR_UNDERLYING(kErrorDatabase, updateError,
-                                        "Error performing UPDATE operation for {}", identifier));
+  if (updateError.domain() != QRVError::kDomain || updateError.code() != QRVResultCode::kDatabaseChangeCount) {
+    return QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kDatabaseFailed, updateError,
+                                               "Error performing UPDATE operation for {}", identifier));
   }
   QRVError insertError;
   if (_performInsertOrUpdateQuery(kInsertInfoSQL, entry, identifier, false, &insertError))
     return true;
-  return QRVFail(error,
-                 QRV_ERROR_UNDERLYING(kErrorDatabase, insertError,
-                                      "Error performing INSERT operation for {}", identifier));
+  return QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kDatabaseFailed, insertError,
+                                             "Error performing INSERT operation for {}", identifier));
 }
 
 bool QRVSQLiteDB::_insertCodeSigningData(const QRVCodeSigningEntry& entry,
@@ -349,32 +340,30 @@ bool QRVSQLiteDB::_insertCodeSigningData(const QRVCodeSigningEntry& entry,
   QRVPlist::Bytes data;
   if (entry.hasCodeSigningInfo()) data = entry.codeSigningInfo().toBinary();
   if (data.empty()) {
-    return QRVFail(error,
-                   QRV_ERROR(kErrorDatabase, "Error creating KLData from code signing info: {}",
-                             entry.codeSigningInfo().description()));
+    return QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed, "Error creating KLData from code signing info: {}",
+                                    entry.codeSigningInfo().description()));
   }
   const std::string& path = url_.native();
   Statement statement(db_, path);
   if (!statement.prepare(kInsertDataSQL)) {
-    return QRVFail(error, QRV_ERROR(kErrorDatabase, "sqlite3_prepare(insert) for {} failed: {}",
-                                    path, statement.errmsg()));
+    return QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_prepare(insert) for {} failed: {}", path,
+                                    statement.errmsg()));
   }
   // `data` outlives the step, so SQLite need not copy the blob.
   if (sqlite3_bind_blob64(statement.get(), 1, data.data(), data.size(), SQLITE_STATIC) !=
       SQLITE_OK) {
-    return QRVFail(error, QRV_ERROR(kErrorDatabase,
-                                    "sqlite3_bind_blob64 for codeSigningInfoData at {} failed: {}",
-                                    path, statement.errmsg()));
+    return QRVFail(
+        error, QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_bind_blob64 for codeSigningInfoData at {} failed: {}",
+                         path, statement.errmsg()));
   }
   if (bindText(statement.get(), 2, identifier) != SQLITE_OK) {
-    return QRVFail(
-        error,
-        QRV_ERROR(kErrorDatabase, "sqlite3_bind_text for code_signing_id_text={} at {} failed: {}",
-                  identifier, path, statement.errmsg()));
+    return QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed,
+                                    "sqlite3_bind_text for code_signing_id_text={} at {} failed: {}", identifier, path,
+                                    statement.errmsg()));
   }
   if (sqlite3_step(statement.get()) != SQLITE_DONE) {
-    return QRVFail(error, QRV_ERROR(kErrorDatabase, "sqlite3_step for {} failed: {}", path,
-                                    statement.errmsg()));
+    return QRVFail(
+        error, QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_step for {} failed: {}", path, statement.errmsg()));
   }
   return true;
 }
@@ -388,25 +377,24 @@ bool QRVSQLiteDB::_insertChildIdentifier(std::string_view child, std::string_vie
     // The child column is unique, so OR REPLACE moves a child that another
     // parent claimed to this one.
     if (!statement.prepare(kInsertChildSQL)) {
-      cause = QRV_ERROR(kErrorDatabase, "sqlite3_prepare(insert) for {} failed: {}", path,
+      cause = QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_prepare(insert) for {} failed: {}", path,
                         statement.errmsg());
     } else if (bindText(statement.get(), 1, child) != SQLITE_OK) {
-      cause = QRV_ERROR(kErrorDatabase,
-                        "sqlite3_bind_text for child_code_signing_id_text={} at {} failed: {}",
-                        child, path, statement.errmsg());
+      cause = QRV_ERROR(QRVResultCode::kDatabaseFailed,
+                        "sqlite3_bind_text for child_code_signing_id_text={} at {} failed: {}", child, path,
+                        statement.errmsg());
     } else if (bindText(statement.get(), 2, parent) != SQLITE_OK) {
-      cause = QRV_ERROR(kErrorDatabase,
-                        "sqlite3_bind_text for code_signing_id_text={} at {} failed: {}", parent,
-                        path, statement.errmsg());
+      cause =
+          QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_bind_text for code_signing_id_text={} at {} failed: {}",
+                    parent, path, statement.errmsg());
     } else if (sqlite3_step(statement.get()) != SQLITE_DONE) {
-      cause = QRV_ERROR(kErrorDatabase, "sqlite3_step for {} failed: {}", path, statement.errmsg());
+      cause = QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_step for {} failed: {}", path, statement.errmsg());
     } else {
       return true;
     }
   }
-  return QRVFail(error,
-                 QRV_ERROR_UNDERLYING(kErrorDatabase, cause,
-                                      "Error performing INSERT operation for child {}", child));
+  return QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kDatabaseFailed, cause,
+                                             "Error performing INSERT operation for child {}", child));
 }
 
 std::shared_ptr<QRVCodeSigningEntry> QRVSQLiteDB::_codeSigningEntryFromStatementRow(
@@ -415,21 +403,19 @@ std::shared_ptr<QRVCodeSigningEntry> QRVSQLiteDB::_codeSigningEntryFromStatement
   // valid until the statement is stepped again.
   const auto* bytes = static_cast<const uint8_t*>(sqlite3_column_blob(statement, 0));
   if (!bytes) {
-    QRVFail(error,
-            QRV_ERROR(kErrorDatabase, "Failed to create code signing entry from statement row"));
+    QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed, "Failed to create code signing entry from statement row"));
     return nullptr;
   }
   const auto length = static_cast<size_t>(sqlite3_column_bytes(statement, 0));
   try {
     std::optional<QRVPlist> info = QRVPlist::fromBytes(bytes, length);
     if (!info || !info->isDictionary()) {
-      QRVError readError =
-          info ? QRV_ERROR_QUIET(kErrorInvalidContent,
-                                 "code-signing data is a property list but not a dictionary")
-               : QRV_ERROR_QUIET(kErrorInvalidContent,
-                                 "code-signing data ({} bytes) is not a property list", length);
-      QRVFail(error, QRV_ERROR_UNDERLYING(kErrorDatabase, readError,
-                                          "Error formatting info data from DB"));
+      QRVError readError = info ? QRV_ERROR_QUIET(QRVResultCode::kInvalidFileContent,
+                                                  "code-signing data is a property list but not a dictionary")
+                                : QRV_ERROR_QUIET(QRVResultCode::kInvalidFileContent,
+                                                  "code-signing data ({} bytes) is not a property list", length);
+      QRVFail(error,
+              QRV_ERROR_UNDERLYING(QRVResultCode::kDatabaseFailed, readError, "Error formatting info data from DB"));
       return nullptr;
     }
     const int flags = sqlite3_column_int(statement, 2);
@@ -441,14 +427,14 @@ std::shared_ptr<QRVCodeSigningEntry> QRVSQLiteDB::_codeSigningEntryFromStatement
     entry->setRegisteredByCaller(sqlite3_column_int(statement, 3) != 0);
     return entry;
   } catch (const std::bad_alloc&) {
-    QRVFail(error, QRV_ERROR(kErrorAllocation, "Failed to allocate codeSigningEntry"));
+    QRVFail(error, QRV_ERROR(QRVResultCode::kAllocationFailed, "Failed to allocate codeSigningEntry"));
     return nullptr;
   }
 }
 
 bool QRVSQLiteDB::_failInsideTransaction(std::exception_ptr exception, QRVError* error) {
-  QRVError e = QRV_ERROR(QRVError::kException, "exception inside a transaction on {}: {}",
-                         url_.native(), describeException(exception));
+  QRVError e = QRV_ERROR(QRVResultCode::kException, "exception inside a transaction on {}: {}", url_.native(),
+                         describeException(exception));
   if (exceptionReporter_) exceptionReporter_(exception);
   QRVError rollbackError;
   if (!_sqliteExec("ROLLBACK;", &rollbackError))
@@ -461,14 +447,12 @@ bool QRVSQLiteDB::_failInsideTransaction(std::exception_ptr exception, QRVError*
 bool QRVSQLiteDB::addCodeSigningEntry(const QRVCodeSigningEntry* entry,
                                       std::optional<std::string_view> identifier, QRVError* error) {
   if (!entry || !identifier) {
-    return QRVFail(error, QRV_ERROR(QRVError::kInvalidInput,
-                                    "codeSigningEntry {} and identifier {} cannot be nil",
+    return QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidInput, "codeSigningEntry {} and identifier {} cannot be nil",
                                     entry ? entry->description() : "(null)", orNull(identifier)));
   }
   QRVError execError;
   if (!_sqliteExec("BEGIN;", &execError)) {
-    return QRVFail(error,
-                   QRV_ERROR_UNDERLYING(kErrorDatabase, execError, "failed _sqliteExec begin"));
+    return QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kDatabaseFailed, execError, "failed _sqliteExec begin"));
   }
   try {
     QRVError writeError;
@@ -476,8 +460,8 @@ bool QRVSQLiteDB::addCodeSigningEntry(const QRVCodeSigningEntry* entry,
         !_insertCodeSigningData(*entry, *identifier, &writeError)) {
       QRVError rollbackError;
       if (!_sqliteExec("ROLLBACK;", &rollbackError)) {
-        return QRVFail(error, QRV_ERROR_UNDERLYING(kErrorDatabase, rollbackError,
-                                                   "failed _sqliteExec rollback"));
+        return QRVFail(
+            error, QRV_ERROR_UNDERLYING(QRVResultCode::kDatabaseFailed, rollbackError, "failed _sqliteExec rollback"));
       }
       return QRVFail(error, std::move(writeError));
     }
@@ -493,7 +477,7 @@ bool QRVSQLiteDB::addCodeSigningEntry(const QRVCodeSigningEntry* entry,
   if (!_sqliteExec("COMMIT;", &execError)) {
     // Logged and dropped on purpose: callers have always been told that the
     // add succeeded once its statements ran, and they act on that.
-    QRVError dropped = QRV_ERROR_UNDERLYING(kErrorDatabase, execError, "failed _sqliteExec commit");
+    QRVError dropped = QRV_ERROR_UNDERLYING(QRVResultCode::kDatabaseFailed, execError, "failed _sqliteExec commit");
     (void)dropped;
     _endFailedCommit();
   }
@@ -503,12 +487,11 @@ bool QRVSQLiteDB::addCodeSigningEntry(const QRVCodeSigningEntry* entry,
 bool QRVSQLiteDB::deleteCodeSigningEntryWithIdentifier(std::optional<std::string_view> identifier,
                                                        QRVError* error) {
   if (!identifier) {
-    return QRVFail(error,
-                   QRV_ERROR(QRVError::kInvalidInput, "\bidentifier {} cannot be nil", "(null)"));
+    return QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidInput, "\bidentifier {} cannot be nil", "(null)"));
   }
   QRVError queryError;
   if (!_performSingleParameterQuery(kDeleteSQL, *identifier, 1, &queryError)) {
-    return QRVFail(error, QRV_ERROR_UNDERLYING(kErrorDatabase, queryError,
+    return QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kDatabaseFailed, queryError,
                                                "failed to delete from code_signing_info"));
   }
   return true;
@@ -521,25 +504,24 @@ std::shared_ptr<const QRVCodeSigningEntry> QRVSQLiteDB::codeSigningEntryWithIden
   {
     Statement statement(db_, path);
     if (!statement.prepare(kSelectEntrySQL)) {
-      QRVFail(error, QRV_ERROR(kErrorDatabase, "sqlite3_prepare(select) for {} failed: {}", path,
+      QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_prepare(select) for {} failed: {}", path,
                                statement.errmsg()));
       return nullptr;
     }
     if (bindText(statement.get(), 1, identifier) != SQLITE_OK) {
-      QRVFail(error,
-              QRV_ERROR(kErrorDatabase, "sqlite3_bind_text for identifier={} at {} failed: {}",
-                        identifier, path, statement.errmsg()));
+      QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_bind_text for identifier={} at {} failed: {}",
+                               identifier, path, statement.errmsg()));
       return nullptr;
     }
     int rc = sqlite3_step(statement.get());
     if (rc == SQLITE_DONE) {
       QRVFail(error,
-              QRV_ERROR_QUIET(kErrorNotFound, "Identifier: \"{}\" Not Found in DB", identifier));
+              QRV_ERROR_QUIET(QRVResultCode::kDatabaseNotFound, "Identifier: \"{}\" Not Found in DB", identifier));
       return nullptr;
     }
     if (rc != SQLITE_ROW) {
-      QRVFail(error, QRV_ERROR(kErrorDatabase, "sqlite3_step for {} failed: {}", path,
-                               statement.errmsg()));
+      QRVFail(error,
+              QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_step for {} failed: {}", path, statement.errmsg()));
       return nullptr;
     }
     entry = _codeSigningEntryFromStatementRow(statement.get(), error);
@@ -548,7 +530,7 @@ std::shared_ptr<const QRVCodeSigningEntry> QRVSQLiteDB::codeSigningEntryWithIden
   QRVError childError;
   if (auto children = childIdentifiersForParentIdentifier(identifier, &childError)) {
     entry->setChildBundleIdentifiers(std::move(children));
-  } else if (childError.code() != kErrorNotFound) {
+  } else if (childError.code() != QRVResultCode::kDatabaseNotFound) {
     QRVLogError("Error retrieving childBundleIds: {}", childError.description());
     QRVFail(error, std::move(childError));
     return nullptr;
@@ -560,7 +542,7 @@ bool QRVSQLiteDB::invalidateCodeSigningWithIdentifier(std::string_view identifie
                                                       QRVError* error) {
   QRVError queryError;
   if (!_performSingleParameterQuery(kInvalidateSQL, identifier, &queryError)) {
-    return QRVFail(error, QRV_ERROR_UNDERLYING(kErrorDatabase, queryError,
+    return QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kDatabaseFailed, queryError,
                                                "failed to invalidate identifier {}", identifier));
   }
   return true;
@@ -572,15 +554,14 @@ bool QRVSQLiteDB::invalidateCodeSigningForIdentifierAndAllChildren(std::string_v
   QRVError childError;
   if (auto children = childIdentifiersForParentIdentifier(identifier, &childError)) {
     identifiers.insert(identifiers.end(), children->begin(), children->end());
-  } else if (childError.code() != kErrorNotFound) {
-    return QRVFail(error, QRV_ERROR_UNDERLYING(kErrorDatabase, childError,
+  } else if (childError.code() != QRVResultCode::kDatabaseNotFound) {
+    return QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kDatabaseFailed, childError,
                                                "failed to invalidate identifier {}", identifier));
   }
 
   QRVError execError;
   if (!_sqliteExec("BEGIN;", &execError)) {
-    return QRVFail(error,
-                   QRV_ERROR_UNDERLYING(kErrorDatabase, execError, "failed _sqliteExec begin"));
+    return QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kDatabaseFailed, execError, "failed _sqliteExec begin"));
   }
   try {
     for (const auto& member : identifiers) {
@@ -598,8 +579,7 @@ bool QRVSQLiteDB::invalidateCodeSigningForIdentifierAndAllChildren(std::string_v
   }
   if (!_sqliteExec("COMMIT;", &execError)) {
     _endFailedCommit();
-    return QRVFail(error,
-                   QRV_ERROR_UNDERLYING(kErrorDatabase, execError, "failed _sqliteExec commit"));
+    return QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kDatabaseFailed, execError, "failed _sqliteExec commit"));
   }
   return true;
 }
@@ -619,14 +599,14 @@ std::optional<QRVError> QRVSQLiteDB::enumerateIdentifiersAndCodeSigningInfoUsing
   const std::string& path = url_.native();
   Statement statement(db_, path);
   if (!statement.prepare(kEnumerateSQL)) {
-    return QRV_ERROR(kErrorDatabase, "sqlite3_prepare(select) for {} failed: {}", path,
+    return QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_prepare(select) for {} failed: {}", path,
                      statement.errmsg());
   }
   for (;;) {
     int rc = sqlite3_step(statement.get());
     if (rc == SQLITE_DONE) return std::nullopt;
     if (rc != SQLITE_ROW) {
-      return QRV_ERROR(kErrorDatabase, "sqlite3_step for {} failed: {}", path, statement.errmsg());
+      return QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_step for {} failed: {}", path, statement.errmsg());
     }
     // Everything made for a row lives in this scope, so the walk holds one
     // row's objects at a time however large the table grows.
@@ -639,13 +619,12 @@ std::optional<QRVError> QRVSQLiteDB::enumerateIdentifiersAndCodeSigningInfoUsing
       if (!text) throw std::bad_alloc();
       identifier.assign(*text);
     } catch (const std::bad_alloc&) {
-      return QRV_ERROR(kErrorAllocation, "Failed to allocate identifier for text: {}",
-                       orNull(text));
+      return QRV_ERROR(QRVResultCode::kAllocationFailed, "Failed to allocate identifier for text: {}", orNull(text));
     }
     QRVError childError;
     if (auto children = childIdentifiersForParentIdentifier(identifier, &childError)) {
       entry->setChildBundleIdentifiers(std::move(children));
-    } else if (childError.code() != kErrorNotFound) {
+    } else if (childError.code() != QRVResultCode::kDatabaseNotFound) {
       QRVLogError("Error retrieving childBundleIds: {}", childError.description());
       continue;
     }
@@ -657,7 +636,7 @@ std::optional<std::vector<std::string>> QRVSQLiteDB::identifiersWithError(QRVErr
   const std::string& path = url_.native();
   Statement statement(db_, path);
   if (!statement.prepare(kIdentifiersSQL)) {
-    QRVFail(error, QRV_ERROR(kErrorDatabase, "sqlite3_prepare(select) for {} failed: {}", path,
+    QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_prepare(select) for {} failed: {}", path,
                              statement.errmsg()));
     return std::nullopt;
   }
@@ -666,8 +645,8 @@ std::optional<std::vector<std::string>> QRVSQLiteDB::identifiersWithError(QRVErr
     int rc = sqlite3_step(statement.get());
     if (rc == SQLITE_DONE) return identifiers;
     if (rc != SQLITE_ROW) {
-      QRVFail(error, QRV_ERROR(kErrorDatabase, "sqlite3_step for {} failed: {}", path,
-                               statement.errmsg()));
+      QRVFail(error,
+              QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_step for {} failed: {}", path, statement.errmsg()));
       return std::nullopt;
     }
     std::optional<std::string_view> text = columnText(statement.get(), 0);
@@ -675,8 +654,8 @@ std::optional<std::vector<std::string>> QRVSQLiteDB::identifiersWithError(QRVErr
       if (!text) throw std::bad_alloc();
       identifiers.emplace_back(*text);
     } catch (const std::bad_alloc&) {
-      QRVFail(error, QRV_ERROR(kErrorAllocation, "Failed to allocate identifier for text: {}",
-                               orNull(text)));
+      QRVFail(error,
+              QRV_ERROR(QRVResultCode::kAllocationFailed, "Failed to allocate identifier for text: {}", orNull(text)));
       return std::nullopt;
     }
   }
@@ -687,13 +666,13 @@ std::optional<std::vector<std::string>> QRVSQLiteDB::childIdentifiersForParentId
   const std::string& path = url_.native();
   Statement statement(db_, path);
   if (!statement.prepare(kChildrenSQL)) {
-    QRVFail(error, QRV_ERROR(kErrorDatabase, "sqlite3_prepare(select) for {} failed: {}", path,
+    QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_prepare(select) for {} failed: {}", path,
                              statement.errmsg()));
     return std::nullopt;
   }
   if (bindText(statement.get(), 1, parentIdentifier) != SQLITE_OK) {
     QRVFail(error,
-            QRV_ERROR(kErrorDatabase, "sqlite3_bind_text for code_signing_id={} at {} failed: {}",
+            QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_bind_text for code_signing_id={} at {} failed: {}",
                       parentIdentifier, path, statement.errmsg()));
     return std::nullopt;
   }
@@ -701,15 +680,15 @@ std::optional<std::vector<std::string>> QRVSQLiteDB::childIdentifiersForParentId
   try {
     children.reserve(4);
   } catch (const std::bad_alloc&) {
-    QRVFail(error, QRV_ERROR(kErrorAllocation, "Failed to allocate childBundleIds"));
+    QRVFail(error, QRV_ERROR(QRVResultCode::kAllocationFailed, "Failed to allocate childBundleIds"));
     return std::nullopt;
   }
   for (;;) {
     int rc = sqlite3_step(statement.get());
     if (rc == SQLITE_DONE) break;
     if (rc != SQLITE_ROW) {
-      QRVFail(error, QRV_ERROR(kErrorDatabase, "sqlite3_step for {} failed: {}", path,
-                               statement.errmsg()));
+      QRVFail(error,
+              QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_step for {} failed: {}", path, statement.errmsg()));
       return std::nullopt;
     }
     std::optional<std::string_view> text = columnText(statement.get(), 0);
@@ -717,15 +696,14 @@ std::optional<std::vector<std::string>> QRVSQLiteDB::childIdentifiersForParentId
       if (!text) throw std::bad_alloc();
       children.emplace_back(*text);
     } catch (const std::bad_alloc&) {
-      QRVFail(error, QRV_ERROR(kErrorAllocation,
-                               "Failed to allocate thisChildBundleId for text: {}", orNull(text)));
+      QRVFail(error, QRV_ERROR(QRVResultCode::kAllocationFailed, "Failed to allocate thisChildBundleId for text: {}",
+                               orNull(text)));
       return std::nullopt;
     }
   }
   if (children.empty()) {
-    QRVFail(error, QRV_ERROR_QUIET(kErrorNotFound,
-                                   "Children for parent identifier: \"{}\" Not Found in DB",
-                                   parentIdentifier));
+    QRVFail(error, QRV_ERROR_QUIET(QRVResultCode::kDatabaseNotFound,
+                                   "Children for parent identifier: \"{}\" Not Found in DB", parentIdentifier));
     return std::nullopt;
   }
   return children;
@@ -736,12 +714,12 @@ std::optional<std::string> QRVSQLiteDB::parentIdentifierForChildIdentifier(
   const std::string& path = url_.native();
   Statement statement(db_, path);
   if (!statement.prepare(kParentSQL)) {
-    QRVFail(error, QRV_ERROR(kErrorDatabase, "sqlite3_prepare(select) for {} failed: {}", path,
+    QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_prepare(select) for {} failed: {}", path,
                              statement.errmsg()));
     return std::nullopt;
   }
   if (bindText(statement.get(), 1, childIdentifier) != SQLITE_OK) {
-    QRVFail(error, QRV_ERROR(kErrorDatabase,
+    QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed,
                              "sqlite3_bind_text for child_code_signing_id_text={} at {} "
                              "failed: {}",
                              childIdentifier, path, statement.errmsg()));
@@ -749,13 +727,13 @@ std::optional<std::string> QRVSQLiteDB::parentIdentifierForChildIdentifier(
   }
   int rc = sqlite3_step(statement.get());
   if (rc == SQLITE_DONE) {
-    QRVFail(error, QRV_ERROR_QUIET(kErrorNotFound, "Parent identifier for: \"{}\" Not Found in DB",
+    QRVFail(error, QRV_ERROR_QUIET(QRVResultCode::kDatabaseNotFound, "Parent identifier for: \"{}\" Not Found in DB",
                                    childIdentifier));
     return std::nullopt;
   }
   if (rc != SQLITE_ROW) {
     QRVFail(error,
-            QRV_ERROR(kErrorDatabase, "sqlite3_step for {} failed: {}", path, statement.errmsg()));
+            QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_step for {} failed: {}", path, statement.errmsg()));
     return std::nullopt;
   }
   std::optional<std::string_view> text = columnText(statement.get(), 0);
@@ -763,7 +741,7 @@ std::optional<std::string> QRVSQLiteDB::parentIdentifierForChildIdentifier(
     if (!text) throw std::bad_alloc();
     return std::string(*text);
   } catch (const std::bad_alloc&) {
-    QRVFail(error, QRV_ERROR(kErrorAllocation, "Failed to allocate parentIdentifier for text: {}",
+    QRVFail(error, QRV_ERROR(QRVResultCode::kAllocationFailed, "Failed to allocate parentIdentifier for text: {}",
                              orNull(text)));
     return std::nullopt;
   }
@@ -773,17 +751,16 @@ bool QRVSQLiteDB::deleteAllAdvanceCopiesOfCodeSigningEntriesWithError(QRVError* 
   const std::string& path = url_.native();
   Statement statement(db_, path);
   if (!statement.prepare(kDeleteAdvanceCopiesSQL)) {
-    return QRVFail(error, QRV_ERROR(kErrorDatabase, "sqlite3_prepare(delete) for {} failed: {}",
-                                    path, statement.errmsg()));
+    return QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_prepare(delete) for {} failed: {}", path,
+                                    statement.errmsg()));
   }
   if (sqlite3_bind_int(statement.get(), 1, kAdvanceCopyBit) != SQLITE_OK) {
-    return QRVFail(error,
-                   QRV_ERROR(kErrorDatabase, "sqlite3_bind_text for flags={} at {} failed: {}",
-                             kAdvanceCopyBit, path, statement.errmsg()));
+    return QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_bind_text for flags={} at {} failed: {}",
+                                    kAdvanceCopyBit, path, statement.errmsg()));
   }
   if (sqlite3_step(statement.get()) != SQLITE_DONE) {
-    return QRVFail(error, QRV_ERROR(kErrorDatabase, "sqlite3_step for {} failed: {}", path,
-                                    statement.errmsg()));
+    return QRVFail(
+        error, QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_step for {} failed: {}", path, statement.errmsg()));
   }
   QRVLogNotice("Deleted {} advance copies of code signing info.", sqlite3_changes(db_));
   return true;

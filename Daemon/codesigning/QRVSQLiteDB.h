@@ -48,10 +48,11 @@ class QRVSQLiteDB {
   using EnumerationBlock = std::function<void(
       const std::string& identifier, const std::shared_ptr<const QRVCodeSigningEntry>& entry)>;
 
-  static constexpr uint64_t kErrorDatabase = 66;
-  static constexpr uint64_t kErrorNotFound = 67;
-  static constexpr uint64_t kErrorChangeCount = 68;
-  static constexpr uint64_t kErrorAllocation = 73;
+  // Codes of this component (QRVResultCode): kDatabaseFailed for any failed
+  // statement, kDatabaseNotFound (not logged) when no row matches,
+  // kDatabaseChangeCount when a statement changed another number of rows
+  // than expected, kAllocationFailed when a row cannot be turned into
+  // objects.
 
   // Opens (creating if needed) the database at `url` and runs the schema
   // script. Never returns null: a database that cannot be opened or set up

@@ -13,7 +13,8 @@ void retryTest(const QRVPlist& request, QRVClientConnection& connection, uint64_
     return;
   }
   QRVError error;
-  if (!connection.retryTestWithNumCrashes(request.uint64ForKey("NumRetryCrashes"), &error)) *result = error.code();
+  if (!connection.retryTestWithNumCrashes(request.uint64ForKey("NumRetryCrashes"), &error))
+    *result = error.resultCode();
 }
 
 void setTestLock(const QRVPlist& request, QRVClientConnection& connection, uint64_t* result) {
@@ -25,7 +26,7 @@ void setTestLock(const QRVPlist& request, QRVClientConnection& connection, uint6
   QRVError error;
   if (!connection.services().testLocks->setLockFromCommand(request.uint64ForKey("TestLock"),
                                                            request.boolForKey("Enable"), &error))
-    *result = error.code();
+    *result = error.resultCode();
 }
 
 }  // namespace

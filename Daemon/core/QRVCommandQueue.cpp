@@ -1,6 +1,7 @@
 #include "core/QRVCommandQueue.h"
 
 #include "base/QRVLog.h"
+#include "base/QRVResultCode.h"
 
 QRVCommandQueue::QRVCommandQueue() : queue_(QRVSerialQueue::create("com.kelva.quorvad.QRVCommandQueue")) {}
 
@@ -24,10 +25,12 @@ bool QRVCommandQueue::executeNextCommandWithError(uint64_t* result) {
     }
   }
   if (!command) {
-    if (result) *result = kExhausted;
+    if (result) *result = QRVResultCode::kQueueExhausted;
     return false;
   }
-  uint64_t code = 1;
+  // A command that fails without storing a code leaves 0, which the
+  // dispatcher answers as an internal error rather than as success.
+  uint64_t code = 0;
   bool success = false;
   queue_->sync([&] {
     QRVLogInfo("Executing command <{}; {}>...", static_cast<const void*>(command.get()), command->command());
@@ -40,10 +43,10 @@ bool QRVCommandQueue::executeNextCommandWithError(uint64_t* result) {
 }
 
 bool QRVCommandQueue::executeAllUntilExhaustedOrError(uint64_t* result) {
-  uint64_t code = 1;
+  uint64_t code = QRVResultCode::kSuccess;
   while (executeNextCommandWithError(&code)) {
   }
-  if (code == kExhausted) return true;
+  if (code == QRVResultCode::kQueueExhausted) return true;
   if (result) *result = code;
   // The commands after a failure belong to a request that has failed. They
   // are destroyed outside the lock, which their destructors may want.

@@ -32,14 +32,12 @@ class QRVCommand {
 
 class QRVCommandQueue {
  public:
-  // Internal: the queue ran dry. Never reaches a client.
-  static constexpr uint64_t kExhausted = 77;
-
   QRVCommandQueue();
 
   void insertCommand(std::shared_ptr<QRVCommand> command);
   // Runs the oldest command. Returns true if one ran and succeeded; when
-  // none was left, stores 77.
+  // none was left, stores QRVResultCode::kQueueExhausted, which never
+  // reaches a client.
   bool executeNextCommandWithError(uint64_t* result);
   // Runs commands until none is left (true; `result` untouched) or one fails
   // (false; its code stored through `result`; the rest are dropped).

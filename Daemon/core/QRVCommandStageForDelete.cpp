@@ -3,6 +3,7 @@
 #include <exception>
 
 #include "base/QRVLog.h"
+#include "base/QRVResultCode.h"
 #include "core/QRVExceptionReporter.h"
 #include "core/QRVLocks.h"
 #include "fs/QRVDictionaryAdditions.h"
@@ -46,7 +47,7 @@ bool QRVCommandStageForDelete::stage(const QRVContainerIdentity& identity, QRVCo
   if (QRVContainerClassIsBundle(identity.containerClass())) {
     uint64_t code = services_->codeSigning->removeCodeSigningDictionariesForIdentifierAndItsChildren(
         identity.identifier(), queue);
-    if (code != QRVError::kSuccess)
+    if (code != QRVResultCode::kSuccess)
       QRVLogError("Failed to remove code signing info for {}: {}", identity.identifier(), code);
   }
 
@@ -57,7 +58,7 @@ bool QRVCommandStageForDelete::stage(const QRVContainerIdentity& identity, QRVCo
     QRVError removeError;
     if (!fm.removeItemAtURL(url, &removeError)) {
       QRVLogError("Failed to delete container at {}: {}", url, removeError.description());
-      *result = kDeleteFailed;
+      *result = QRVResultCode::kNotDeleted;
       return false;
     }
   }
@@ -67,7 +68,7 @@ bool QRVCommandStageForDelete::stage(const QRVContainerIdentity& identity, QRVCo
                                             metadata->transient(), &cacheError)) {
     QRVLogError("Failed to remove from cache id: {}, class: {}, transient: {}", identity.identifier(),
                 identity.containerClass(), metadata->transient() ? 1 : 0);
-    *result = kCacheRemovalFailed;
+    *result = QRVResultCode::kCacheRemoveFailed;
     return false;
   }
   // The launcher must no longer find the container.

@@ -3,8 +3,8 @@
 // forgotten by the container cache. A background queue deletes what lies on
 // death row later.
 //
-// Codes: 28 when a container can be neither moved nor deleted, 46 when the
-// cache cannot forget it. The first failure ends the run; containers staged
+// Codes: QRVResultCode::kNotDeleted when a container can be neither moved nor
+// deleted, kCacheRemoveFailed when the cache cannot forget it. The first failure ends the run; containers staged
 // before it stay staged. An exception is a bug: it goes to the crash
 // reporter.
 #pragma once
@@ -20,8 +20,6 @@
 class QRVCommandStageForDelete : public QRVCommand {
  public:
   static constexpr uint64_t kCommandType = 3;
-  static constexpr uint64_t kDeleteFailed = 28;
-  static constexpr uint64_t kCacheRemovalFailed = 46;
 
   using ErrorHandler = std::function<void(uint64_t code)>;
 

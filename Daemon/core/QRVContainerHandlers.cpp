@@ -18,7 +18,7 @@ void QRVHandleCreateOrLookupContainer(const QRVPlist& request, const std::shared
                      identity, request.boolForKey("CreateIfNecessary"), request.boolForKey("Transient"), true, &error)
                : nullptr;
   if (!metadata) {
-    *result = error.code();
+    *result = error.resultCode();
     return;
   }
   QRVPlist& out = reply->dictionary();
@@ -38,7 +38,7 @@ void QRVHandleContainersWithClass(const QRVPlist& request, const std::shared_ptr
   auto containers = connection.containersWithClass(request.uint64ForKey("ContainerClass"),
                                                    request.boolForKey("Transient"), &error);
   if (!containers) {
-    *result = error.code();
+    *result = error.resultCode();
     return;
   }
   QRVPlist ids = QRVPlist::array(), uuids = QRVPlist::array(), personas = QRVPlist::array();
@@ -58,7 +58,7 @@ void QRVHandleContainerMetadata(const QRVPlist& request, const std::shared_ptr<Q
   QRVConcreteContainerIdentityRef identity = QRVRequestUnpacking::concreteContainerIdentity(request, connection, &error);
   QRVMetadataRef metadata = identity ? connection.metadataWithContainerIdentity(identity, &error) : nullptr;
   if (!metadata) {
-    *result = error.code();
+    *result = error.resultCode();
     return;
   }
   QRVPlist& out = reply->dictionary();
@@ -74,5 +74,6 @@ void QRVHandleRecreateDefaultStructure(const QRVPlist& request, const std::share
                                        QRVClientConnection& connection, uint64_t* result) {
   QRVError error;
   QRVConcreteContainerIdentityRef identity = QRVRequestUnpacking::concreteContainerIdentity(request, connection, &error);
-  if (!identity || !connection.recreateDefaultStructureWithContainerIdentity(identity, &error)) *result = error.code();
+  if (!identity || !connection.recreateDefaultStructureWithContainerIdentity(identity, &error))
+    *result = error.resultCode();
 }

@@ -18,7 +18,7 @@ QRVContainerIdentityRef assetsContainerIdentity(const QRVPlist& request, QRVClie
                                                 QRVError* error) {
   const QRVPlist* identifier = request.get("Identifier");
   if (!identifier || !identifier->isString()) {
-    QRVFail(error, QRV_ERROR(38, "Missing or non-string identifier"));
+    QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidInput, "Missing or non-string identifier"));
     return nullptr;
   }
   QRVUserIdentityRef user =
@@ -36,7 +36,7 @@ void QRVHandleSetInfoValue(const QRVPlist& request, const std::shared_ptr<QRVRep
   QRVConcreteContainerIdentityRef identity = QRVRequestUnpacking::concreteContainerIdentity(request, connection, &error);
   if (!identity ||
       !connection.setInfoValue(objectForKey(request, "Value"), objectForKey(request, "Key"), identity, true, &error))
-    *result = error.code();
+    *result = error.resultCode();
 }
 
 void QRVHandleInfoValueForKey(const QRVPlist& request, const std::shared_ptr<QRVReply>& reply,
@@ -46,7 +46,7 @@ void QRVHandleInfoValueForKey(const QRVPlist& request, const std::shared_ptr<QRV
   std::optional<QRVPlist> value =
       identity ? connection.infoValueForKey(objectForKey(request, "Key"), identity, true, &error) : std::nullopt;
   if (!value) {
-    *result = error.code();
+    *result = error.resultCode();
     return;
   }
   reply->dictionary().set("ReplyInfoValue", std::move(*value));
@@ -56,7 +56,8 @@ void QRVHandleRegenerateDirectoryUUID(const QRVPlist& request, const std::shared
                                       QRVClientConnection& connection, uint64_t* result) {
   QRVError error;
   QRVConcreteContainerIdentityRef identity = QRVRequestUnpacking::concreteContainerIdentity(request, connection, &error);
-  if (!identity || !connection.regenerateDirectoryUUIDWithContainerIdentity(identity, &error)) *result = error.code();
+  if (!identity || !connection.regenerateDirectoryUUIDWithContainerIdentity(identity, &error))
+    *result = error.resultCode();
 }
 
 void QRVHandleDiskUsage(const QRVPlist& request, const std::shared_ptr<QRVReply>& reply,
@@ -65,7 +66,7 @@ void QRVHandleDiskUsage(const QRVPlist& request, const std::shared_ptr<QRVReply>
   QRVConcreteContainerIdentityRef identity = QRVRequestUnpacking::concreteContainerIdentity(request, connection, &error);
   std::optional<uint64_t> usage = identity ? connection.diskUsageWithContainerIdentity(identity, &error) : std::nullopt;
   if (!usage) {
-    *result = error.code();
+    *result = error.resultCode();
     return;
   }
   reply->dictionary().set("ReplyDiskUsage", QRVPlist::uinteger(*usage));
@@ -77,7 +78,7 @@ void QRVHandleStageSharedContent(const QRVPlist& request, const std::shared_ptr<
   std::optional<std::string> path = connection.stageSharedContentForIdentifier(
       request.stringForKey("Identifier"), request.stringForKey("SourcePath"), request.stringForKey("DestPath"), &error);
   if (!path) {
-    *result = error.code();
+    *result = error.resultCode();
     return;
   }
   reply->dictionary().set("ReplyPath", QRVPlist::string(*path));
@@ -94,7 +95,7 @@ void QRVHandleUserManagedAssetsPath(const QRVPlist& request, const std::shared_p
                                                                        &existed, &error)
                : std::nullopt;
   if (!path) {
-    *result = error.code();
+    *result = error.resultCode();
     return;
   }
   reply->dictionary().set("ReplyPath", QRVPlist::string(*path));
@@ -107,5 +108,5 @@ void QRVHandleDeleteUserManagedAsset(const QRVPlist& request, const std::shared_
   QRVContainerIdentityRef identity = assetsContainerIdentity(request, connection, &error);
   if (!identity ||
       !connection.deleteUserManagedAssetWithContainerIdentity(identity, request.stringForKey("SourcePath"), &error))
-    *result = error.code();
+    *result = error.resultCode();
 }

@@ -45,7 +45,7 @@ void QRVHandleReplaceContainer(const QRVPlist& request, const std::shared_ptr<QR
   if (!oldIdentity || !newIdentity ||
       !connection.replaceContainerIdentity(oldIdentity, newIdentity, /*preserveOldUUID=*/false,
                                            /*startDeletionThread=*/true, &error))
-    *result = error.code();
+    *result = error.resultCode();
 }
 
 void QRVHandleStageContainerForDelete(const QRVPlist& request, const std::shared_ptr<QRVReply>&,
@@ -59,7 +59,7 @@ void QRVHandleStageContainerForDelete(const QRVPlist& request, const std::shared
         "Can't act on an invalid input: UUIDString count: {}, class count: {}, ID count: {}, persona string "
         "count: {}",
         uuids.size(), classes.size(), identifiers.size(), personas.size());
-    *result = 38;
+    *result = QRVResultCode::kInvalidInput;
     return;
   }
   std::vector<QRVContainerIdentityRef> identities;
@@ -88,7 +88,7 @@ void QRVHandleStageContainerForDelete(const QRVPlist& request, const std::shared
 void QRVHandleDeleteContainersOnDeathRow(const QRVPlist&, const std::shared_ptr<QRVReply>& reply,
                                          QRVClientConnection& connection, uint64_t*) {
   connection.deleteContainersOnDeathRowWithCompletion([reply] {
-    reply->dictionary().set("ReplyError", QRVPlist::uinteger(QRVError::kSuccess));
+    reply->dictionary().set("ReplyError", QRVPlist::uinteger(QRVResultCode::kSuccess));
     reply->send();
   });
 }
@@ -98,7 +98,7 @@ void QRVHandleDeleteContainer(const QRVPlist& request, const std::shared_ptr<QRV
   QRVError error;
   QRVContainerIdentityRef identity = QRVRequestUnpacking::containerIdentity(request, connection, &error);
   if (!identity || !connection.deleteContainerWithContainerIdentity(identity, request.boolForKey("Transient"), &error))
-    *result = error.code();
+    *result = error.resultCode();
 }
 
 void QRVHandleWipeContainerContent(const QRVPlist& request, const std::shared_ptr<QRVReply>&,
@@ -108,7 +108,7 @@ void QRVHandleWipeContainerContent(const QRVPlist& request, const std::shared_pt
   QRVError error;
   QRVContainerIdentityRef identity = QRVRequestUnpacking::containerIdentity(fixed, connection, &error);
   if (!identity || !connection.deleteDataContainerContentWithContainerIdentity(identity, &error))
-    *result = error.code();
+    *result = error.resultCode();
 }
 
 void QRVHandleDeleteContainerContent(const QRVPlist& request, const std::shared_ptr<QRVReply>&,
@@ -117,5 +117,5 @@ void QRVHandleDeleteContainerContent(const QRVPlist& request, const std::shared_
   QRVError error;
   QRVContainerIdentityRef identity = QRVRequestUnpacking::containerIdentity(request, connection, &error);
   if (!identity || !connection.deleteDataContainerContentWithContainerIdentity(identity, &error))
-    *result = error.code();
+    *result = error.resultCode();
 }

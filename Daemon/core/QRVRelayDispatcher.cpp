@@ -4,6 +4,7 @@
 #include <exception>
 
 #include "base/QRVLog.h"
+#include "base/QRVResultCode.h"
 #include "core/QRVCurrentPersona.h"
 #include "core/QRVExceptionReporter.h"
 #include "operations/QRVClientConnection.h"
@@ -45,7 +46,7 @@ void QRVRelayDispatcher::QRVProcessRelayEvent(const std::shared_ptr<QRVConnectio
 
   const QRVPlist& request = event.message.body;
   const uint64_t command = request.uint64ForKey("Command");
-  uint64_t result = QRVError::kSuccess;
+  uint64_t result = QRVResultCode::kSuccess;
   std::shared_ptr<QRVReply> reply = QRVReply::createFrom(event.message);
   if (!reply) {
     QRVLogError("Dictionary does not have reply context");
@@ -72,13 +73,13 @@ void QRVRelayDispatcher::QRVProcessRelayEvent(const std::shared_ptr<QRVConnectio
   const std::string clientName = identity ? identity->bundleIdentifier() : "<unknown>";
 
   if (!entry) {
-    result = QRVError::kInvalidCommand;
+    result = QRVResultCode::kInvalidCommand;
   } else {
     QRVCallerPowers powers = QRVCallerPowersForCommand(*entry, identity.get());
     if (powers.mayConnect(*entry) && identity && processRegisteredEntitlements_) {
       uint64_t code = processRegisteredEntitlements_(identity->entitlements(), identity->bundleIdentifier(),
                                                      *commandQueue);
-      if (code != QRVError::kSuccess)
+      if (code != QRVResultCode::kSuccess)
         QRVLogError("Error processing entitlements for {} : {}", identity->bundleIdentifier(), code);
     }
     if (powers.mayConnect(*entry)) {
@@ -88,7 +89,7 @@ void QRVRelayDispatcher::QRVProcessRelayEvent(const std::shared_ptr<QRVConnectio
       runHandler(*entry, request, reply, clientConnection, &result);
     } else {
       QRVLogError("connection attempt from pid {} ({}) is not entitled", connection->pid(), clientName);
-      result = QRVError::kNotEntitled;
+      result = QRVResultCode::kNotEntitled;
     }
   }
 
@@ -96,7 +97,7 @@ void QRVRelayDispatcher::QRVProcessRelayEvent(const std::shared_ptr<QRVConnectio
 
   // A command that answers later has handed its reply to its completion;
   // every other outcome is answered here, exactly once.
-  if (result != QRVError::kSuccess || !entry || entry->repliesOnReturn) {
+  if (result != QRVResultCode::kSuccess || !entry || entry->repliesOnReturn) {
     reply->dictionary().set("ReplyError", QRVPlist::uinteger(result));
     reply->send();
   }
@@ -112,6 +113,14 @@ void QRVRelayDispatcher::runHandler(const QRVCommandTableEntry& entry, const QRV
     // On an internal build an exception is a bug to be seen at once.
     if (services_->globalConfiguration->isInternalImage()) QRVReportUncaughtException(std::current_exception());
     QRVLogError("exception while handling command {}", entry.command);
-    *result = QRVError::kException;
+    *result = QRVResultCode::kException;
+  }
+  // 0 is no code at all: a handler or a deferred command failed without
+  // saying why. The client must not read that as anything, so it gets the
+  // code of a failure inside an operation.
+  if (*result == 0) {
+    QRVLogError("Internal error: command {} failed without a result code; answering {}", entry.command,
+                QRVResultCode::kException);
+    *result = QRVResultCode::kException;
   }
 }

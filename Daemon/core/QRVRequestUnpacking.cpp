@@ -11,7 +11,7 @@ QRVUserIdentityRef userIdentityForContainerIdentifier(const QRVPlist& request, Q
   // a caller has no identifier and no user of its own, so no container is
   // its to name; everything after this point relies on an identity.
   if (!connection.clientIdentity()) {
-    QRVFail(error, QRV_ERROR(55, "Unidentified caller may not name a container"));
+    QRVFail(error, QRV_ERROR(QRVResultCode::kNotEntitled, "Unidentified caller may not name a container"));
     return nullptr;
   }
   if (!QRVUserIdentity::isUserIdentityRequiredForContainerClass(containerClass))
@@ -23,15 +23,16 @@ QRVUserIdentityRef userIdentityForContainerIdentifier(const QRVPlist& request, Q
   QRVUserIdentityRef asked = services.userIdentityCache->userIdentityForPersonaUniqueString(
       persona->stringValue(), connection.clientIdentity()->posixUID(), connection.clientIdentity()->posixGID());
   if (!asked) {
-    QRVFail(error, QRV_ERROR(11, "Invalid object: no user identity for persona {}", persona->stringValue()));
+    QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidObject, "Invalid object: no user identity for persona {}",
+                             persona->stringValue()));
     return nullptr;
   }
   if (own && asked->isEqualToUserIdentity(*own)) return asked;
   QRVLogNotice("{} trying to look up persona for {}:{}", connection.clientIdentity()->bundleIdentifier(),
                containerClass, persona->stringValue());
   if (!connection.allowOtherIdLookup() && !connection.isUnrestricted()) {
-    QRVFail(error, QRV_ERROR(55, "{} not entitled to look up persona {}", connection.clientIdentity()->bundleIdentifier(),
-                             persona->stringValue()));
+    QRVFail(error, QRV_ERROR(QRVResultCode::kNotEntitled, "{} not entitled to look up persona {}",
+                             connection.clientIdentity()->bundleIdentifier(), persona->stringValue()));
     return nullptr;
   }
   return asked;
@@ -40,7 +41,8 @@ QRVUserIdentityRef userIdentityForContainerIdentifier(const QRVPlist& request, Q
 QRVContainerIdentityRef containerIdentity(const QRVPlist& request, QRVClientConnection& connection, QRVError* error) {
   const QRVPlist* identifier = request.get("Identifier");
   if (identifier && !identifier->isString()) {
-    QRVFail(error, QRV_ERROR(11, "Invalid object: identifier = [{}]", identifier->description()));
+    QRVFail(error,
+            QRV_ERROR(QRVResultCode::kInvalidObject, "Invalid object: identifier = [{}]", identifier->description()));
     return nullptr;
   }
   QRVContainerClass containerClass = request.uint64ForKey("ContainerClass");
@@ -57,8 +59,8 @@ QRVConcreteContainerIdentityRef concreteContainerIdentity(const QRVPlist& reques
   const QRVPlist::Bytes& bytes = request.dataForKey("UUID");
   std::optional<QRVUUID> uuid = QRVUUID::fromData(bytes.data(), bytes.size());
   if (!uuid) {
-    QRVFail(error, QRV_ERROR(11, "Invalid object: uuid = [{}]", request.get("UUID") ? request.get("UUID")->description()
-                                                                                    : std::string("(null)")));
+    QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidObject, "Invalid object: uuid = [{}]",
+                             request.get("UUID") ? request.get("UUID")->description() : std::string("(null)")));
     return nullptr;
   }
   return QRVConcreteContainerIdentity::containerIdentityWithUUID(*uuid, base->userIdentity(), base->identifier(),

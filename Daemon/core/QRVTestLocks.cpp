@@ -122,7 +122,7 @@ bool QRVTestLocks::setLockFromCommand(uint64_t lock, bool enable, QRVError* erro
       setEnabled(false);
       return true;
     }
-    return QRVFail(error, QRV_ERROR(QRVError::kInvalidInput, "Invalid test lock: {}, enable: {}", lock, enable));
+    return QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidInput, "Invalid test lock: {}, enable: {}", lock, enable));
   }
   if (enable) {
     {

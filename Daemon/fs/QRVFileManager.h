@@ -64,7 +64,7 @@ class QRVFileManager {
   // through its ACL alone: "nobody".
   static constexpr uid_t kSystemContainerOwner = 65534;
   // Code of the daemon's own domain for a removal given no path.
-  static constexpr uint64_t kNoURLForRemoval = 14;
+  static constexpr uint64_t kNoURLForRemoval = QRVResultCode::kOldNotMovedAside;
 
   // `root` is the directory every absolute path of the system lives under
   // ("/" on a device); it places home directories.

@@ -95,8 +95,8 @@ QRVContainerCache::ClassMap* QRVContainerCache::_lock_getCacheForUserIdentity(co
   _lock_assertHeld();
   const std::string key = cacheKey(userIdentity, contentClass);
   if (key.empty()) {
-    QRVFail(error, QRV_ERROR(11, "Cache: cannot index class {} for user identity {}", contentClass,
-                             shortDescription(userIdentity)));
+    QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidObject, "Cache: cannot index class {} for user identity {}",
+                             contentClass, shortDescription(userIdentity)));
     return nullptr;
   }
   auto& maps = transient ? transientContainerCache_ : liveContainerCache_;
@@ -106,7 +106,8 @@ QRVContainerCache::ClassMap* QRVContainerCache::_lock_getCacheForUserIdentity(co
   std::optional<std::string> directory =
       globalConfiguration_->containerDirectoryURLForUserIdentity(userIdentity, contentClass, transient);
   if (!directory) {
-    QRVFail(error, QRV_ERROR(11, "Cache: {}{}: no container directory", key, transientSuffix(transient)));
+    QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidObject, "Cache: {}{}: no container directory", key,
+                             transientSuffix(transient)));
     return nullptr;
   }
   std::optional<std::vector<std::string>> entries = fileManager_->urlsForItemsInDirectoryAtURL(*directory, error);
@@ -162,7 +163,7 @@ QRVMetadataRef QRVContainerCache::containerForContainerIdentity(const QRVContain
       what = e.what();
     } catch (...) {
     }
-    QRVFail(error, QRV_ERROR(QRVError::kException, "Got exception: {} : {}", what, "(no call stack)"));
+    QRVFail(error, QRV_ERROR(QRVResultCode::kException, "Got exception: {} : {}", what, "(no call stack)"));
     return nullptr;
   }
 }
@@ -179,29 +180,34 @@ QRVMetadataRef QRVContainerCache::_lock_containerForContainerIdentity(const QRVC
   QRVError buildError;
   ClassMap* map = _lock_getCacheForUserIdentity(userIdentity, contentClass, transient, updateSandbox, &buildError);
   if (!map) {
-    QRVFail(error, QRV_ERROR_UNDERLYING(kRebuildFailed, buildError, "Cache: [{}]-{}{}: Failed to rebuild",
-                                        identifierOf(userIdentity), classDirectory(contentClass), suffix));
+    QRVFail(error,
+            QRV_ERROR_UNDERLYING(QRVResultCode::kCacheRebuildFailed, buildError, "Cache: [{}]-{}{}: Failed to rebuild",
+                                 identifierOf(userIdentity), classDirectory(contentClass), suffix));
     return nullptr;
   }
   auto it = map->find(identifier);
   if (it == map->end()) {
-    QRVFail(error, QRV_ERROR_QUIET(kNotFound, "Cache: {}{}: Container Not Found with ID: {}", key, suffix, identifier));
+    QRVFail(error, QRV_ERROR_QUIET(QRVResultCode::kNoSuchContainer, "Cache: {}{}: Container Not Found with ID: {}", key,
+                                   suffix, identifier));
     return nullptr;
   }
   const QRVMetadataRef metadata = it->second.metadata;
   const std::string& url = metadata->url();
   if (url.empty()) {
-    QRVFail(error, QRV_ERROR(kInvalidURL, "Cache: {}{}: nil URL from {}", key, suffix, metadata->description()));
+    QRVFail(error, QRV_ERROR(QRVResultCode::kCacheInvalidURL, "Cache: {}{}: nil URL from {}", key, suffix,
+                             metadata->description()));
     return nullptr;
   }
   if (url.front() != '/' || url.find('\0') != std::string::npos) {
-    QRVFail(error, QRV_ERROR(kInvalidURL, "Cache: {}{}: Invalid URL path string: {}", key, suffix, url));
+    QRVFail(error,
+            QRV_ERROR(QRVResultCode::kCacheInvalidURL, "Cache: {}{}: Invalid URL path string: {}", key, suffix, url));
     return nullptr;
   }
   const std::string metadataFile = metadata->metadataFileURL();
   if (!fileManager_->itemExistsAtURL(metadataFile)) {
-    QRVFail(error, QRV_ERROR(kInconsistent, "Cache: {}{}: INCONSISTENT-No Metadata at: {} for id: {}, class: {}", key,
-                             suffix, metadataFile, identifier, contentClass));
+    QRVFail(error, QRV_ERROR(QRVResultCode::kCacheInconsistent,
+                             "Cache: {}{}: INCONSISTENT-No Metadata at: {} for id: {}, class: {}", key, suffix,
+                             metadataFile, identifier, contentClass));
     // The disk is the truth: the next request rebuilds from it.
     map->erase(it);
     QRVLogDebug("Cache: {}{}: Removed Identifier: {}", key, suffix, identifier);
@@ -226,8 +232,9 @@ std::optional<std::vector<QRVMetadataRef>> QRVContainerCache::allContainersForUs
   ClassMap* map =
       _lock_getCacheForUserIdentity(userIdentity, contentClass, transient, populateSandboxCache, &buildError);
   if (!map) {
-    QRVFail(error, QRV_ERROR_UNDERLYING(kRebuildFailed, buildError, "Cache: [{}]-{}{}: Failed to rebuild",
-                                        identifierOf(userIdentity), classDirectory(contentClass), suffix));
+    QRVFail(error,
+            QRV_ERROR_UNDERLYING(QRVResultCode::kCacheRebuildFailed, buildError, "Cache: [{}]-{}{}: Failed to rebuild",
+                                 identifierOf(userIdentity), classDirectory(contentClass), suffix));
     return std::nullopt;
   }
   const std::string key = cacheKey(userIdentity, contentClass);
@@ -245,7 +252,8 @@ std::optional<std::vector<QRVMetadataRef>> QRVContainerCache::allContainersForUs
 
 bool QRVContainerCache::addContainerMetadata(const QRVMetadataRef& metadata, const std::string& url, bool transient,
                                              bool updateSandbox, QRVError* error) {
-  if (!metadata) return QRVFail(error, QRV_ERROR(kAddFailed, "Cache: cannot add a nil container at {}", url));
+  if (!metadata)
+    return QRVFail(error, QRV_ERROR(QRVResultCode::kCacheAddFailed, "Cache: cannot add a nil container at {}", url));
   const QRVUserIdentityRef& userIdentity = metadata->userIdentity();
   const QRVContainerClass contentClass = metadata->containerClass();
   const char* suffix = transientSuffix(transient);
@@ -253,8 +261,9 @@ bool QRVContainerCache::addContainerMetadata(const QRVMetadataRef& metadata, con
   QRVError buildError;
   ClassMap* map = _lock_getCacheForUserIdentity(userIdentity, contentClass, transient, false, &buildError);
   if (!map)
-    return QRVFail(error, QRV_ERROR_UNDERLYING(kAddFailed, buildError, "Cache: [{}]-{}{}: Failed to rebuild",
-                                               identifierOf(userIdentity), classDirectory(contentClass), suffix));
+    return QRVFail(
+        error, QRV_ERROR_UNDERLYING(QRVResultCode::kCacheAddFailed, buildError, "Cache: [{}]-{}{}: Failed to rebuild",
+                                    identifierOf(userIdentity), classDirectory(contentClass), suffix));
   QRVMetadataRef stored = metadata;
   if (stored->url() != url) stored = stored->withURL(url);
   if (stored->transient() != transient) stored = stored->withTransient(transient);
@@ -275,8 +284,9 @@ bool QRVContainerCache::removeContainerForUserIdentity(const QRVUserIdentityRef&
                                                        bool transient, QRVError* error) {
   const std::string key = cacheKey(userIdentity, contentClass);
   if (key.empty())
-    return QRVFail(error, QRV_ERROR(kRemoveFailed, "Cache: cannot remove {} of class {} for user identity {}",
-                                    identifier, contentClass, shortDescription(userIdentity)));
+    return QRVFail(
+        error, QRV_ERROR(QRVResultCode::kCacheRemoveFailed, "Cache: cannot remove {} of class {} for user identity {}",
+                         identifier, contentClass, shortDescription(userIdentity)));
   Locker lock(*this);
   ClassMap* map = _lock_existingCacheForUserIdentity(userIdentity, contentClass, transient);
   // A map not built yet holds nothing to forget; it is built from disk later.

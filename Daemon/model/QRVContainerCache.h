@@ -42,17 +42,15 @@ class QRVUserIdentityCache;
 
 class QRVContainerCache {
  public:
-  // Codes of this component.
-  static constexpr uint64_t kNotFound = 21;  // an expected outcome: not logged
-  static constexpr uint64_t kRebuildFailed = 43;
-  static constexpr uint64_t kInconsistent = 44;  // the metadata file vanished; the entry was dropped
-  static constexpr uint64_t kAddFailed = 45;
-  static constexpr uint64_t kRemoveFailed = 46;
-  static constexpr uint64_t kInvalidURL = 47;
+  // Codes of this component (QRVResultCode): kNoSuchContainer, an expected
+  // outcome and therefore not logged; kCacheRebuildFailed;
+  // kCacheInconsistent when the metadata file vanished (the entry is then
+  // dropped, so the next look-up reads the disk); kCacheAddFailed;
+  // kCacheRemoveFailed; kCacheInvalidURL.
 
   // Whether `error` is the cache's "no such container", an expected outcome.
   static bool isNotFoundError(const QRVError& error) {
-    return error.domain() == QRVError::kDomain && error.code() == kNotFound;
+    return error.domain() == QRVError::kDomain && error.code() == QRVResultCode::kNoSuchContainer;
   }
 
   // Null seams are replaced by the defaults that know nothing.

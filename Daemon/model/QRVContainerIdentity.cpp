@@ -5,10 +5,13 @@
 
 bool QRVContainerIdentity::validate(const QRVUserIdentityRef& userIdentity, const std::string& identifier,
                                     QRVContainerClass containerClass, QRVError* error) {
-  if (!userIdentity) return QRVFail(error, QRV_ERROR(11, "Invalid object: no user identity"));
-  if (identifier.empty()) return QRVFail(error, QRV_ERROR(18, "Invalid object: missing identifier"));
+  if (!userIdentity)
+    return QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidObject, "Invalid object: no user identity"));
+  if (identifier.empty())
+    return QRVFail(error, QRV_ERROR(QRVResultCode::kMissingIdentifier, "Invalid object: missing identifier"));
   if (!QRVContainerClassIsValid(containerClass))
-    return QRVFail(error, QRV_ERROR(11, "Invalid object: container class = {}", containerClass));
+    return QRVFail(error,
+                   QRV_ERROR(QRVResultCode::kInvalidObject, "Invalid object: container class = {}", containerClass));
   return true;
 }
 
@@ -25,7 +28,7 @@ QRVContainerIdentityRef QRVContainerIdentity::containerIdentityWithIdentifier(co
                                                                               QRVUserIdentityCache& cache,
                                                                               QRVError* error) {
   if (QRVUserIdentity::isUserIdentityRequiredForContainerClass(containerClass)) {
-    QRVFail(error, QRV_ERROR(11,
+    QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidObject,
                              "Attempt to create a container identity without a user identity when one is required; "
                              "identifier = [{}], class = {}",
                              identifier, containerClass));
@@ -53,7 +56,7 @@ QRVConcreteContainerIdentityRef QRVConcreteContainerIdentity::containerIdentityW
     QRVContainerClass containerClass, QRVError* error) {
   if (!validate(userIdentity, identifier, containerClass, error)) return nullptr;
   if (uuid.isNull()) {
-    QRVFail(error, QRV_ERROR(11, "Invalid object: uuid = [{}]", uuid.string()));
+    QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidObject, "Invalid object: uuid = [{}]", uuid.string()));
     return nullptr;
   }
   return QRVConcreteContainerIdentityRef(

@@ -148,8 +148,9 @@ bool QRVMetadata::writeMetadataToDisk(QRVFileManager& fileManager, QRVGlobalConf
 bool QRVMetadata::writeMetadataToFileURL(const std::string& fileURL, QRVFileManager& fileManager,
                                          QRVGlobalConfiguration& configuration, QRVError* error) const {
   if (QRVUserIdentity::isUserIdentityRequiredForContainerClass(containerClass_) && !userIdentity_)
-    return QRVFail(error, QRV_ERROR(kNotWritten, "Failed to write metadata to URL {} : no user identity for {}",
-                                    fileURL, identifier_));
+    return QRVFail(
+        error, QRV_ERROR(QRVResultCode::kFileNotWritten, "Failed to write metadata to URL {} : no user identity for {}",
+                         fileURL, identifier_));
   QRVPlist dictionary = plist();
   // Named after the container, so concurrent writers of different containers
   // never share a temporary file.
@@ -162,7 +163,7 @@ bool QRVMetadata::writeMetadataToFileURL(const std::string& fileURL, QRVFileMana
 
   QRVError writeError;
   if (!fileManager.writeFileAtURL(temporary, dictionary.toBinary(), 0644, &writeError))
-    return QRVFail(error, QRV_ERROR_UNDERLYING(kNotWritten, writeError,
+    return QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kFileNotWritten, writeError,
                                                "Failed to write metadata dictionary to URL {} : {}:{}", temporary,
                                                writeError.domain(), static_cast<long>(writeError.code())));
   QRVError moveError;
@@ -171,9 +172,9 @@ bool QRVMetadata::writeMetadataToFileURL(const std::string& fileURL, QRVFileMana
     QRVError removeError;
     if (!fileManager.removeFileAtURL(temporary, &removeError))
       QRVLogError("Failed to remove {}: {}", temporary, removeError.description());
-    return QRVFail(error, QRV_ERROR_UNDERLYING(kNotWritten, moveError,
-                                               "Failed to move metadata from staging: {} to final: {}", temporary,
-                                               fileURL));
+    return QRVFail(error,
+                   QRV_ERROR_UNDERLYING(QRVResultCode::kFileNotWritten, moveError,
+                                        "Failed to move metadata from staging: {} to final: {}", temporary, fileURL));
   }
   return true;
 }
@@ -207,7 +208,8 @@ QRVMetadataRef QRVMetadata::readAndValidateMetadataAtFileUrl(const std::string& 
     }
   }
   if (!parsed) {
-    QRVFail(error, QRV_ERROR_UNDERLYING(kUnreadable, readError, "Failed to read metadata at URL {}", directory));
+    QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kFileUnreadable, readError, "Failed to read metadata at URL {}",
+                                        directory));
     return nullptr;
   }
   QRVPlist dictionary = std::move(*parsed);
@@ -215,7 +217,8 @@ QRVMetadataRef QRVMetadata::readAndValidateMetadataAtFileUrl(const std::string& 
   // 2. Identifier.
   const QRVPlist* identifierValue = dictionary.get(kIdentifierKey);
   if (!identifierValue || !identifierValue->isString()) {
-    QRVFail(error, QRV_ERROR(kInvalid, "Invalid metadata Identifier: {} at {}", describe(identifierValue), directory));
+    QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidFileContent, "Invalid metadata Identifier: {} at {}",
+                             describe(identifierValue), directory));
     return nullptr;
   }
   const std::string identifier = identifierValue->stringValue();
@@ -223,25 +226,28 @@ QRVMetadataRef QRVMetadata::readAndValidateMetadataAtFileUrl(const std::string& 
   // 3. UUID.
   const QRVPlist* uuidValue = dictionary.get(kUUIDKey);
   if (!uuidValue || !uuidValue->isString()) {
-    QRVFail(error, QRV_ERROR(kInvalid, "Invalid metadata UUID String: {} at {}", describe(uuidValue), directory));
+    QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidFileContent, "Invalid metadata UUID String: {} at {}",
+                             describe(uuidValue), directory));
     return nullptr;
   }
   std::optional<QRVUUID> uuid = QRVUUID::fromString(uuidValue->stringValue());
   if (!uuid) {
-    QRVFail(error, QRV_ERROR(kInvalid, "Invalid metadata UUID: {} at {}", uuidValue->stringValue(), directory));
+    QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidFileContent, "Invalid metadata UUID: {} at {}",
+                             uuidValue->stringValue(), directory));
     return nullptr;
   }
 
   // 4. Class.
   const QRVPlist* classValue = dictionary.get(kContentClassKey);
   if (!isNumber(classValue)) {
-    QRVFail(error, QRV_ERROR(kInvalid, "Invalid metadata Class: {} at {}", describe(classValue), directory));
+    QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidFileContent, "Invalid metadata Class: {} at {}",
+                             describe(classValue), directory));
     return nullptr;
   }
   const QRVContainerClass containerClass = classValue->uint64Value();
   if (!QRVContainerClassIsValid(containerClass)) {
-    QRVFail(error, QRV_ERROR(kInvalid, "Invalid metadata Content Class: {} at {}", static_cast<long>(containerClass),
-                             directory));
+    QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidFileContent, "Invalid metadata Content Class: {} at {}",
+                             static_cast<long>(containerClass), directory));
     return nullptr;
   }
 
@@ -251,7 +257,8 @@ QRVMetadataRef QRVMetadata::readAndValidateMetadataAtFileUrl(const std::string& 
     owner = userIdentityCache.defaultUserIdentity();
   } else {
     if (!userIdentity) {
-      QRVFail(error, QRV_ERROR(kInvalid, "Incorrect User Identity: {}, expecting: (null) for {} at {}: {}",
+      QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidFileContent,
+                               "Incorrect User Identity: {}, expecting: (null) for {} at {}: {}",
                                describe(dictionary.get(kUserIdentityKey)), identifier, directory, 0));
       return nullptr;
     }
@@ -262,8 +269,9 @@ QRVMetadataRef QRVMetadata::readAndValidateMetadataAtFileUrl(const std::string& 
       const QRVPlist* persona = dictionary.get(kPersonaKey);
       if (persona) {
         if (!isNumber(persona) || persona->uint64Value() != expectedUID) {
-          QRVFail(error, QRV_ERROR(kInvalid, "Incorrect UserId: {}, expecting: {} for {} at {}", describe(persona),
-                                   expectedUID, identifier, directory));
+          QRVFail(error,
+                  QRV_ERROR(QRVResultCode::kInvalidFileContent, "Incorrect UserId: {}, expecting: {} for {} at {}",
+                            describe(persona), expectedUID, identifier, directory));
           return nullptr;
         }
       } else {
@@ -276,14 +284,16 @@ QRVMetadataRef QRVMetadata::readAndValidateMetadataAtFileUrl(const std::string& 
       QRVError identityError;
       owner = QRVUserIdentity::userIdentityWithPlist(*stored, userIdentityCache, &identityError);
       if (!owner) {
-        QRVFail(error, QRV_ERROR_UNDERLYING(kInvalid, identityError, "Invalid metadata User Identity: {} for {} at {}: {}",
+        QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kInvalidFileContent, identityError,
+                                            "Invalid metadata User Identity: {} for {} at {}: {}",
                                             stored->description(), identifier, directory, identityError.code()));
         return nullptr;
       }
       if (!owner->isEqualToUserIdentity(*userIdentity)) {
-        QRVFail(error, QRV_ERROR(kInvalid, "Incorrect User Identity: {}, expecting: {} for {} at {}: {}",
-                                 owner->shortDescription(), userIdentity->shortDescription(), identifier, directory,
-                                 identityError.code()));
+        QRVFail(error,
+                QRV_ERROR(QRVResultCode::kInvalidFileContent,
+                          "Incorrect User Identity: {}, expecting: {} for {} at {}: {}", owner->shortDescription(),
+                          userIdentity->shortDescription(), identifier, directory, identityError.code()));
         return nullptr;
       }
     } else {
@@ -295,7 +305,8 @@ QRVMetadataRef QRVMetadata::readAndValidateMetadataAtFileUrl(const std::string& 
         owner = userIdentityCache.userIdentityForPersonalPersonaWithUID(uid, uid);
       }
       if (!owner) {
-        QRVFail(error, QRV_ERROR(kInvalid, "Could not create user identity from {}: {}", describe(persona), 1));
+        QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidFileContent, "Could not create user identity from {}: {}",
+                                 describe(persona), 1));
         return nullptr;
       }
     }
@@ -304,15 +315,17 @@ QRVMetadataRef QRVMetadata::readAndValidateMetadataAtFileUrl(const std::string& 
   // 6. Info.
   const QRVPlist* info = dictionary.get(kInfoKey);
   if (info && !info->isDictionary()) {
-    QRVFail(error, QRV_ERROR(kInvalid, "Invalid metadata Info: {} at {}", info->description(), directory));
+    QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidFileContent, "Invalid metadata Info: {} at {}", info->description(),
+                             directory));
     return nullptr;
   }
 
   // 7. Name of the user-managed assets directory.
   const QRVPlist* assets = dictionary.get(kUserManagedAssetsDirNameKey);
   if (assets && !assets->isString()) {
-    QRVFail(error, QRV_ERROR(kInvalid, "Invalid metadata User Managed Dir Name String: {} at {}",
-                             assets->description(), directory));
+    QRVFail(error,
+            QRV_ERROR(QRVResultCode::kInvalidFileContent, "Invalid metadata User Managed Dir Name String: {} at {}",
+                      assets->description(), directory));
     return nullptr;
   }
 
@@ -320,7 +333,8 @@ QRVMetadataRef QRVMetadata::readAndValidateMetadataAtFileUrl(const std::string& 
   if (checkClassPath) {
     std::string expected, parent;
     if (!classPathMatches(directory, containerClass, &expected, &parent)) {
-      QRVFail(error, QRV_ERROR(kInvalid, "Invalid metadata-URLs should match: {} : {}", expected, parent));
+      QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidFileContent, "Invalid metadata-URLs should match: {} : {}",
+                               expected, parent));
       return nullptr;
     }
   }

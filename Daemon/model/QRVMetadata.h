@@ -46,10 +46,9 @@ class QRVMetadata {
   static constexpr const char* kPersonaKey = "QRVMetadataPersona";
   static constexpr const char* kVersion = "2";
 
-  // Codes of this component.
-  static constexpr uint64_t kUnreadable = 12;
-  static constexpr uint64_t kInvalid = 29;
-  static constexpr uint64_t kNotWritten = 34;
+  // Codes of this component: QRVResultCode::kFileUnreadable when the file
+  // cannot be read, kInvalidFileContent when it does not describe a valid
+  // container, kFileNotWritten when it cannot be written.
 
   // The file is a few hundred bytes plus the info values, which arrive in
   // client messages of at most 16 MiB; anything larger is not ours.

@@ -96,8 +96,9 @@ bool readNumber(const QRVPlist& plist, const char* key, uint64_t* out, QRVError*
     *out = static_cast<uint64_t>(v->realValue());
     return true;
   }
-  return QRVFail(error, QRV_ERROR(75, "Invalid user identity plist data. Expected number for {}, got {}. Data: {}",
-                                  key, typeName(v), plist.description()));
+  return QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidUserIdentityData,
+                                  "Invalid user identity plist data. Expected number for {}, got {}. Data: {}", key,
+                                  typeName(v), plist.description()));
 }
 
 }  // namespace
@@ -119,8 +120,9 @@ QRVUserIdentityRef QRVUserIdentity::fromVersion2(const QRVPlist& plist, QRVUserI
       !readNumber(plist, "type", &type, error))
     return nullptr;
   if (type >= 3) {
-    QRVFail(error, QRV_ERROR(75, "Invalid user identity plist data. Expected persona type for {}, got {}. Data: {}",
-                             "type", type, plist.description()));
+    QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidUserIdentityData,
+                             "Invalid user identity plist data. Expected persona type for {}, got {}. Data: {}", "type",
+                             type, plist.description()));
     return nullptr;
   }
   const QRVPlist* persona = plist.get("personaUniqueString");
@@ -129,7 +131,7 @@ QRVUserIdentityRef QRVUserIdentity::fromVersion2(const QRVPlist& plist, QRVUserI
     identity = cache.userIdentityForPersonaUniqueString(persona->stringValue(), static_cast<uid_t>(uid),
                                                         static_cast<gid_t>(gid));
     if (!identity) {
-      QRVFail(error, QRV_ERROR(1, "No user identity for persona {}", persona->stringValue()));
+      QRVFail(error, QRV_ERROR(QRVResultCode::kSuccess, "No user identity for persona {}", persona->stringValue()));
       return nullptr;
     }
     if (!identity->isEnterprise())
@@ -139,7 +141,7 @@ QRVUserIdentityRef QRVUserIdentity::fromVersion2(const QRVPlist& plist, QRVUserI
   }
   // A stored "unspecific" identity reads back as the personal one of its uid.
   identity = cache.userIdentityForPersonalPersonaWithUID(static_cast<uid_t>(uid), static_cast<gid_t>(gid));
-  if (!identity) QRVFail(error, QRV_ERROR(1, "No personal user identity for uid {}", uid));
+  if (!identity) QRVFail(error, QRV_ERROR(QRVResultCode::kSuccess, "No personal user identity for uid {}", uid));
   return identity;
 }
 
@@ -154,7 +156,7 @@ QRVUserIdentityRef QRVUserIdentity::fromVersion1(const QRVPlist& plist, QRVUserI
                                                         static_cast<gid_t>(gid));
   if (!identity)
     identity = cache.userIdentityForPersonalPersonaWithUID(static_cast<uid_t>(uid), static_cast<gid_t>(gid));
-  if (!identity) QRVFail(error, QRV_ERROR(1, "No personal user identity for uid {}", uid));
+  if (!identity) QRVFail(error, QRV_ERROR(QRVResultCode::kSuccess, "No personal user identity for uid {}", uid));
   return identity;
 }
 

@@ -47,8 +47,8 @@ Result guarded(QRVClientConnection& connection, QRVError* error, Result failed, 
   } catch (...) {
     if (connection.services().globalConfiguration->isInternalImage())
       QRVReportUncaughtException(std::current_exception());
-    QRVFail(error, QRV_ERROR(40, "Got exception: {} : {}", QRVExceptionDescription(std::current_exception()),
-                             "(no call stack)"));
+    QRVFail(error, QRV_ERROR(QRVResultCode::kException, "Got exception: {} : {}",
+                             QRVExceptionDescription(std::current_exception()), "(no call stack)"));
     return failed;
   }
 }
@@ -63,7 +63,8 @@ QRVMetadataRef QRVClientConnection::_existingContainer(const QRVContainerIdentit
   if (metadata && containerIdentity->uuid() && metadata->uuid() != *containerIdentity->uuid()) metadata = nullptr;
   if (metadata) return metadata;
   if (lookupError.code() == 0 || QRVContainerCache::isNotFoundError(lookupError))
-    QRVFail(error, QRV_ERROR_QUIET(21, "No Container with identity: {}", containerIdentity->description()));
+    QRVFail(error, QRV_ERROR_QUIET(QRVResultCode::kNoSuchContainer, "No Container with identity: {}",
+                                   containerIdentity->description()));
   else
     QRVFail(error, lookupError);
   return nullptr;
@@ -74,9 +75,10 @@ bool QRVClientConnection::_storeMetadata(const QRVMetadataRef& metadata, QRVErro
   QRVError cacheError;
   if (!services_->containerCache->addContainerMetadata(metadata, metadata->url(), metadata->transient(), true,
                                                        &cacheError))
-    return QRVFail(error, QRV_ERROR_UNDERLYING(45, cacheError, "Failed to add to cache: {}, url: {}, transient: {}",
-                                               metadata->description(), metadata->url(),
-                                               metadata->transient() ? 1 : 0));
+    return QRVFail(error,
+                   QRV_ERROR_UNDERLYING(QRVResultCode::kCacheAddFailed, cacheError,
+                                        "Failed to add to cache: {}, url: {}, transient: {}", metadata->description(),
+                                        metadata->url(), metadata->transient() ? 1 : 0));
   return true;
 }
 
@@ -86,7 +88,7 @@ std::optional<QRVPlist> QRVClientConnection::infoValueForKey(const QRVPlist& key
                                                              const QRVContainerIdentityRef& containerIdentity,
                                                              bool useLocking, QRVError* error) {
   if (!key.isString()) {
-    QRVFail(error, QRV_ERROR(38, "Can't get nil or non-KLString key: {}", key.description()));
+    QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidInput, "Can't get nil or non-KLString key: {}", key.description()));
     return std::nullopt;
   }
   return guarded<std::optional<QRVPlist>>(*this, error, std::nullopt, [&]() -> std::optional<QRVPlist> {
@@ -94,7 +96,8 @@ std::optional<QRVPlist> QRVClientConnection::infoValueForKey(const QRVPlist& key
     if (!metadata) return std::nullopt;
     const QRVPlist* value = metadata->info().get(key.stringValue());
     if (!value) {
-      QRVFail(error, QRV_ERROR_QUIET(24, "Didn't find info value for key: {}", key.stringValue()));
+      QRVFail(error, QRV_ERROR_QUIET(QRVResultCode::kInfoValueNotFound, "Didn't find info value for key: {}",
+                                     key.stringValue()));
       return std::nullopt;
     }
     return *value;
@@ -104,7 +107,9 @@ std::optional<QRVPlist> QRVClientConnection::infoValueForKey(const QRVPlist& key
 bool QRVClientConnection::setInfoValue(const QRVPlist& value, const QRVPlist& key,
                                        const QRVContainerIdentityRef& containerIdentity, bool useLocking,
                                        QRVError* error) {
-  if (!key.isString()) return QRVFail(error, QRV_ERROR(38, "Can't set nil or non-KLString key: {}", key.description()));
+  if (!key.isString())
+    return QRVFail(error,
+                   QRV_ERROR(QRVResultCode::kInvalidInput, "Can't set nil or non-KLString key: {}", key.description()));
   return guarded(*this, error, false, [&]() {
     // Read, change and write under one lock: two writers of different keys
     // must both see their value survive.
@@ -127,13 +132,14 @@ std::optional<std::string> QRVClientConnection::userManagedAssetsPathWithContain
     const QRVContainerIdentityRef& containerIdentity, bool isRelative, bool createIfNecessary, bool* existed,
     QRVError* error) {
   if (!containerIdentity) {
-    QRVFail(error, QRV_ERROR(38, "Can't act on a nil container identity"));
+    QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidInput, "Can't act on a nil container identity"));
     return std::nullopt;
   }
   const std::string& identifier = containerIdentity->identifier();
   if (!entitled_ && identifier != clientIdentity_->bundleIdentifier()) {
-    QRVFail(error, QRV_ERROR(38, "{} trying to retrieve path for identifier: {} without entitlement",
-                             clientIdentity_->bundleIdentifier(), identifier));
+    QRVFail(error,
+            QRV_ERROR(QRVResultCode::kInvalidInput, "{} trying to retrieve path for identifier: {} without entitlement",
+                      clientIdentity_->bundleIdentifier(), identifier));
     return std::nullopt;
   }
   return guarded<std::optional<std::string>>(*this, error, std::nullopt, [&]() -> std::optional<std::string> {
@@ -143,7 +149,7 @@ std::optional<std::string> QRVClientConnection::userManagedAssetsPathWithContain
       metadata = createOrLookupContainerWithContainerIdentity(containerIdentity, /*createIfNecessary=*/true,
                                                               /*transient=*/false, /*useLocking=*/true, &createError);
       if (!metadata) {
-        QRVFail(error, QRV_ERROR_UNDERLYING(11, createError,
+        QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kInvalidObject, createError,
                                             "Failed to create app data container for user managed assets path for "
                                             "{}: {}",
                                             identifier, createError.description()));
@@ -163,13 +169,14 @@ std::optional<std::string> QRVClientConnection::userManagedAssetsPathWithContain
       return !m.userManagedAssetsDirName().empty() && fm.itemExistsAtURL(m.url() + "/" + m.userManagedAssetsDirName());
     };
     if (metadata->url().empty()) {
-      QRVFail(error, QRV_ERROR(11, "No URL in container metadata object: {}", metadata->description()));
+      QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidObject, "No URL in container metadata object: {}",
+                               metadata->description()));
       return std::nullopt;
     }
     if (hasDirectory(*metadata)) return answer(*metadata, true);
     if (!createIfNecessary) {
-      QRVFail(error, QRV_ERROR(71, "User managed path for {}:{} Not Found", identifier,
-                               containerIdentity->containerClass()));
+      QRVFail(error, QRV_ERROR(QRVResultCode::kUserManagedPathNotFound, "User managed path for {}:{} Not Found",
+                               identifier, containerIdentity->containerClass()));
       return std::nullopt;
     }
 
@@ -184,8 +191,9 @@ std::optional<std::string> QRVClientConnection::userManagedAssetsPathWithContain
     std::optional<std::string> dir = fm.createTemporaryDirectoryInDirectoryURL(metadata->url(), kUserManagedAssetsPrefix,
                                                                                &step);
     if (!dir) {
-      QRVFail(error, QRV_ERROR_UNDERLYING(6, step, "Failed to create user managed assets dir at {}: {}",
-                                          metadata->url(), step.description()));
+      QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kSubdirectoryNotCreated, step,
+                                          "Failed to create user managed assets dir at {}: {}", metadata->url(),
+                                          step.description()));
       return std::nullopt;
     }
     // The file manager refuses a link put in the new directory's place.
@@ -194,7 +202,8 @@ std::optional<std::string> QRVClientConnection::userManagedAssetsPathWithContain
     const gid_t gid = metadata->userIdentity()->posixGIDForContainerClass(c);
     QRVError failure;
     if (!fm.setOwnerAndModeOfDirectoryAtURL(*dir, uid, gid, 0755, &step))
-      failure = QRV_ERROR_UNDERLYING(6, step, "Failed to set up user managed assets dir at {}", *dir);
+      failure = QRV_ERROR_UNDERLYING(QRVResultCode::kSubdirectoryNotCreated, step,
+                                     "Failed to set up user managed assets dir at {}", *dir);
     QRVMetadataRef updated;
     if (failure.code() == 0) {
       updated = metadata->withUserManagedAssetsDirName(QRVLastPathComponent(*dir));
@@ -215,7 +224,7 @@ bool QRVClientConnection::deleteUserManagedAssetWithContainerIdentity(const QRVC
                                                                       QRVError* error) {
   // An absolute path is no relative path, whatever it would resolve to.
   if (!containerIdentity || relativePath.empty() || relativePath.front() == '/')
-    return QRVFail(error, QRV_ERROR(11, "Can't act on invalid input: ID: {}, Path: {}",
+    return QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidObject, "Can't act on invalid input: ID: {}, Path: {}",
                                     containerIdentity ? containerIdentity->identifier() : "(null)", relativePath));
   return guarded(*this, error, false, [&]() {
     // The container may not move (new UUID, replace) while we work in it.
@@ -223,7 +232,8 @@ bool QRVClientConnection::deleteUserManagedAssetWithContainerIdentity(const QRVC
     QRVMetadataRef metadata = _existingContainer(containerIdentity, false, error);
     if (!metadata) return false;
     if (metadata->userManagedAssetsDirName().empty() || metadata->url().empty())
-      return QRVFail(error, QRV_ERROR(11, "No userManagedAssetsDirName or URL in container metadata object: {}",
+      return QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidObject,
+                                      "No userManagedAssetsDirName or URL in container metadata object: {}",
                                       metadata->description()));
     QRVFileManager& fm = *services_->fileManager;
     const std::string containerURL = metadata->url();
@@ -234,7 +244,7 @@ bool QRVClientConnection::deleteUserManagedAssetWithContainerIdentity(const QRVC
     std::optional<std::string> assets =
         fm.realPathForURL(containerURL + "/" + metadata->userManagedAssetsDirName(), containerURL);
     if (!containerReal || !assets || *assets != *containerReal + "/" + metadata->userManagedAssetsDirName())
-      return QRVFail(error, QRV_ERROR(10, "Unable to get realpath for resource {}",
+      return QRVFail(error, QRV_ERROR(QRVResultCode::kUnexpectedPath, "Unable to get realpath for resource {}",
                                       containerURL + "/" + metadata->userManagedAssetsDirName()));
 
     // The whole path, links included, must resolve inside the directory.
@@ -251,14 +261,17 @@ bool QRVClientConnection::deleteUserManagedAssetWithContainerIdentity(const QRVC
       target = parentReal ? std::optional<std::string>(*parentReal + "/" + last) : std::nullopt;
     }
     if (target && *target == *assets)
-      return QRVFail(error, QRV_ERROR(10, "Illegal attempt to delete user managed assets directory at {}", *assets));
+      return QRVFail(error, QRV_ERROR(QRVResultCode::kUnexpectedPath,
+                                      "Illegal attempt to delete user managed assets directory at {}", *assets));
     if (!target || !isInside(*target, *assets))
-      return QRVFail(error, QRV_ERROR(10, "Illegal attempt to delete asset not residing in user managed assets "
-                                          "directory {}",
+      return QRVFail(error, QRV_ERROR(QRVResultCode::kUnexpectedPath,
+                                      "Illegal attempt to delete asset not residing in user managed assets "
+                                      "directory {}",
                                       *assets));
     QRVError removeError;
     if (!fm.removeItemAtURL(*target, &removeError))
-      return QRVFail(error, QRV_ERROR_UNDERLYING(41, removeError, "Failed to remove asset at {}", *target));
+      return QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kDeathRowMoveFailed, removeError,
+                                                 "Failed to remove asset at {}", *target));
     return true;
   });
 }
@@ -270,19 +283,20 @@ std::optional<std::string> QRVClientConnection::stageSharedContentForIdentifier(
                                                                                 const std::string& destRelativePath,
                                                                                 QRVError* error) {
   if (identifier.empty() || sourceRelativePath.empty() || destRelativePath.empty()) {
-    QRVFail(error, QRV_ERROR(11, "Can't act on invalid input: ID: {}, source: {}, dest: {}", identifier,
-                             sourceRelativePath, destRelativePath));
+    QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidObject, "Can't act on invalid input: ID: {}, source: {}, dest: {}",
+                             identifier, sourceRelativePath, destRelativePath));
     return std::nullopt;
   }
   if (QRVContainsDotDotPathComponents(sourceRelativePath) || QRVContainsDotDotPathComponents(destRelativePath)) {
-    QRVFail(error, QRV_ERROR(38, "Paths can't contain dots. source: {}, dest: {}", sourceRelativePath,
-                             destRelativePath));
+    QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidInput, "Paths can't contain dots. source: {}, dest: {}",
+                             sourceRelativePath, destRelativePath));
     return std::nullopt;
   }
   const std::string& caller = clientIdentity_->bundleIdentifier();
   std::vector<std::string> groups = services_->systemGroups->systemGroupIdentifiersForIdentifier(caller);
   if (std::find(groups.begin(), groups.end(), identifier) == groups.end()) {
-    QRVFail(error, QRV_ERROR(55, "{} not entitled for system group container {}", caller, identifier));
+    QRVFail(error, QRV_ERROR(QRVResultCode::kNotEntitled, "{} not entitled for system group container {}", caller,
+                             identifier));
     return std::nullopt;
   }
   return guarded<std::optional<std::string>>(*this, error, std::nullopt, [&]() -> std::optional<std::string> {
@@ -297,38 +311,44 @@ std::optional<std::string> QRVClientConnection::stageSharedContentForIdentifier(
         systemUser, identifier, QRVContainerClassSystemGroup, &step);
     QRVMetadataRef group = groupIdentity ? cache.containerForContainerIdentity(*groupIdentity, &step) : nullptr;
     if (!group) {
-      QRVFail(error, QRV_ERROR(21, "System group container with identifier {} not found: {}", identifier,
-                               step.description()));
+      QRVFail(error,
+              QRV_ERROR(QRVResultCode::kNoSuchContainer, "System group container with identifier {} not found: {}",
+                        identifier, step.description()));
       return std::nullopt;
     }
     QRVContainerIdentityRef ownIdentity =
         QRVContainerIdentity::containerIdentityWithUserIdentity(systemUser, caller, QRVContainerClassSystemData, &step);
     QRVMetadataRef own = ownIdentity ? cache.containerForContainerIdentity(*ownIdentity, &step) : nullptr;
     if (!own) {
-      QRVFail(error, QRV_ERROR(21, "No Container with identity: {}", ownIdentity ? ownIdentity->description() : caller));
+      QRVFail(error, QRV_ERROR(QRVResultCode::kNoSuchContainer, "No Container with identity: {}",
+                               ownIdentity ? ownIdentity->description() : caller));
       return std::nullopt;
     }
     QRVFileManager& fm = *services_->fileManager;
     std::optional<std::string> source = fm.realPathForURL(own->url() + "/" + sourceRelativePath, own->url());
     if (!source || !isInside(*source, own->url())) {
-      QRVFail(error, QRV_ERROR(10, "Invalid source URL {} for {} at {}", sourceRelativePath, caller, own->url()));
+      QRVFail(error, QRV_ERROR(QRVResultCode::kUnexpectedPath, "Invalid source URL {} for {} at {}", sourceRelativePath,
+                               caller, own->url()));
       return std::nullopt;
     }
     std::optional<std::string> dest = fm.realPathForURL(group->url() + "/" + destRelativePath, group->url());
     if (!dest || !isInside(*dest, group->url())) {
-      QRVFail(error, QRV_ERROR(10, "Invalid dest URL {} for {} at {}", destRelativePath, identifier, group->url()));
+      QRVFail(error, QRV_ERROR(QRVResultCode::kUnexpectedPath, "Invalid dest URL {} for {} at {}", destRelativePath,
+                               identifier, group->url()));
       return std::nullopt;
     }
     // The item becomes content of the group container, not its top level:
     // it gets the ACLs of the entries inside one.
     if (!fm.standardizeACLsAtURL(*source, false, &step)) {
-      QRVFail(error, QRV_ERROR_UNDERLYING(63, step, "Failed to standardize ACLs for {} at {}: {}", caller, *source,
-                                          step.description()));
+      QRVFail(error,
+              QRV_ERROR_UNDERLYING(QRVResultCode::kACLsNotStandardized, step,
+                                   "Failed to standardize ACLs for {} at {}: {}", caller, *source, step.description()));
       return std::nullopt;
     }
     if (!fm.moveItemAtURL(*source, *dest, &step)) {
-      QRVFail(error, QRV_ERROR_UNDERLYING(64, step, "Failed move for {} from {} to: {}: {}", caller, *source, *dest,
-                                          step.description()));
+      QRVFail(error,
+              QRV_ERROR_UNDERLYING(QRVResultCode::kSharedContentNotMoved, step, "Failed move for {} from {} to: {}: {}",
+                                   caller, *source, *dest, step.description()));
       return std::nullopt;
     }
     return dest;
@@ -376,7 +396,8 @@ QRVMetadataRef QRVClientConnection::regenerateDirectoryUUIDWithContainerIdentity
     const std::string oldURL = metadata->url();
     const std::string name = QRVLastPathComponent(oldURL);
     if (!QRVUUID::fromString(name)) {
-      QRVFail(error, QRV_ERROR(11, "Non-UUID last path component: {} for {}", name, metadata->description()));
+      QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidObject, "Non-UUID last path component: {} for {}", name,
+                               metadata->description()));
       return nullptr;
     }
     const QRVUUID uuid = QRVUUID::random();
@@ -384,7 +405,8 @@ QRVMetadataRef QRVClientConnection::regenerateDirectoryUUIDWithContainerIdentity
     QRVFileManager& fm = *services_->fileManager;
     QRVError step;
     if (!fm.moveItemAtURL(oldURL, newURL, &step)) {
-      QRVFail(error, QRV_ERROR_UNDERLYING(48, step, "Failed to move dir: {} to new UUID dir: {}", oldURL, newURL));
+      QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kNewUUIDMoveFailed, step,
+                                          "Failed to move dir: {} to new UUID dir: {}", oldURL, newURL));
       return nullptr;
     }
     QRVMetadataRef updated = metadata->withURL(newURL)->withUUID(uuid);
@@ -399,8 +421,9 @@ QRVMetadataRef QRVClientConnection::regenerateDirectoryUUIDWithContainerIdentity
     // From here the disk is consistent under the new UUID; a cache that
     // failed to take it finds it again when it next reads the disk.
     if (!services_->containerCache->addContainerMetadata(updated, newURL, updated->transient(), true, &step)) {
-      QRVFail(error, QRV_ERROR_UNDERLYING(45, step, "Failed to add to cache: {}, url: {}, transient: {}",
-                                          updated->description(), newURL, updated->transient() ? 1 : 0));
+      QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kCacheAddFailed, step,
+                                          "Failed to add to cache: {}, url: {}, transient: {}", updated->description(),
+                                          newURL, updated->transient() ? 1 : 0));
       return nullptr;
     }
     return updated;

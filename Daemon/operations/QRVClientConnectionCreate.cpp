@@ -85,7 +85,8 @@ bool QRVClientConnection::_createSubDirectories(const std::string& url, const QR
     std::string path = url + "/" + name;
     QRVError underlying;
     if (!services_->fileManager->createDirectoryBelowURL(url, name, 0755, owner, toSet, &underlying))
-      return QRVFail(error, QRV_ERROR_UNDERLYING(6, underlying, "Failed to create sub-dir for {} at {} (protClass: {})",
+      return QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kSubdirectoryNotCreated, underlying,
+                                                 "Failed to create sub-dir for {} at {} (protClass: {})",
                                                  metadata.identifier(), path, cls));
   }
   return true;
@@ -95,7 +96,7 @@ QRVMetadataRef QRVClientConnection::createOrLookupContainerWithContainerIdentity
     const QRVContainerIdentityRef& containerIdentity, bool createIfNecessary, bool transient, bool useLocking,
     QRVError* error) {
   if (!containerIdentity) {
-    QRVFail(error, QRV_ERROR(38, "Cannot lookup a nil container identity."));
+    QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidInput, "Cannot lookup a nil container identity."));
     return nullptr;
   }
   const std::string& identifier = containerIdentity->identifier();
@@ -109,8 +110,9 @@ QRVMetadataRef QRVClientConnection::createOrLookupContainerWithContainerIdentity
                  unrestricted_ || isEntitledForLookupWithClass(containerClass, identifier) ||
                  wellKnown.isLookupWhitelistedFromCodeSignIdentifier(caller, containerClass, identifier);
   if (!allowed) {
-    QRVFail(error, QRV_ERROR(55, "{} not entitled to retrieve container class {} with identifier {}", caller,
-                             containerClass, identifier));
+    QRVFail(error,
+            QRV_ERROR(QRVResultCode::kNotEntitled, "{} not entitled to retrieve container class {} with identifier {}",
+                      caller, containerClass, identifier));
     return nullptr;
   }
   // A system data container is only ever the caller's own, unless granted.
@@ -118,7 +120,8 @@ QRVMetadataRef QRVClientConnection::createOrLookupContainerWithContainerIdentity
       !isEntitledForLookupWithClass(QRVContainerClassSystemData, identifier) &&
       !wellKnown.isLookupWhitelistedFromCodeSignIdentifier(caller, QRVContainerClassSystemData, identifier) &&
       !(services_->codeSigning->identifierHasSystemContainer(identifier) && identifier == caller)) {
-    QRVFail(error, QRV_ERROR(55, "{} not entitled for system container with identifier {}", caller, identifier));
+    QRVFail(error, QRV_ERROR(QRVResultCode::kNotEntitled, "{} not entitled for system container with identifier {}",
+                             caller, identifier));
     return nullptr;
   }
 
@@ -138,7 +141,8 @@ QRVMetadataRef QRVClientConnection::createOrLookupContainerWithContainerIdentity
     }
     if (!createIfNecessary) {
       // Transient containers are never merely looked up.
-      QRVFail(error, QRV_ERROR_QUIET(21, "Container with identifier: \"{}\" Not Found", identifier));
+      QRVFail(error, QRV_ERROR_QUIET(QRVResultCode::kNoSuchContainer, "Container with identifier: \"{}\" Not Found",
+                                     identifier));
       return nullptr;
     }
 
@@ -151,7 +155,8 @@ QRVMetadataRef QRVClientConnection::createOrLookupContainerWithContainerIdentity
       // A transient request always gets a fresh, empty container.
       QRVError moveError;
       if (!_moveItemAtURLToDeathRow(found->url(), /*isDir=*/true, /*startDeletionThread=*/true, &moveError)) {
-        QRVFail(error, QRV_ERROR_UNDERLYING(5, moveError, "Failed to remove transient container at {}", found->url()));
+        QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kTransientNotRemoved, moveError,
+                                            "Failed to remove transient container at {}", found->url()));
         return nullptr;
       }
     } else if (!QRVContainerCache::isNotFoundError(lookupError)) {
@@ -168,8 +173,8 @@ QRVMetadataRef QRVClientConnection::createOrLookupContainerWithContainerIdentity
     QRVError step;
     if (!_createTopLevelContainerDirectory(staging, containerClass, userIdentity->posixUIDForContainerClass(containerClass),
                                            &step)) {
-      QRVFail(error, QRV_ERROR_UNDERLYING(7, step, "Failed to create staging dir at \"{}\": {}", staging,
-                                          step.description()));
+      QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kStagingNotCreated, step,
+                                          "Failed to create staging dir at \"{}\": {}", staging, step.description()));
       return nullptr;
     }
     QRVCrashPoint(*services_, "create.staged");
@@ -191,7 +196,7 @@ QRVMetadataRef QRVClientConnection::createOrLookupContainerWithContainerIdentity
     std::optional<std::string> parent = config.containerDirectoryURLForUserIdentity(userIdentity, containerClass,
                                                                                     transient);
     if (!parent) {
-      QRVFail(error, QRV_ERROR(11, "Invalid object: container class = {}", containerClass));
+      QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidObject, "Invalid object: container class = {}", containerClass));
       return nullptr;
     }
     std::optional<std::string> wellKnownName;
@@ -202,8 +207,11 @@ QRVMetadataRef QRVClientConnection::createOrLookupContainerWithContainerIdentity
     }
     const std::string live = *parent + "/" + (wellKnownName ? *wellKnownName : uuid.string());
     if (!fm.moveItemAtURL(staging, live, &step)) {
-      QRVError moveError = QRV_ERROR_UNDERLYING(8, step, "Failed to move staging dir: {} to live dir: {}", staging, live);
-      if (!fm.removeItemAtURL(staging, &step)) moveError = QRV_ERROR_UNDERLYING(9, step, "Failed to remove staging dir: {}", staging);
+      QRVError moveError = QRV_ERROR_UNDERLYING(QRVResultCode::kNotMovedLive, step,
+                                                "Failed to move staging dir: {} to live dir: {}", staging, live);
+      if (!fm.removeItemAtURL(staging, &step))
+        moveError =
+            QRV_ERROR_UNDERLYING(QRVResultCode::kStagingNotRemoved, step, "Failed to remove staging dir: {}", staging);
       QRVFail(error, moveError);
       return nullptr;
     }
@@ -213,15 +221,16 @@ QRVMetadataRef QRVClientConnection::createOrLookupContainerWithContainerIdentity
 
     metadata = metadata->withURL(live)->withExisted(false)->withTransient(transient);
     if (!cache.addContainerMetadata(metadata, live, transient, true, &step)) {
-      QRVFail(error, QRV_ERROR_UNDERLYING(45, step, "Failed to add to cache: {}, url: {}, transient: {}",
-                                          concrete->description(), live, transient ? 1 : 0));
+      QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kCacheAddFailed, step,
+                                          "Failed to add to cache: {}, url: {}, transient: {}", concrete->description(),
+                                          live, transient ? 1 : 0));
       return nullptr;
     }
     return metadata;
   } catch (...) {
     if (services_->globalConfiguration->isInternalImage()) QRVReportUncaughtException(std::current_exception());
-    QRVFail(error, QRV_ERROR(40, "Got exception: {} : {}", QRVExceptionDescription(std::current_exception()),
-                             "(no call stack)"));
+    QRVFail(error, QRV_ERROR(QRVResultCode::kException, "Got exception: {} : {}",
+                             QRVExceptionDescription(std::current_exception()), "(no call stack)"));
     return nullptr;
   }
 }
@@ -232,7 +241,8 @@ QRVMetadataRef QRVClientConnection::metadataWithContainerIdentity(const QRVConta
       containerIdentity, /*createIfNecessary=*/false, /*transient=*/false, /*useLocking=*/true, error);
   if (metadata && containerIdentity->uuid() && metadata->uuid() != *containerIdentity->uuid()) {
     // The identifier has a container, but not the one the caller named.
-    QRVFail(error, QRV_ERROR_QUIET(21, "Container with identifier: \"{}\" Not Found", containerIdentity->identifier()));
+    QRVFail(error, QRV_ERROR_QUIET(QRVResultCode::kNoSuchContainer, "Container with identifier: \"{}\" Not Found",
+                                   containerIdentity->identifier()));
     return nullptr;
   }
   return metadata;
@@ -242,7 +252,7 @@ std::optional<std::vector<QRVMetadataRef>> QRVClientConnection::containersWithCl
                                                                                       bool transient,
                                                                                       QRVError* error) {
   if (!QRVContainerClassIsValid(containerClass)) {
-    QRVFail(error, QRV_ERROR(11, "Invalid object: container class = {}", containerClass));
+    QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidObject, "Invalid object: container class = {}", containerClass));
     return std::nullopt;
   }
   QRVUserIdentityRef userIdentity = QRVUserIdentity::isUserIdentityRequiredForContainerClass(containerClass)

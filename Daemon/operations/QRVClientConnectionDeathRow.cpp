@@ -18,7 +18,8 @@ bool removeItemOrMoveToTemp(QRVServices& services, const std::string& url, QRVEr
   QRVLogDebug("Couldn't remove, so moving item to /tmp: {} : {}", url, underlying.description());
   std::string destination = services.globalConfiguration->pathUnderRoot("/tmp/") + QRVLastPathComponent(url);
   if (!fm.moveItemAtURL(url, destination, &underlying))
-    return QRVFail(error, QRV_ERROR_UNDERLYING(4, underlying, "Failed to move dir: {} to: {}", url, destination));
+    return QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kMoveToTmpFailed, underlying,
+                                               "Failed to move dir: {} to: {}", url, destination));
   return true;
 }
 
@@ -32,13 +33,15 @@ bool QRVClientConnection::_moveItemAtURLToDeathRow(const std::string& url, bool 
   QRVError underlying;
   std::optional<std::string> unique = fm.createTemporaryDirectoryInDirectoryURL(deathRow, &underlying);
   if (!unique)
-    return QRVFail(error, QRV_ERROR_UNDERLYING(41, underlying, "Failed to create unique directory at: {}", deathRow));
+    return QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kDeathRowMoveFailed, underlying,
+                                               "Failed to create unique directory at: {}", deathRow));
   std::string destination = *unique + "/" + QRVLastPathComponent(url);
   // Files and directories move alike on Linux; `isDir` only names the kind.
   (void)isDir;
   if (!fm.moveItemAtURL(url, destination, &underlying)) {
     if (!(underlying.isPOSIX() && underlying.code() == ENOENT))
-      return QRVFail(error, QRV_ERROR_UNDERLYING(41, underlying, "Failed to move item at: {} to: {}", url, destination));
+      return QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kDeathRowMoveFailed, underlying,
+                                                 "Failed to move item at: {} to: {}", url, destination));
   }
   if (startDeletionThread) deleteContainersOnDeathRowWithCompletion(nullptr);
   return true;

@@ -73,7 +73,8 @@ bool QRVClientConnection::_writeToDiskReplaceAt(const std::string& url, const st
                                                 const std::string& newURL, const std::string& stagingURL,
                                                 const std::string& destinationURL, QRVError* error) {
   if (oldURL.empty() || newURL.empty() || stagingURL.empty() || destinationURL.empty())
-    return QRVFail(error, QRV_ERROR(33, "Invalid Replace File Info: old: {}, new: {}, staging: {}, dest: {}", oldURL,
+    return QRVFail(error, QRV_ERROR(QRVResultCode::kFileMissingField,
+                                    "Invalid Replace File Info: old: {}, new: {}, staging: {}, dest: {}", oldURL,
                                     newURL, stagingURL, destinationURL));
   QRVPlist journal = QRVPlist::dictionary()
                          .set(kOldURLKey, QRVPlist::string(oldURL))
@@ -82,7 +83,8 @@ bool QRVClientConnection::_writeToDiskReplaceAt(const std::string& url, const st
                          .set(kDestURLKey, QRVPlist::string(destinationURL));
   QRVError underlying;
   if (!QRV_writeToURL(*services_->fileManager, journal, url, &underlying))
-    return QRVFail(error, QRV_ERROR_UNDERLYING(34, underlying, "Failed to write replace dictionary to URL {}", url));
+    return QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kFileNotWritten, underlying,
+                                               "Failed to write replace dictionary to URL {}", url));
   return true;
 }
 
@@ -91,9 +93,11 @@ std::optional<QRVPlist> QRVClientConnection::_readAndValidateReplaceFileAtUrl(co
   std::optional<QRVPlist> journal = QRV_dictionaryWithContentsOfURL(*services_->fileManager, url, &underlying);
   if (!journal) {
     if (underlying.isPOSIX()) {
-      QRVFail(error, QRV_ERROR_UNDERLYING(35, underlying, "Failed to read replace file at URL {}", url));
+      QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kFileUnreadableOrRollbackFailed, underlying,
+                                          "Failed to read replace file at URL {}", url));
     } else {
-      QRVFail(error, QRV_ERROR_UNDERLYING(35, underlying, "Bad Data in replace file: {}", url));
+      QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kFileUnreadableOrRollbackFailed, underlying,
+                                          "Bad Data in replace file: {}", url));
     }
     return std::nullopt;
   }
@@ -105,8 +109,9 @@ std::optional<QRVPlist> QRVClientConnection::_readAndValidateReplaceFileAtUrl(co
   std::string oldURL = path(kOldURLKey), newURL = path(kNewURLKey), staging = path(kStagingURLKey),
               dest = path(kDestURLKey);
   if (oldURL.empty() || newURL.empty() || staging.empty() || dest.empty()) {
-    QRVFail(error, QRV_ERROR(35, "Invalid replace data: Old: {}, New: {}, Staging: {}, Dest: {}", oldURL, newURL,
-                             staging, dest));
+    QRVFail(error,
+            QRV_ERROR(QRVResultCode::kFileUnreadableOrRollbackFailed,
+                      "Invalid replace data: Old: {}, New: {}, Staging: {}, Dest: {}", oldURL, newURL, staging, dest));
     return std::nullopt;
   }
   return QRVPlist::dictionary()
@@ -141,15 +146,16 @@ bool QRVClientConnection::_recoverFromReplaceOperationsWithError(QRVError* error
         QRVLogNotice("Recovering from failed replace by moving: {} to {}", staging, oldURL);
         QRVError moveError;
         if (!fm.moveItemAtURL(staging, oldURL, &moveError))
-          return QRVFail(
-              error, QRV_ERROR_UNDERLYING(35, moveError, "Failed to recover replace move: {} to {}", staging, oldURL));
+          return QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kFileUnreadableOrRollbackFailed, moveError,
+                                                     "Failed to recover replace move: {} to {}", staging, oldURL));
       }
     } else {
       QRVLogError("Discarding replace file {}: {}", journalURL, readError.description());
     }
     QRVError discardError;
     if (!_moveItemAtURLToDeathRow(journalURL, /*isDir=*/false, /*startDeletionThread=*/false, &discardError))
-      return QRVFail(error, QRV_ERROR_UNDERLYING(36, discardError, "Failed to remove replace file at {}", journalURL));
+      return QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kFileNotMovedOrRemoved, discardError,
+                                                 "Failed to remove replace file at {}", journalURL));
   }
   return true;
 }
@@ -157,24 +163,30 @@ bool QRVClientConnection::_recoverFromReplaceOperationsWithError(QRVError* error
 bool QRVClientConnection::replaceContainerIdentity(const QRVContainerIdentityRef& oldIdentity,
                                                    const QRVContainerIdentityRef& newIdentity, bool preserveOldUUID,
                                                    bool startDeletionThread, QRVError* error) {
-  if (!oldIdentity || !newIdentity) return QRVFail(error, QRV_ERROR(38, "Cannot lookup a nil container identity."));
+  if (!oldIdentity || !newIdentity)
+    return QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidInput, "Cannot lookup a nil container identity."));
   const QRVContainerClass containerClass = newIdentity->containerClass();
   if (!newIdentity->uuid())
     return QRVFail(error,
-                   QRV_ERROR(11, "Can't act on an invalid object: newUUID: {}, Class: {}", "(null)", containerClass));
+                   QRV_ERROR(QRVResultCode::kInvalidObject, "Can't act on an invalid object: newUUID: {}, Class: {}",
+                             "(null)", containerClass));
   if (!QRVContainerClassIsValid(containerClass))
-    return QRVFail(error, QRV_ERROR(11, "Can't act on an invalid container class: {}", containerClass));
+    return QRVFail(
+        error, QRV_ERROR(QRVResultCode::kInvalidObject, "Can't act on an invalid container class: {}", containerClass));
   if (oldIdentity->containerClass() != containerClass)
-    return QRVFail(error, QRV_ERROR(23, "Can't replace containers of different class types: {} and {}",
+    return QRVFail(error, QRV_ERROR(QRVResultCode::kDifferentClasses,
+                                    "Can't replace containers of different class types: {} and {}",
                                     oldIdentity->containerClass(), containerClass));
   if (preserveOldUUID && !oldIdentity->uuid())
-    return QRVFail(error, QRV_ERROR(11, "Can't have a nil oldContainerUUID when preserving the UUID"));
+    return QRVFail(
+        error, QRV_ERROR(QRVResultCode::kInvalidObject, "Can't have a nil oldContainerUUID when preserving the UUID"));
   const QRVUserIdentityRef& userIdentity = oldIdentity->userIdentity();
   if (!QRVUserIdentityEqual()(userIdentity, newIdentity->userIdentity()))
-    return QRVFail(error,
-                   QRV_ERROR(76, "Can't replace containers of different personas: {} and {}",
-                             userIdentity ? userIdentity->description() : "(null)",
-                             newIdentity->userIdentity() ? newIdentity->userIdentity()->description() : "(null)"));
+    return QRVFail(
+        error,
+        QRV_ERROR(QRVResultCode::kDifferentUserIdentities, "Can't replace containers of different personas: {} and {}",
+                  userIdentity ? userIdentity->description() : "(null)",
+                  newIdentity->userIdentity() ? newIdentity->userIdentity()->description() : "(null)"));
 
   QRVFileManager& fm = *services_->fileManager;
   QRVGlobalConfiguration& config = *services_->globalConfiguration;
@@ -198,7 +210,8 @@ bool QRVClientConnection::replaceContainerIdentity(const QRVContainerIdentityRef
     };
     auto notFound = [&](const QRVContainerIdentity& identity) {
       if (!cacheError.code())
-        return QRVFail(error, QRV_ERROR(21, "No Container with identity: {}", identity.description()));
+        return QRVFail(error, QRV_ERROR(QRVResultCode::kNoSuchContainer, "No Container with identity: {}",
+                                        identity.description()));
       return QRVFail(error, cacheError);
     };
     QRVMetadataRef oldMetadata = find(*oldIdentity, false);
@@ -207,28 +220,33 @@ bool QRVClientConnection::replaceContainerIdentity(const QRVContainerIdentityRef
     if (!newMetadata) return notFound(*newIdentity);
     const std::string oldURL = QRVPathWithoutTrailingSlashes(oldMetadata->url());
     const std::string newURL = QRVPathWithoutTrailingSlashes(newMetadata->url());
-    if (oldURL == newURL) return QRVFail(error, QRV_ERROR(22, "Can't replace the same container at {}", oldURL));
+    if (oldURL == newURL)
+      return QRVFail(error, QRV_ERROR(QRVResultCode::kSameContainer, "Can't replace the same container at {}", oldURL));
     if (!QRVUUID::fromString(QRVLastPathComponent(newURL)))
-      return QRVFail(error, QRV_ERROR(10, "Invalid URL (last path component not UUID): {}", newURL));
+      return QRVFail(
+          error, QRV_ERROR(QRVResultCode::kUnexpectedPath, "Invalid URL (last path component not UUID): {}", newURL));
 
     const QRVUUID keptUUID = preserveOldUUID ? *oldIdentity->uuid() : *newIdentity->uuid();
     const bool transient = oldMetadata->transient();
     std::optional<std::string> parent =
         config.containerDirectoryURLForUserIdentity(userIdentity, containerClass, transient);
-    if (!parent) return QRVFail(error, QRV_ERROR(11, "Can't act on an invalid container class: {}", containerClass));
+    if (!parent)
+      return QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidObject, "Can't act on an invalid container class: {}",
+                                      containerClass));
     const std::string dest = QRVPathWithoutTrailingSlashes(*parent) + "/" + keptUUID.string();
     // When the old UUID is kept the destination is the old directory's own
     // place, which the first rename empties.
     if (dest != oldURL) {
-      if (fm.itemExistsAtURL(dest)) return QRVFail(error, QRV_ERROR(27, "Container already exists at {}", dest));
+      if (fm.itemExistsAtURL(dest))
+        return QRVFail(error, QRV_ERROR(QRVResultCode::kDestinationExists, "Container already exists at {}", dest));
       QRVError listError;
       auto existing = cache.allContainersForUserIdentity(userIdentity, containerClass, transient, &listError);
       if (existing) {
         for (const QRVMetadataRef& m : *existing) {
           if (QRVPathWithoutTrailingSlashes(m->url()) == dest)
-            return QRVFail(error,
-                           QRV_ERROR(27, "Container with identifier: {}, class: {}, transient: {} already exists",
-                                     m->identifier(), containerClass, transient ? 1 : 0));
+            return QRVFail(error, QRV_ERROR(QRVResultCode::kDestinationExists,
+                                            "Container with identifier: {}, class: {}, transient: {} already exists",
+                                            m->identifier(), containerClass, transient ? 1 : 0));
         }
       }
     }
@@ -248,14 +266,15 @@ bool QRVClientConnection::replaceContainerIdentity(const QRVContainerIdentityRef
 
     // Park the old directory; from here on the journal knows where it is.
     if (!fm.moveItemAtURL(oldURL, staging, &step))
-      return QRVFail(error, QRV_ERROR_UNDERLYING(14, step, "Failed to move old {} to staging {}", oldURL, staging));
+      return QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kOldNotMovedAside, step,
+                                                 "Failed to move old {} to staging {}", oldURL, staging));
     if (!cache.removeContainerForUserIdentity(userIdentity, containerClass, oldMetadata->identifier(), transient,
                                               &step))
-      return QRVFail(error,
-                     QRV_ERROR_UNDERLYING(46, step, "Failed to remove from cache id: {}, class: {}, transient: {}",
-                                          oldMetadata->identifier(), containerClass, transient ? 1 : 0));
+      return QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kCacheRemoveFailed, step,
+                                                 "Failed to remove from cache id: {}, class: {}, transient: {}",
+                                                 oldMetadata->identifier(), containerClass, transient ? 1 : 0));
     if (services_->codeSigning->invalidateCodeSigningInfoForIdentifierAndItsChildren(oldMetadata->identifier()) !=
-        QRVError::kSuccess)
+        QRVResultCode::kSuccess)
       QRVLogError("Failed to invalidate code signing info for {}", oldMetadata->identifier());
     QRVCrashPoint(*services_, "replace.old-parked");
 
@@ -265,21 +284,22 @@ bool QRVClientConnection::replaceContainerIdentity(const QRVContainerIdentityRef
     if (keptUUID != newMetadata->uuid() && !placed->withURL(newURL)->writeMetadataToDisk(fm, config, &step)) {
       QRVError backError;
       if (!fm.moveItemAtURL(staging, oldURL, &backError))
-        return QRVFail(
-            error, QRV_ERROR_UNDERLYING(35, backError, "Failed to recover replace move: {} to {}", staging, oldURL));
+        return QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kFileUnreadableOrRollbackFailed, backError,
+                                                   "Failed to recover replace move: {} to {}", staging, oldURL));
       cache.addContainerMetadata(oldMetadata, oldURL, transient, true, nullptr);
       _moveItemAtURLToDeathRow(journalURL, /*isDir=*/false, /*startDeletionThread=*/false, nullptr);
-      return QRVFail(error, QRV_ERROR_UNDERLYING(45, step, "Failed to add to cache: {}, url: {}, transient: {}",
+      return QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kCacheAddFailed, step,
+                                                 "Failed to add to cache: {}, url: {}, transient: {}",
                                                  newIdentity->description(), dest, transient ? 1 : 0));
     }
 
     if (!fm.moveItemAtURL(newURL, dest, &step)) {
-      QRVError replaceError =
-          QRV_ERROR_UNDERLYING(15, step, "Failed to replace: {} with: {} at: {}", oldURL, newURL, dest);
+      QRVError replaceError = QRV_ERROR_UNDERLYING(QRVResultCode::kNewNotMovedIntoPlace, step,
+                                                   "Failed to replace: {} with: {} at: {}", oldURL, newURL, dest);
       QRVError backError;
       if (!fm.moveItemAtURL(staging, oldURL, &backError))
-        return QRVFail(
-            error, QRV_ERROR_UNDERLYING(35, backError, "Failed to recover replace move: {} to {}", staging, oldURL));
+        return QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kFileUnreadableOrRollbackFailed, backError,
+                                                   "Failed to recover replace move: {} to {}", staging, oldURL));
       // The old container is back where it was: the journal is moot, and
       // the cache learns of it again.
       cache.addContainerMetadata(oldMetadata, oldURL, transient, true, nullptr);
@@ -293,48 +313,56 @@ bool QRVClientConnection::replaceContainerIdentity(const QRVContainerIdentityRef
     if (!cache.removeContainerForUserIdentity(userIdentity, containerClass, newMetadata->identifier(),
                                               newMetadata->transient(), &step))
       return QRVFail(error,
-                     QRV_ERROR_UNDERLYING(46, step, "Failed to remove from cache id: {}, class: {}, transient: {}",
+                     QRV_ERROR_UNDERLYING(QRVResultCode::kCacheRemoveFailed, step,
+                                          "Failed to remove from cache id: {}, class: {}, transient: {}",
                                           newMetadata->identifier(), containerClass, newMetadata->transient() ? 1 : 0));
     if (oldMetadata->identifier() != newMetadata->identifier())
       cache.setSandboxContainerMappingForUserIdentity(userIdentity, oldMetadata->identifier(), containerClass,
                                                       std::nullopt);
     if (!cache.addContainerMetadata(placed, dest, transient, true, &step))
-      return QRVFail(error, QRV_ERROR_UNDERLYING(45, step, "Failed to add to cache: {}, url: {}, transient: {}",
+      return QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kCacheAddFailed, step,
+                                                 "Failed to add to cache: {}, url: {}, transient: {}",
                                                  newIdentity->description(), dest, transient ? 1 : 0));
     QRVCrashPoint(*services_, "replace.cache-updated");
 
     if (!_moveItemAtURLToDeathRow(staging, true, startDeletionThread, &step))
-      return QRVFail(error, QRV_ERROR_UNDERLYING(36, step, "Failed to remove staging dir: {}", staging));
+      return QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kFileNotMovedOrRemoved, step,
+                                                 "Failed to remove staging dir: {}", staging));
     QRVCrashPoint(*services_, "replace.staging-removed");
     if (!_moveItemAtURLToDeathRow(journalURL, /*isDir=*/false, /*startDeletionThread=*/false, &step))
-      return QRVFail(error, QRV_ERROR_UNDERLYING(36, step, "Failed to remove replace file: {}", journalURL));
+      return QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kFileNotMovedOrRemoved, step,
+                                                 "Failed to remove replace file: {}", journalURL));
     return true;
   } catch (...) {
     if (config.isInternalImage()) QRVReportUncaughtException(std::current_exception());
-    return QRVFail(error, QRV_ERROR(40, "Got exception: {} : {}", QRVExceptionDescription(std::current_exception()),
-                                    "(no call stack)"));
+    return QRVFail(error, QRV_ERROR(QRVResultCode::kException, "Got exception: {} : {}",
+                                    QRVExceptionDescription(std::current_exception()), "(no call stack)"));
   }
 }
 
 bool QRVClientConnection::deleteDataContainerContentWithContainerIdentity(
     const QRVContainerIdentityRef& containerIdentity, QRVError* error) {
   if (!containerIdentity || containerIdentity->identifier().empty())
-    return QRVFail(error, QRV_ERROR(38, "Can't wipe container with nil identifier: {}",
+    return QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidInput, "Can't wipe container with nil identifier: {}",
                                     containerIdentity ? containerIdentity->description() : "(null)"));
   const std::string& identifier = containerIdentity->identifier();
   const QRVContainerClass containerClass = containerIdentity->containerClass();
   if (!QRVContainerClassIsValid(containerClass))
     return QRVFail(error,
-                   QRV_ERROR(11, "Can't wipe container with of type: {}, identifier: {}", containerClass, identifier));
+                   QRV_ERROR(QRVResultCode::kInvalidObject, "Can't wipe container with of type: {}, identifier: {}",
+                             containerClass, identifier));
   if (!isWipeableDataClass(containerClass))
-    return QRVFail(error, QRV_ERROR(11, "Can't wipe container non-data container of type: {}, identifier: {}",
+    return QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidObject,
+                                    "Can't wipe container non-data container of type: {}, identifier: {}",
                                     containerClass, identifier));
   bool entitled = unrestricted_;
   if (!entitled && entitledWipeIdentifiers_) {
     for (const QRVPlist& v : *entitledWipeIdentifiers_)
       if (v.isString() && v.stringValue() == identifier) entitled = true;
   }
-  if (!entitled) return QRVFail(error, QRV_ERROR(55, "Not entitled to wipe container with identifier: {}", identifier));
+  if (!entitled)
+    return QRVFail(error, QRV_ERROR(QRVResultCode::kNotEntitled, "Not entitled to wipe container with identifier: {}",
+                                    identifier));
 
   try {
     UnrestrictedScope widened(*this);
@@ -359,7 +387,7 @@ bool QRVClientConnection::deleteDataContainerContentWithContainerIdentity(
     return true;
   } catch (...) {
     if (services_->globalConfiguration->isInternalImage()) QRVReportUncaughtException(std::current_exception());
-    return QRVFail(error, QRV_ERROR(40, "Got exception: {} : {}", QRVExceptionDescription(std::current_exception()),
-                                    "(no call stack)"));
+    return QRVFail(error, QRV_ERROR(QRVResultCode::kException, "Got exception: {} : {}",
+                                    QRVExceptionDescription(std::current_exception()), "(no call stack)"));
   }
 }

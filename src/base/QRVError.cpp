@@ -19,3 +19,11 @@ std::string QRVError::description() const {
   if (underlying_) s += " <- " + underlying_->description();
   return s;
 }
+
+uint64_t QRVError::resultCode() const {
+  if (domain_ == kDomain && code_ != 0) return code_;
+  QRVLogError("Internal error: a request failed without a result code ({}); answering {}",
+              domain_.empty() ? std::string("no error was set") : description(),
+              static_cast<uint64_t>(QRVResultCode::kException));
+  return QRVResultCode::kException;
+}

@@ -9,14 +9,15 @@
 // failure is logged exactly once, where it is first understood.
 #pragma once
 
+#include <fmt/format.h>
+
 #include <cstdint>
 #include <memory>
 #include <string>
 #include <utility>
 
-#include <fmt/format.h>
-
 #include "base/QRVLog.h"
+#include "base/QRVResultCode.h"
 
 class QRVError {
  public:
@@ -24,13 +25,6 @@ class QRVError {
   static constexpr const char* kPOSIXDomain = "POSIXErrorDomain";
   // Failures of general facilities (a file that is not the expected format).
   static constexpr const char* kGeneralDomain = "GeneralErrorDomain";
-
-  // Codes shared by many components. Each component documents its own.
-  static constexpr uint64_t kSuccess = 1;
-  static constexpr uint64_t kInvalidInput = 38;
-  static constexpr uint64_t kException = 40;
-  static constexpr uint64_t kInvalidCommand = 49;
-  static constexpr uint64_t kNotEntitled = 55;
 
   QRVError() = default;
 
@@ -50,6 +44,13 @@ class QRVError {
   const QRVError* underlying() const { return underlying_.get(); }
 
   bool isPOSIX() const { return domain_ == kPOSIXDomain; }
+
+  // The code to answer a client with for this failure. Only the daemon's
+  // own codes are result codes: an error that was never filled in (code 0)
+  // or one of another domain (an errno value, a format error) that reached
+  // the reply is a bug of the daemon, so it is logged and answered as
+  // QRVResultCode::kException, the code for a failure inside an operation.
+  uint64_t resultCode() const;
 
   // "<domain> <code>: <message> (function:line)", followed by the underlying
   // error's description.

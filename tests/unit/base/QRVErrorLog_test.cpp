@@ -37,7 +37,7 @@ size_t count(const std::string& text, const std::string& needle) {
 int quietLine;
 QRVError quietFailure() {
   quietLine = __LINE__ + 1;
-  return QRV_ERROR_QUIET(QRVError::kInvalidInput, "bad {} for {}", "value", 7);
+  return QRV_ERROR_QUIET(QRVResultCode::kInvalidInput, "bad {} for {}", "value", 7);
 }
 QRVError posixFailure() { return QRV_POSIX_ERROR(ENOENT, "no {}", "file"); }
 
@@ -53,7 +53,7 @@ TEST(QRVErrorTest, BuilderFillsEveryFieldAndChainsUnderlying) {
 
   testing::internal::CaptureStderr();  // both are logged; there is no handle
   QRVError posix = posixFailure();
-  QRVError outer = QRV_ERROR_UNDERLYING(QRVError::kException, posix, "could not {}", "open");
+  QRVError outer = QRV_ERROR_UNDERLYING(QRVResultCode::kException, posix, "could not {}", "open");
   const int outerLine = __LINE__ - 1;
   testing::internal::GetCapturedStderr();
   EXPECT_TRUE(posix.isPOSIX());
@@ -71,9 +71,9 @@ TEST(QRVErrorTest, BuilderFillsEveryFieldAndChainsUnderlying) {
 TEST(QRVLogTest, ErrorsAreLoggedOnceAndQuietErrorsNotAtAll) {
   LogDir dir;
   ASSERT_TRUE(QRVLog::open("test", dir.log(), QRVLogLevel::kNotice, 2, 1 << 20));
-  QRV_ERROR(QRVError::kInvalidCommand, "loud {}", 1);
-  QRVError quiet = QRV_ERROR_QUIET(QRVError::kInvalidCommand, "quiet {}", 2);
-  QRV_ERROR_UNDERLYING(QRVError::kException, quiet, "chained {}", 3);
+  QRV_ERROR(QRVResultCode::kInvalidCommand, "loud {}", 1);
+  QRVError quiet = QRV_ERROR_QUIET(QRVResultCode::kInvalidCommand, "quiet {}", 2);
+  QRV_ERROR_UNDERLYING(QRVResultCode::kException, quiet, "chained {}", 3);
   QRVLog::close();
   std::string log = dir.read();
   EXPECT_EQ(count(log, "<Error> TestBody: QRVErrorDomain 49: loud 1 (TestBody:"), 1u) << log;

@@ -5,6 +5,8 @@
 #include <functional>
 #include <vector>
 
+#include "base/QRVResultCode.h"
+
 namespace {
 
 // A command that records that it ran and does what it is told.
@@ -35,7 +37,7 @@ TEST(CommandQueueTest, DrainRunsInOrderIncludingLateCommandsAndStopsAtTheFirstFa
   EXPECT_TRUE(queue.executeAllUntilExhaustedOrError(&result));
   EXPECT_EQ(result, 12u);
   EXPECT_FALSE(queue.executeNextCommandWithError(&result));
-  EXPECT_EQ(result, QRVCommandQueue::kExhausted);
+  EXPECT_EQ(result, QRVResultCode::kQueueExhausted);
 
   // A command added while draining runs in the same drain, after those queued before it.
   std::vector<std::string> log;

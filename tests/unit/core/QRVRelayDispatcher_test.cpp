@@ -2,10 +2,16 @@
 
 #include <gtest/gtest.h>
 
-#include <string>
+#include <cerrno>
+#include <filesystem>
+#include <fstream>
 #include <set>
+#include <sstream>
 #include <stdexcept>
+#include <string>
 
+#include "base/QRVLog.h"
+#include "base/QRVResultCode.h"
 #include "operations/QRVClientConnection.h"
 #include "support/QRVTestConnection.h"
 #include "support/QRVTestServices.h"
@@ -240,6 +246,65 @@ TEST_F(RelayDispatcherTest, DeferredCommandFailureAndExceptionsBecomeTheResult) 
   setClient(1000, entitlement(kEntitlementAllowed));
   EXPECT_EQ(resultOf(1000, 2), 28u);
   EXPECT_EQ(resultOf(1000, 3), 40u);
+}
+
+// A deferred command that fails without saying why.
+class SilentlyFailingCommand : public QRVCommand {
+ public:
+  uint64_t command() const override { return 99; }
+  bool fromQueue(QRVCommandQueue&, uint64_t*) override { return false; }
+};
+
+TEST_F(RelayDispatcherTest, FailuresWithoutAResultCodeAnswer40AndAreLogged) {
+  QRVTemporaryDirectory logs;
+  const std::string logPath = (std::filesystem::path(logs.path()) / "quorvad.log").string();
+  ASSERT_TRUE(QRVLog::open("test", logPath, QRVLogLevel::kNotice, 2, 1 << 20));
+  setClient(1100, entitlement(kEntitlementAllowed).set(kEntitlementUserManagedAssets, QRVPlist::boolean(true)));
+
+  // A handler that stores 0, even one whose reply is normally sent later.
+  gHandlerResult = 0;
+  EXPECT_EQ(resultOf(1100, 5), 40u);
+  EXPECT_EQ(resultOf(1100, 4), 40u);
+  gHandlerResult = 1;
+
+  // A handler whose error was never filled in, or is an errno value: the
+  // handlers' path from error to code lets neither reach the client.
+  table_[6].handler = [](const QRVPlist&, const std::shared_ptr<QRVReply>&, QRVClientConnection&, uint64_t* result) {
+    QRVError never;
+    *result = never.resultCode();
+  };
+  table_[7].handler = [](const QRVPlist&, const std::shared_ptr<QRVReply>&, QRVClientConnection&, uint64_t* result) {
+    *result = QRV_POSIX_ERROR_QUIET(EACCES, "open failed").resultCode();
+  };
+  EXPECT_EQ(resultOf(1100, 6), 40u);
+  EXPECT_EQ(resultOf(1100, 7), 40u);
+
+  // A deferred command that fails without a code used to leave the request
+  // answering success.
+  table_[2].handler = [](const QRVPlist&, const std::shared_ptr<QRVReply>&, QRVClientConnection& c, uint64_t*) {
+    c.commandQueue().insertCommand(std::make_shared<SilentlyFailingCommand>());
+  };
+  EXPECT_EQ(resultOf(1100, 2), 40u);
+
+  // Real codes pass through untouched, whatever their number.
+  table_[8].handler = [](const QRVPlist&, const std::shared_ptr<QRVReply>&, QRVClientConnection&, uint64_t* result) {
+    *result = QRV_ERROR_QUIET(QRVResultCode::kNoSuchContainer, "not there").resultCode();
+  };
+  EXPECT_EQ(resultOf(1100, 8), 21u);
+  gHandlerResult = 1234;  // a code the list does not know is still the handler's to give
+  EXPECT_EQ(resultOf(1100, 9), 1234u);
+  gHandlerResult = 1;
+  EXPECT_EQ(resultOf(1100, 9), 1u);
+
+  QRVLog::close();
+  std::stringstream log;
+  log << std::ifstream(logPath).rdbuf();
+  const std::string text = log.str();
+  EXPECT_NE(text.find("command 5 failed without a result code; answering 40"), std::string::npos) << text;
+  EXPECT_NE(text.find("command 2 failed without a result code; answering 40"), std::string::npos) << text;
+  EXPECT_NE(text.find("a request failed without a result code (no error was set); answering 40"), std::string::npos)
+      << text;
+  EXPECT_NE(text.find("POSIXErrorDomain 13: open failed"), std::string::npos) << text;
 }
 
 TEST_F(RelayDispatcherTest, RegisteredEntitlementsAreRecordedOnlyForCallersWithPowers) {
