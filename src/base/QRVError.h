@@ -45,11 +45,12 @@ class QRVError {
 
   bool isPOSIX() const { return domain_ == kPOSIXDomain; }
 
-  // The code to answer a client with for this failure. Only the daemon's
-  // own codes are result codes: an error that was never filled in (code 0)
-  // or one of another domain (an errno value, a format error) that reached
-  // the reply is a bug of the daemon, so it is logged and answered as
-  // QRVResultCode::kException, the code for a failure inside an operation.
+  // The code to answer a client with for this failure: the error's own
+  // code, whatever its domain (an errno that reaches a reply travels as it
+  // is, as it always has). An error that was never filled in (code 0) is a
+  // bug of the daemon: it is logged and answered as
+  // QRVResultCode::kException, the code for a failure inside an operation,
+  // because 0 must never reach a client.
   uint64_t resultCode() const;
 
   // "<domain> <code>: <message> (function:line)", followed by the underlying
