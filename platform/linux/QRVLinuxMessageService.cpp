@@ -96,10 +96,12 @@ class QRVLinuxMessageService::Connection : public QRVConnection {
       socklen_t len = sizeof err;
       getsockopt(fd_, SOL_SOCKET, SO_ERROR, &err, &len);
       closeLocked(err == ECONNRESET || err == EPIPE || err == 0 ? "" : fmt::format("socket error: {}", strerror(err)));
-      busy_ = false;
+      releaseWorkerLocked();
       return;
     }
     EventHandler handler = handler_;
+    // Stays open while this worker owns the connection (see closeLocked).
+    const int fd = fd_;
     // A connection keeps its worker while it has requests and its replies are
     // being read; the other workers serve everyone else meanwhile.
     for (;;) {
@@ -126,7 +128,7 @@ class QRVLinuxMessageService::Connection : public QRVConnection {
         break;
       }
       lock.unlock();
-      bool wouldBlock = readSome(&problem);
+      bool wouldBlock = readSome(fd, &problem);
       lock.lock();
       if (!problem.empty()) {
         closeLocked(problem);
@@ -134,7 +136,7 @@ class QRVLinuxMessageService::Connection : public QRVConnection {
       }
       if (wouldBlock) break;
     }
-    busy_ = false;
+    releaseWorkerLocked();
     if (!closed_) rearmLocked();
   }
 
@@ -179,7 +181,7 @@ class QRVLinuxMessageService::Connection : public QRVConnection {
 
   // Reads what the socket has, up to one chunk. Returns true when it had
   // nothing (would block).
-  bool readSome(std::string* problem) {
+  bool readSome(int fd, std::string* problem) {
     if (inOffset_ > 0) {
       in_.erase(in_.begin(), in_.begin() + static_cast<ptrdiff_t>(inOffset_));
       inOffset_ = 0;
@@ -188,7 +190,7 @@ class QRVLinuxMessageService::Connection : public QRVConnection {
     in_.resize(old + kReadChunk);
     ssize_t n;
     do {
-      n = recv(fd_, in_.data() + old, kReadChunk, 0);
+      n = recv(fd, in_.data() + old, kReadChunk, 0);
     } while (n < 0 && errno == EINTR);
     in_.resize(old + (n > 0 ? static_cast<size_t>(n) : 0));
     if (n == 0) {
@@ -243,6 +245,16 @@ class QRVLinuxMessageService::Connection : public QRVConnection {
       closeLocked(fmt::format("cannot re-arm the connection: {}", strerror(errno)));
   }
 
+  // The worker gives up the connection, finishing a close that came while
+  // it was reading.
+  void releaseWorkerLocked() REQUIRES(mutex_) {
+    busy_ = false;
+    if (closed_ && fd_ >= 0) {
+      ::close(fd_);
+      fd_ = -1;
+    }
+  }
+
   // An empty reason is an ordinary end (the peer left, or the daemon
   // cancelled); anything else is logged as the reason for cutting it off.
   void closeLocked(const std::string& reason) REQUIRES(mutex_) {
@@ -251,8 +263,16 @@ class QRVLinuxMessageService::Connection : public QRVConnection {
     if (!reason.empty())
       QRVLogError("closing connection from pid {} (uid {}): {}", cred_.pid, cred_.uid, reason);
     epoll_ctl(service_->epollFd_, EPOLL_CTL_DEL, fd_, nullptr);
-    ::close(fd_);
-    fd_ = -1;
+    // A worker that owns the connection may be reading the descriptor
+    // outside the lock. Closing it now could give its number to the next
+    // open, and the worker would read another client's bytes. It is shut
+    // down instead, which ends that read at once, and the worker closes it.
+    if (busy_) {
+      ::shutdown(fd_, SHUT_RDWR);
+    } else {
+      ::close(fd_);
+      fd_ = -1;
+    }
     out_.clear();
     outOffset_ = 0;
     service_->forget(id_);
@@ -260,7 +280,7 @@ class QRVLinuxMessageService::Connection : public QRVConnection {
 
   QRVLinuxMessageService* const service_;
   const uint64_t id_;
-  int fd_;
+  int fd_ GUARDED_BY(mutex_);
   int pidfd_;
   const ucred cred_;
   const QRVAuditToken token_;
