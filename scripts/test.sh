@@ -1,5 +1,6 @@
 #!/usr/bin/env bash
-# Builds quorvad with AddressSanitizer and UndefinedBehaviorSanitizer and runs
+# Checks the daemon's locking with clang's thread-safety analysis, builds
+# quorvad with AddressSanitizer and UndefinedBehaviorSanitizer and runs
 # every test: unit tests, the packed-buffer tests and the integration tests
 # that start the real daemon on temporary roots (those need root; as another
 # user they are skipped with a message).
@@ -7,6 +8,9 @@ set -euo pipefail
 cd "$(dirname "$0")/.."
 
 scripts/install-deps.sh
+
+# Locking checked by the compiler before anything is built for running.
+scripts/check-thread-safety.sh
 
 build=${QUORVAD_TEST_BUILD_DIR:-build-test}
 cmake -S . -B "$build" -G Ninja -DCMAKE_BUILD_TYPE=Debug -DQUORVAD_SANITIZE=ON >/dev/null

@@ -2,7 +2,6 @@
 
 #include <cxxabi.h>
 #include <sqlite3.h>
-#include <unistd.h>
 
 #include <cstdlib>
 #include <new>
@@ -10,129 +9,18 @@
 #include <utility>
 
 #include "base/QRVLog.h"
+#include "base/QRVResultCode.h"
+#include "codesigning/QRVSQLiteSchema.h"
+#include "codesigning/QRVSQLiteStatement.h"
+
+using namespace QRVSQLiteSchema;
+using Step = QRVSQLiteStatement::Step;
 
 namespace {
 
-// The statements are part of the file format: another build of the daemon
-// opens the same file, so they are kept exactly as they are.
-//
-// Note on the pragmas: journal_mode = WAL writes the header of a new file
-// before auto_vacuum = FULL runs, and SQLite only honours auto_vacuum on a
-// file without a header, so a file created by this script does not
-// auto-vacuum. The script is kept as it is so that existing databases and new
-// ones agree.
-constexpr const char* kSchemaScript =
-    "PRAGMA locking_mode = EXCLUSIVE;PRAGMA journal_mode = WAL;PRAGMA foreign_keys = ON;PRAGMA "
-    "auto_vacuum = FULL;CREATE TABLE IF NOT EXISTS code_signing_info(id INTEGER PRIMARY KEY "
-    "AUTOINCREMENT,code_signing_id_text TEXT NOT NULL UNIQUE,invalid INTEGER NOT NULL DEFAULT "
-    "0,placeholder INTEGER NOT NULL DEFAULT 0,registered_by_caller INTEGER NOT NULL DEFAULT "
-    "0,data_container_class INTEGER NOT NULL DEFAULT 0);CREATE TABLE IF NOT EXISTS "
-    "code_signing_data(id INTEGER PRIMARY KEY AUTOINCREMENT,cs_info_id INTEGER NOT NULL "
-    "UNIQUE,data BLOB NOT NULL,FOREIGN KEY(cs_info_id) REFERENCES code_signing_info(id) ON "
-    "DELETE CASCADE);CREATE TABLE IF NOT EXISTS child_bundles(id INTEGER PRIMARY KEY "
-    "AUTOINCREMENT,child_code_signing_id_text TEXT NOT NULL UNIQUE,parent_id INTEGER NOT "
-    "NULL,FOREIGN KEY(parent_id) REFERENCES code_signing_info(id) ON DELETE CASCADE);CREATE "
-    "INDEX IF NOT EXISTS code_signing_id_text_idx ON code_signing_info(code_signing_id_text);"
-    "CREATE INDEX IF NOT EXISTS cs_info_id_idx ON code_signing_data(cs_info_id);CREATE INDEX IF "
-    "NOT EXISTS parent_id_idx ON child_bundles(parent_id);";
-
-constexpr const char* kDeleteSQL = "DELETE FROM code_signing_info WHERE code_signing_id_text=?;";
-constexpr const char* kInvalidateSQL =
-    "UPDATE code_signing_info SET invalid=1 WHERE code_signing_id_text = ?;";
-constexpr const char* kSelectEntrySQL =
-    "SELECT code_signing_data.data, code_signing_info.invalid, code_signing_info.placeholder, "
-    "code_signing_info.registered_by_caller, code_signing_info.data_container_class FROM "
-    "code_signing_info, code_signing_data WHERE code_signing_info.id = "
-    "code_signing_data.cs_info_id "
-    "AND code_signing_info.code_signing_id_text = ?;";
-constexpr const char* kEnumerateSQL =
-    "SELECT code_signing_data.data, code_signing_info.invalid, code_signing_info.placeholder, "
-    "code_signing_info.registered_by_caller, code_signing_info.data_container_class, "
-    "code_signing_info.code_signing_id_text FROM code_signing_info, code_signing_data WHERE "
-    "code_signing_info.id = code_signing_data.cs_info_id;";
-constexpr const char* kIdentifiersSQL =
-    "SELECT code_signing_info.code_signing_id_text FROM code_signing_info;";
-constexpr const char* kChildrenSQL =
-    "SELECT child_bundles.child_code_signing_id_text FROM child_bundles, code_signing_info WHERE "
-    "code_signing_info.code_signing_id_text = ? AND child_bundles.parent_id=code_signing_info.id;";
-constexpr const char* kParentSQL =
-    "SELECT code_signing_info.code_signing_id_text FROM child_bundles, code_signing_info WHERE "
-    "child_bundles.child_code_signing_id_text = ? AND "
-    "child_bundles.parent_id=code_signing_info.id;";
-constexpr const char* kDeleteAdvanceCopiesSQL =
-    "DELETE FROM code_signing_info WHERE (placeholder & ?) > 0;";
-constexpr const char* kUpdateInfoSQL =
-    "UPDATE code_signing_info SET invalid=?, placeholder=?, registered_by_caller=?, "
-    "data_container_class=? WHERE code_signing_id_text=?;";
-constexpr const char* kInsertInfoSQL =
-    "INSERT INTO code_signing_info (invalid, placeholder, registered_by_caller, "
-    "data_container_class, code_signing_id_text) VALUES (?, ?, ?, ?, ?);";
-constexpr const char* kInsertDataSQL =
-    "INSERT OR REPLACE INTO code_signing_data (cs_info_id, data) SELECT id, ? FROM "
-    "code_signing_info WHERE code_signing_id_text = ?;";
-constexpr const char* kInsertChildSQL =
-    "INSERT OR REPLACE INTO child_bundles (parent_id, child_code_signing_id_text) SELECT id, ? "
-    "FROM code_signing_info WHERE code_signing_id_text = ?;";
-
-constexpr int kPlaceholderBit = 1;
-constexpr int kAdvanceCopyBit = 2;
-
-// Logs to the daemon's log and to stderr, which under systemd is the journal,
-// then aborts: for the failures after which the daemon cannot go on.
-[[noreturn]] void crash(const char* function, const std::string& message) {
-  QRVLog::write(QRVLogLevel::kError, function, message);
-  std::string line = message + "\n";
-  ssize_t ignored = ::write(STDERR_FILENO, line.data(), line.size());
-  (void)ignored;
-  abort();
-}
-
 const char* errorMessage(sqlite3* db) { return db ? sqlite3_errmsg(db) : "database is closed"; }
 
-// Identifiers are byte strings of any length: the length is always passed
-// (so NULs and invalid UTF-8 go through untouched and nothing stops at the
-// first NUL), the 64-bit call lets SQLite refuse oversized text with
-// SQLITE_TOOBIG instead of truncating a length, and an empty string is bound
-// as "" rather than as the NULL an empty view's null pointer would give.
-int bindText(sqlite3_stmt* statement, int index, std::string_view text) {
-  return sqlite3_bind_text64(statement, index, text.data() ? text.data() : "", text.size(),
-                             SQLITE_TRANSIENT, SQLITE_UTF8);
-}
-
-// Null when the column is NULL (or SQLite ran out of memory converting it).
-std::optional<std::string_view> columnText(sqlite3_stmt* statement, int column) {
-  const auto* text = reinterpret_cast<const char*>(sqlite3_column_text(statement, column));
-  if (!text) return std::nullopt;
-  return std::string_view(text, static_cast<size_t>(sqlite3_column_bytes(statement, column)));
-}
-
-std::string_view orNull(std::optional<std::string_view> text) {
-  return text ? *text : std::string_view("(null)");
-}
-
-// One prepared statement, finalized on every path. A finalize failure is
-// only logged: by then the statement's result has been decided.
-class Statement {
- public:
-  Statement(sqlite3* db, const std::string& path) : db_(db), path_(path) {}
-  ~Statement() {
-    if (statement_ && sqlite3_finalize(statement_) != SQLITE_OK)
-      QRVLogError("sqlite3_finalize for {} failed: {}", path_, errorMessage(db_));
-  }
-  Statement(const Statement&) = delete;
-  Statement& operator=(const Statement&) = delete;
-
-  bool prepare(const char* sql) {
-    return db_ && sqlite3_prepare_v2(db_, sql, -1, &statement_, nullptr) == SQLITE_OK;
-  }
-  sqlite3_stmt* get() const { return statement_; }
-  const char* errmsg() const { return errorMessage(db_); }
-
- private:
-  sqlite3* const db_;
-  const std::string& path_;
-  sqlite3_stmt* statement_ = nullptr;
-};
+std::string_view orNull(std::optional<std::string_view> text) { return text ? *text : std::string_view("(null)"); }
 
 std::string describeException(std::exception_ptr exception) {
   try {
@@ -150,41 +38,19 @@ std::string describeException(std::exception_ptr exception) {
 
 }  // namespace
 
-sqlite3* QRVSQLiteDB::openDBWithURL(const std::filesystem::path& url) {
-  QRVLogDebug("opening {}", url.native());
-  sqlite3* db = nullptr;
-  int rc = sqlite3_open_v2(url.c_str(), &db, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE, nullptr);
-  if (rc != SQLITE_OK) {
-    QRVLogError("opening {} failed: {}", url.native(),
-                db ? sqlite3_errmsg(db) : sqlite3_errstr(rc));
-    sqlite3_close(db);
-    crash(__func__, fmt::format("Failed to open database, err = {}", rc));
-  }
-  char* message = nullptr;
-  rc = sqlite3_exec(db, kSchemaScript, nullptr, nullptr, &message);
-  if (rc != SQLITE_OK) {
-    QRVLogError("table create for {} failed: {}", url.native(),
-                message ? message : sqlite3_errstr(rc));
-    sqlite3_free(message);
-    sqlite3_close(db);
-    crash(__func__, fmt::format("Failed to initialize database, err = {}", rc));
-  }
-  return db;
-}
+sqlite3* QRVSQLiteDB::openDBWithURL(const std::filesystem::path& url) { return QRVSQLiteSchema::openDBWithURL(url); }
 
-std::unique_ptr<QRVSQLiteDB> QRVSQLiteDB::initWithParentDirectoryURL(
-    const std::filesystem::path& directory, ExceptionReporter exceptionReporter) {
+std::unique_ptr<QRVSQLiteDB> QRVSQLiteDB::initWithParentDirectoryURL(const std::filesystem::path& directory,
+                                                                     ExceptionReporter exceptionReporter) {
   if (directory.empty()) return nullptr;
   std::filesystem::path url = directory / "containers";
   url.replace_extension("sqlite3");
   sqlite3* db = openDBWithURL(url);
   if (!db) return nullptr;
-  return std::unique_ptr<QRVSQLiteDB>(
-      new QRVSQLiteDB(db, std::move(url), std::move(exceptionReporter)));
+  return std::unique_ptr<QRVSQLiteDB>(new QRVSQLiteDB(db, std::move(url), std::move(exceptionReporter)));
 }
 
-QRVSQLiteDB::QRVSQLiteDB(sqlite3* db, std::filesystem::path url,
-                         ExceptionReporter exceptionReporter)
+QRVSQLiteDB::QRVSQLiteDB(sqlite3* db, std::filesystem::path url, ExceptionReporter exceptionReporter)
     : db_(db), url_(std::move(url)), exceptionReporter_(std::move(exceptionReporter)) {}
 
 QRVSQLiteDB::~QRVSQLiteDB() { closeDB(); }
@@ -213,30 +79,30 @@ bool QRVSQLiteDB::_sqliteExec(const char* statement, QRVError* error) {
 }
 
 bool QRVSQLiteDB::_performTwoParameterQuery(const char* sql, std::string_view textOne,
-                                            std::optional<std::string_view> textTwo,
-                                            int expectedChanges, QRVError* error) {
+                                            std::optional<std::string_view> textTwo, int expectedChanges,
+                                            QRVError* error) {
   const std::string& path = url_.native();
-  Statement statement(db_, path);
-  if (!statement.prepare(sql)) {
+  QRVSQLiteStatement statement(db_, sql, path);
+  if (!statement.prepared()) {
     return QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_prepare(delete) for {} failed: {}", path,
-                                    statement.errmsg()));
+                                    statement.errorMessage()));
   }
-  if (bindText(statement.get(), 1, textOne) != SQLITE_OK) {
+  if (!statement.bindText(1, textOne)) {
     return QRVFail(error,
                    QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_bind_text for identifier={} at {} failed: {}",
-                             textOne, path, statement.errmsg()));
+                             textOne, path, statement.errorMessage()));
   }
-  if (textTwo && bindText(statement.get(), 2, *textTwo) != SQLITE_OK) {
+  if (textTwo && !statement.bindText(2, *textTwo)) {
     return QRVFail(error,
                    QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_bind_text for identifier={} at {} failed: {}",
-                             *textTwo, path, statement.errmsg()));
+                             *textTwo, path, statement.errorMessage()));
   }
-  if (sqlite3_step(statement.get()) != SQLITE_DONE) {
-    return QRVFail(
-        error, QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_step for {} failed: {}", path, statement.errmsg()));
+  if (statement.step() != Step::kDone) {
+    return QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_step for {} failed: {}", path,
+                                    statement.errorMessage()));
   }
   if (expectedChanges != -1) {
-    int changes = sqlite3_changes(db_);
+    int changes = statement.changes();
     // Quiet: the caller decides what a wrong count means and reports it.
     if (changes != expectedChanges) {
       return QRVFail(error, QRV_ERROR_QUIET(QRVResultCode::kDatabaseChangeCount,
@@ -247,26 +113,23 @@ bool QRVSQLiteDB::_performTwoParameterQuery(const char* sql, std::string_view te
   return true;
 }
 
-bool QRVSQLiteDB::_performSingleParameterQuery(const char* sql, std::string_view text,
-                                               int expectedChanges, QRVError* error) {
+bool QRVSQLiteDB::_performSingleParameterQuery(const char* sql, std::string_view text, int expectedChanges,
+                                               QRVError* error) {
   return _performTwoParameterQuery(sql, text, std::nullopt, expectedChanges, error);
 }
 
-bool QRVSQLiteDB::_performSingleParameterQuery(const char* sql, std::string_view text,
-                                               QRVError* error) {
+bool QRVSQLiteDB::_performSingleParameterQuery(const char* sql, std::string_view text, QRVError* error) {
   return _performSingleParameterQuery(sql, text, -1, error);
 }
 
 bool QRVSQLiteDB::_performInsertOrUpdateQuery(const char* sql, const QRVCodeSigningEntry& entry,
-                                              std::string_view identifier, bool isUpdate,
-                                              QRVError* error) {
+                                              std::string_view identifier, bool isUpdate, QRVError* error) {
   const std::string& path = url_.native();
-  Statement statement(db_, path);
-  if (!statement.prepare(sql)) {
+  QRVSQLiteStatement statement(db_, sql, path);
+  if (!statement.prepared()) {
     return QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_prepare(insert) for {} failed: {}", path,
-                                    statement.errmsg()));
+                                    statement.errorMessage()));
   }
-  sqlite3_stmt* s = statement.get();
   const int invalid = entry.isInvalid() ? 1 : 0;
   const int placeholder = entry.isPlaceholder() ? 1 : 0;
   const int advanceCopy = entry.isAdvanceCopy() ? 1 : 0;
@@ -274,39 +137,38 @@ bool QRVSQLiteDB::_performInsertOrUpdateQuery(const char* sql, const QRVCodeSign
   const int registeredByCaller = entry.isRegisteredByCaller() ? 1 : 0;
   const uint64_t dataContainerClass = entry.dataContainerClass();
 
-  if (sqlite3_bind_int(s, 1, invalid) != SQLITE_OK) {
+  if (!statement.bindInt(1, invalid)) {
     return QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_bind_int for invalid={} at {} failed: {}",
-                                    invalid, path, statement.errmsg()));
+                                    invalid, path, statement.errorMessage()));
   }
-  if (sqlite3_bind_int(s, 2, flags) != SQLITE_OK) {
+  if (!statement.bindInt(2, flags)) {
     return QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed,
                                     "sqlite3_bind_int for placeholder={}, advance_copy={} "
                                     "(flags={}) at {} failed: {}",
-                                    placeholder, advanceCopy, flags, path, statement.errmsg()));
+                                    placeholder, advanceCopy, flags, path, statement.errorMessage()));
   }
-  if (sqlite3_bind_int(s, 3, registeredByCaller) != SQLITE_OK) {
+  if (!statement.bindInt(3, registeredByCaller)) {
     return QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed,
                                     "sqlite3_bind_int for registered_by_caller={} at {} failed: {}", registeredByCaller,
-                                    path, statement.errmsg()));
+                                    path, statement.errorMessage()));
   }
   // The column has always held a 32-bit value; classes are small numbers.
-  if (sqlite3_bind_int(s, 4, static_cast<int>(static_cast<uint32_t>(dataContainerClass))) !=
-      SQLITE_OK) {
+  if (!statement.bindInt(4, static_cast<int>(static_cast<uint32_t>(dataContainerClass)))) {
     return QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed,
                                     "sqlite3_bind_int for data_container_class={} at {} failed: {}", dataContainerClass,
-                                    path, statement.errmsg()));
+                                    path, statement.errorMessage()));
   }
-  if (bindText(s, 5, identifier) != SQLITE_OK) {
+  if (!statement.bindText(5, identifier)) {
     return QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed,
                                     "sqlite3_bind_text for code_signing_id_text={} at {} failed: {}", identifier, path,
-                                    statement.errmsg()));
+                                    statement.errorMessage()));
   }
-  if (sqlite3_step(s) != SQLITE_DONE) {
-    return QRVFail(
-        error, QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_step for {} failed: {}", path, statement.errmsg()));
+  if (statement.step() != Step::kDone) {
+    return QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_step for {} failed: {}", path,
+                                    statement.errorMessage()));
   }
   if (isUpdate) {
-    int changes = sqlite3_changes(db_);
+    int changes = statement.changes();
     // Quiet: an update that finds no row is how a new identifier is told
     // apart from a known one, not a failure.
     if (changes != 1) {
@@ -317,26 +179,24 @@ bool QRVSQLiteDB::_performInsertOrUpdateQuery(const char* sql, const QRVCodeSign
   return true;
 }
 
-bool QRVSQLiteDB::_insertCodeSigningInfo(const QRVCodeSigningEntry& entry,
-                                         std::string_view identifier, QRVError* error) {
+bool QRVSQLiteDB::_insertCodeSigningInfo(const QRVCodeSigningEntry& entry, std::string_view identifier,
+                                         QRVError* error) {
   // Updating first keeps the row's id, and with it the child rows that point
   // at it, when an identifier is registered again.
   QRVError updateError;
-  if (_performInsertOrUpdateQuery(kUpdateInfoSQL, entry, identifier, true, &updateError))
-    return true;
+  if (_performInsertOrUpdateQuery(kUpdateInfoSQL, entry, identifier, true, &updateError)) return true;
   if (updateError.domain() != QRVError::kDomain || updateError.code() != QRVResultCode::kDatabaseChangeCount) {
     return QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kDatabaseFailed, updateError,
                                                "Error performing UPDATE operation for {}", identifier));
   }
   QRVError insertError;
-  if (_performInsertOrUpdateQuery(kInsertInfoSQL, entry, identifier, false, &insertError))
-    return true;
+  if (_performInsertOrUpdateQuery(kInsertInfoSQL, entry, identifier, false, &insertError)) return true;
   return QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kDatabaseFailed, insertError,
                                              "Error performing INSERT operation for {}", identifier));
 }
 
-bool QRVSQLiteDB::_insertCodeSigningData(const QRVCodeSigningEntry& entry,
-                                         std::string_view identifier, QRVError* error) {
+bool QRVSQLiteDB::_insertCodeSigningData(const QRVCodeSigningEntry& entry, std::string_view identifier,
+                                         QRVError* error) {
   QRVPlist::Bytes data;
   if (entry.hasCodeSigningInfo()) data = entry.codeSigningInfo().toBinary();
   if (data.empty()) {
@@ -344,51 +204,50 @@ bool QRVSQLiteDB::_insertCodeSigningData(const QRVCodeSigningEntry& entry,
                                     entry.codeSigningInfo().description()));
   }
   const std::string& path = url_.native();
-  Statement statement(db_, path);
-  if (!statement.prepare(kInsertDataSQL)) {
+  QRVSQLiteStatement statement(db_, kInsertDataSQL, path);
+  if (!statement.prepared()) {
     return QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_prepare(insert) for {} failed: {}", path,
-                                    statement.errmsg()));
+                                    statement.errorMessage()));
   }
   // `data` outlives the step, so SQLite need not copy the blob.
-  if (sqlite3_bind_blob64(statement.get(), 1, data.data(), data.size(), SQLITE_STATIC) !=
-      SQLITE_OK) {
+  if (!statement.bindBlob(1, data.data(), data.size())) {
     return QRVFail(
         error, QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_bind_blob64 for codeSigningInfoData at {} failed: {}",
-                         path, statement.errmsg()));
+                         path, statement.errorMessage()));
   }
-  if (bindText(statement.get(), 2, identifier) != SQLITE_OK) {
+  if (!statement.bindText(2, identifier)) {
     return QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed,
                                     "sqlite3_bind_text for code_signing_id_text={} at {} failed: {}", identifier, path,
-                                    statement.errmsg()));
+                                    statement.errorMessage()));
   }
-  if (sqlite3_step(statement.get()) != SQLITE_DONE) {
-    return QRVFail(
-        error, QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_step for {} failed: {}", path, statement.errmsg()));
+  if (statement.step() != Step::kDone) {
+    return QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_step for {} failed: {}", path,
+                                    statement.errorMessage()));
   }
   return true;
 }
 
-bool QRVSQLiteDB::_insertChildIdentifier(std::string_view child, std::string_view parent,
-                                         QRVError* error) {
+bool QRVSQLiteDB::_insertChildIdentifier(std::string_view child, std::string_view parent, QRVError* error) {
   const std::string& path = url_.native();
   QRVError cause;
   {
-    Statement statement(db_, path);
     // The child column is unique, so OR REPLACE moves a child that another
     // parent claimed to this one.
-    if (!statement.prepare(kInsertChildSQL)) {
+    QRVSQLiteStatement statement(db_, kInsertChildSQL, path);
+    if (!statement.prepared()) {
       cause = QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_prepare(insert) for {} failed: {}", path,
-                        statement.errmsg());
-    } else if (bindText(statement.get(), 1, child) != SQLITE_OK) {
+                        statement.errorMessage());
+    } else if (!statement.bindText(1, child)) {
       cause = QRV_ERROR(QRVResultCode::kDatabaseFailed,
                         "sqlite3_bind_text for child_code_signing_id_text={} at {} failed: {}", child, path,
-                        statement.errmsg());
-    } else if (bindText(statement.get(), 2, parent) != SQLITE_OK) {
+                        statement.errorMessage());
+    } else if (!statement.bindText(2, parent)) {
       cause =
           QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_bind_text for code_signing_id_text={} at {} failed: {}",
-                    parent, path, statement.errmsg());
-    } else if (sqlite3_step(statement.get()) != SQLITE_DONE) {
-      cause = QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_step for {} failed: {}", path, statement.errmsg());
+                    parent, path, statement.errorMessage());
+    } else if (statement.step() != Step::kDone) {
+      cause =
+          QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_step for {} failed: {}", path, statement.errorMessage());
     } else {
       return true;
     }
@@ -397,16 +256,16 @@ bool QRVSQLiteDB::_insertChildIdentifier(std::string_view child, std::string_vie
                                              "Error performing INSERT operation for child {}", child));
 }
 
-std::shared_ptr<QRVCodeSigningEntry> QRVSQLiteDB::_codeSigningEntryFromStatementRow(
-    sqlite3_stmt* statement, QRVError* error) {
+std::shared_ptr<QRVCodeSigningEntry> QRVSQLiteDB::_codeSigningEntryFromStatementRow(const QRVSQLiteStatement& statement,
+                                                                                    QRVError* error) {
   // The property list is parsed straight from SQLite's buffer, which stays
   // valid until the statement is stepped again.
-  const auto* bytes = static_cast<const uint8_t*>(sqlite3_column_blob(statement, 0));
+  size_t length = 0;
+  const uint8_t* bytes = statement.columnBlob(0, &length);
   if (!bytes) {
     QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed, "Failed to create code signing entry from statement row"));
     return nullptr;
   }
-  const auto length = static_cast<size_t>(sqlite3_column_bytes(statement, 0));
   try {
     std::optional<QRVPlist> info = QRVPlist::fromBytes(bytes, length);
     if (!info || !info->isDictionary()) {
@@ -418,13 +277,12 @@ std::shared_ptr<QRVCodeSigningEntry> QRVSQLiteDB::_codeSigningEntryFromStatement
               QRV_ERROR_UNDERLYING(QRVResultCode::kDatabaseFailed, readError, "Error formatting info data from DB"));
       return nullptr;
     }
-    const int flags = sqlite3_column_int(statement, 2);
-    auto entry = std::make_shared<QRVCodeSigningEntry>(
-        std::move(*info), static_cast<uint32_t>(sqlite3_column_int(statement, 4)));
-    entry->setInvalid(sqlite3_column_int(statement, 1) != 0);
+    const int flags = statement.columnInt(2);
+    auto entry = std::make_shared<QRVCodeSigningEntry>(std::move(*info), static_cast<uint32_t>(statement.columnInt(4)));
+    entry->setInvalid(statement.columnInt(1) != 0);
     entry->setPlaceholder((flags & kPlaceholderBit) != 0);
     entry->setAdvanceCopy((flags & kAdvanceCopyBit) != 0);
-    entry->setRegisteredByCaller(sqlite3_column_int(statement, 3) != 0);
+    entry->setRegisteredByCaller(statement.columnInt(3) != 0);
     return entry;
   } catch (const std::bad_alloc&) {
     QRVFail(error, QRV_ERROR(QRVResultCode::kAllocationFailed, "Failed to allocate codeSigningEntry"));
@@ -444,8 +302,8 @@ bool QRVSQLiteDB::_failInsideTransaction(std::exception_ptr exception, QRVError*
 
 // MARK: - Operations
 
-bool QRVSQLiteDB::addCodeSigningEntry(const QRVCodeSigningEntry* entry,
-                                      std::optional<std::string_view> identifier, QRVError* error) {
+bool QRVSQLiteDB::addCodeSigningEntry(const QRVCodeSigningEntry* entry, std::optional<std::string_view> identifier,
+                                      QRVError* error) {
   if (!entry || !identifier) {
     return QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidInput, "codeSigningEntry {} and identifier {} cannot be nil",
                                     entry ? entry->description() : "(null)", orNull(identifier)));
@@ -484,8 +342,7 @@ bool QRVSQLiteDB::addCodeSigningEntry(const QRVCodeSigningEntry* entry,
   return true;
 }
 
-bool QRVSQLiteDB::deleteCodeSigningEntryWithIdentifier(std::optional<std::string_view> identifier,
-                                                       QRVError* error) {
+bool QRVSQLiteDB::deleteCodeSigningEntryWithIdentifier(std::optional<std::string_view> identifier, QRVError* error) {
   if (!identifier) {
     return QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidInput, "\bidentifier {} cannot be nil", "(null)"));
   }
@@ -497,34 +354,34 @@ bool QRVSQLiteDB::deleteCodeSigningEntryWithIdentifier(std::optional<std::string
   return true;
 }
 
-std::shared_ptr<const QRVCodeSigningEntry> QRVSQLiteDB::codeSigningEntryWithIdentifier(
-    std::string_view identifier, QRVError* error) {
+std::shared_ptr<const QRVCodeSigningEntry> QRVSQLiteDB::codeSigningEntryWithIdentifier(std::string_view identifier,
+                                                                                       QRVError* error) {
   const std::string& path = url_.native();
   std::shared_ptr<QRVCodeSigningEntry> entry;
   {
-    Statement statement(db_, path);
-    if (!statement.prepare(kSelectEntrySQL)) {
+    QRVSQLiteStatement statement(db_, kSelectEntrySQL, path);
+    if (!statement.prepared()) {
       QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_prepare(select) for {} failed: {}", path,
-                               statement.errmsg()));
+                               statement.errorMessage()));
       return nullptr;
     }
-    if (bindText(statement.get(), 1, identifier) != SQLITE_OK) {
+    if (!statement.bindText(1, identifier)) {
       QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_bind_text for identifier={} at {} failed: {}",
-                               identifier, path, statement.errmsg()));
+                               identifier, path, statement.errorMessage()));
       return nullptr;
     }
-    int rc = sqlite3_step(statement.get());
-    if (rc == SQLITE_DONE) {
+    Step step = statement.step();
+    if (step == Step::kDone) {
       QRVFail(error,
               QRV_ERROR_QUIET(QRVResultCode::kDatabaseNotFound, "Identifier: \"{}\" Not Found in DB", identifier));
       return nullptr;
     }
-    if (rc != SQLITE_ROW) {
-      QRVFail(error,
-              QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_step for {} failed: {}", path, statement.errmsg()));
+    if (step != Step::kRow) {
+      QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_step for {} failed: {}", path,
+                               statement.errorMessage()));
       return nullptr;
     }
-    entry = _codeSigningEntryFromStatementRow(statement.get(), error);
+    entry = _codeSigningEntryFromStatementRow(statement, error);
     if (!entry) return nullptr;
   }
   QRVError childError;
@@ -538,8 +395,7 @@ std::shared_ptr<const QRVCodeSigningEntry> QRVSQLiteDB::codeSigningEntryWithIden
   return entry;
 }
 
-bool QRVSQLiteDB::invalidateCodeSigningWithIdentifier(std::string_view identifier,
-                                                      QRVError* error) {
+bool QRVSQLiteDB::invalidateCodeSigningWithIdentifier(std::string_view identifier, QRVError* error) {
   QRVError queryError;
   if (!_performSingleParameterQuery(kInvalidateSQL, identifier, &queryError)) {
     return QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kDatabaseFailed, queryError,
@@ -548,8 +404,7 @@ bool QRVSQLiteDB::invalidateCodeSigningWithIdentifier(std::string_view identifie
   return true;
 }
 
-bool QRVSQLiteDB::invalidateCodeSigningForIdentifierAndAllChildren(std::string_view identifier,
-                                                                   QRVError* error) {
+bool QRVSQLiteDB::invalidateCodeSigningForIdentifierAndAllChildren(std::string_view identifier, QRVError* error) {
   std::vector<std::string> identifiers{std::string(identifier)};
   QRVError childError;
   if (auto children = childIdentifiersForParentIdentifier(identifier, &childError)) {
@@ -569,8 +424,8 @@ bool QRVSQLiteDB::invalidateCodeSigningForIdentifierAndAllChildren(std::string_v
       if (invalidateCodeSigningWithIdentifier(member, &invalidateError)) {
         QRVLogDebug("Invalidating code signing info for {} child: {}", identifier, member);
       } else {
-        QRVLogError("Failed to invalidate code signing info for {} child {} : {}", identifier,
-                    member, invalidateError.description());
+        QRVLogError("Failed to invalidate code signing info for {} child {} : {}", identifier, member,
+                    invalidateError.description());
       }
     }
     _runTestHook();
@@ -594,26 +449,25 @@ void QRVSQLiteDB::_endFailedCommit() {
   }
 }
 
-std::optional<QRVError> QRVSQLiteDB::enumerateIdentifiersAndCodeSigningInfoUsingBlock(
-    const EnumerationBlock& block) {
+std::optional<QRVError> QRVSQLiteDB::enumerateIdentifiersAndCodeSigningInfoUsingBlock(const EnumerationBlock& block) {
   const std::string& path = url_.native();
-  Statement statement(db_, path);
-  if (!statement.prepare(kEnumerateSQL)) {
+  QRVSQLiteStatement statement(db_, kEnumerateSQL, path);
+  if (!statement.prepared()) {
     return QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_prepare(select) for {} failed: {}", path,
-                     statement.errmsg());
+                     statement.errorMessage());
   }
   for (;;) {
-    int rc = sqlite3_step(statement.get());
-    if (rc == SQLITE_DONE) return std::nullopt;
-    if (rc != SQLITE_ROW) {
-      return QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_step for {} failed: {}", path, statement.errmsg());
+    Step step = statement.step();
+    if (step == Step::kDone) return std::nullopt;
+    if (step != Step::kRow) {
+      return QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_step for {} failed: {}", path,
+                       statement.errorMessage());
     }
     // Everything made for a row lives in this scope, so the walk holds one
     // row's objects at a time however large the table grows.
-    std::shared_ptr<QRVCodeSigningEntry> entry =
-        _codeSigningEntryFromStatementRow(statement.get(), nullptr);
+    std::shared_ptr<QRVCodeSigningEntry> entry = _codeSigningEntryFromStatementRow(statement, nullptr);
     if (!entry) continue;  // logged where it failed
-    std::optional<std::string_view> text = columnText(statement.get(), 5);
+    std::optional<std::string_view> text = statement.columnText(5);
     std::string identifier;
     try {
       if (!text) throw std::bad_alloc();
@@ -634,22 +488,22 @@ std::optional<QRVError> QRVSQLiteDB::enumerateIdentifiersAndCodeSigningInfoUsing
 
 std::optional<std::vector<std::string>> QRVSQLiteDB::identifiersWithError(QRVError* error) {
   const std::string& path = url_.native();
-  Statement statement(db_, path);
-  if (!statement.prepare(kIdentifiersSQL)) {
+  QRVSQLiteStatement statement(db_, kIdentifiersSQL, path);
+  if (!statement.prepared()) {
     QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_prepare(select) for {} failed: {}", path,
-                             statement.errmsg()));
+                             statement.errorMessage()));
     return std::nullopt;
   }
   std::vector<std::string> identifiers;
   for (;;) {
-    int rc = sqlite3_step(statement.get());
-    if (rc == SQLITE_DONE) return identifiers;
-    if (rc != SQLITE_ROW) {
-      QRVFail(error,
-              QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_step for {} failed: {}", path, statement.errmsg()));
+    Step step = statement.step();
+    if (step == Step::kDone) return identifiers;
+    if (step != Step::kRow) {
+      QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_step for {} failed: {}", path,
+                               statement.errorMessage()));
       return std::nullopt;
     }
-    std::optional<std::string_view> text = columnText(statement.get(), 0);
+    std::optional<std::string_view> text = statement.columnText(0);
     try {
       if (!text) throw std::bad_alloc();
       identifiers.emplace_back(*text);
@@ -664,16 +518,16 @@ std::optional<std::vector<std::string>> QRVSQLiteDB::identifiersWithError(QRVErr
 std::optional<std::vector<std::string>> QRVSQLiteDB::childIdentifiersForParentIdentifier(
     std::string_view parentIdentifier, QRVError* error) {
   const std::string& path = url_.native();
-  Statement statement(db_, path);
-  if (!statement.prepare(kChildrenSQL)) {
+  QRVSQLiteStatement statement(db_, kChildrenSQL, path);
+  if (!statement.prepared()) {
     QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_prepare(select) for {} failed: {}", path,
-                             statement.errmsg()));
+                             statement.errorMessage()));
     return std::nullopt;
   }
-  if (bindText(statement.get(), 1, parentIdentifier) != SQLITE_OK) {
+  if (!statement.bindText(1, parentIdentifier)) {
     QRVFail(error,
             QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_bind_text for code_signing_id={} at {} failed: {}",
-                      parentIdentifier, path, statement.errmsg()));
+                      parentIdentifier, path, statement.errorMessage()));
     return std::nullopt;
   }
   std::vector<std::string> children;
@@ -684,14 +538,14 @@ std::optional<std::vector<std::string>> QRVSQLiteDB::childIdentifiersForParentId
     return std::nullopt;
   }
   for (;;) {
-    int rc = sqlite3_step(statement.get());
-    if (rc == SQLITE_DONE) break;
-    if (rc != SQLITE_ROW) {
-      QRVFail(error,
-              QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_step for {} failed: {}", path, statement.errmsg()));
+    Step step = statement.step();
+    if (step == Step::kDone) break;
+    if (step != Step::kRow) {
+      QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_step for {} failed: {}", path,
+                               statement.errorMessage()));
       return std::nullopt;
     }
-    std::optional<std::string_view> text = columnText(statement.get(), 0);
+    std::optional<std::string_view> text = statement.columnText(0);
     try {
       if (!text) throw std::bad_alloc();
       children.emplace_back(*text);
@@ -709,34 +563,34 @@ std::optional<std::vector<std::string>> QRVSQLiteDB::childIdentifiersForParentId
   return children;
 }
 
-std::optional<std::string> QRVSQLiteDB::parentIdentifierForChildIdentifier(
-    std::string_view childIdentifier, QRVError* error) {
+std::optional<std::string> QRVSQLiteDB::parentIdentifierForChildIdentifier(std::string_view childIdentifier,
+                                                                           QRVError* error) {
   const std::string& path = url_.native();
-  Statement statement(db_, path);
-  if (!statement.prepare(kParentSQL)) {
+  QRVSQLiteStatement statement(db_, kParentSQL, path);
+  if (!statement.prepared()) {
     QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_prepare(select) for {} failed: {}", path,
-                             statement.errmsg()));
+                             statement.errorMessage()));
     return std::nullopt;
   }
-  if (bindText(statement.get(), 1, childIdentifier) != SQLITE_OK) {
+  if (!statement.bindText(1, childIdentifier)) {
     QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed,
                              "sqlite3_bind_text for child_code_signing_id_text={} at {} "
                              "failed: {}",
-                             childIdentifier, path, statement.errmsg()));
+                             childIdentifier, path, statement.errorMessage()));
     return std::nullopt;
   }
-  int rc = sqlite3_step(statement.get());
-  if (rc == SQLITE_DONE) {
+  Step step = statement.step();
+  if (step == Step::kDone) {
     QRVFail(error, QRV_ERROR_QUIET(QRVResultCode::kDatabaseNotFound, "Parent identifier for: \"{}\" Not Found in DB",
                                    childIdentifier));
     return std::nullopt;
   }
-  if (rc != SQLITE_ROW) {
-    QRVFail(error,
-            QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_step for {} failed: {}", path, statement.errmsg()));
+  if (step != Step::kRow) {
+    QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_step for {} failed: {}", path,
+                             statement.errorMessage()));
     return std::nullopt;
   }
-  std::optional<std::string_view> text = columnText(statement.get(), 0);
+  std::optional<std::string_view> text = statement.columnText(0);
   try {
     if (!text) throw std::bad_alloc();
     return std::string(*text);
@@ -749,19 +603,19 @@ std::optional<std::string> QRVSQLiteDB::parentIdentifierForChildIdentifier(
 
 bool QRVSQLiteDB::deleteAllAdvanceCopiesOfCodeSigningEntriesWithError(QRVError* error) {
   const std::string& path = url_.native();
-  Statement statement(db_, path);
-  if (!statement.prepare(kDeleteAdvanceCopiesSQL)) {
+  QRVSQLiteStatement statement(db_, kDeleteAdvanceCopiesSQL, path);
+  if (!statement.prepared()) {
     return QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_prepare(delete) for {} failed: {}", path,
-                                    statement.errmsg()));
+                                    statement.errorMessage()));
   }
-  if (sqlite3_bind_int(statement.get(), 1, kAdvanceCopyBit) != SQLITE_OK) {
+  if (!statement.bindInt(1, kAdvanceCopyBit)) {
     return QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_bind_text for flags={} at {} failed: {}",
-                                    kAdvanceCopyBit, path, statement.errmsg()));
+                                    kAdvanceCopyBit, path, statement.errorMessage()));
   }
-  if (sqlite3_step(statement.get()) != SQLITE_DONE) {
-    return QRVFail(
-        error, QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_step for {} failed: {}", path, statement.errmsg()));
+  if (statement.step() != Step::kDone) {
+    return QRVFail(error, QRV_ERROR(QRVResultCode::kDatabaseFailed, "sqlite3_step for {} failed: {}", path,
+                                    statement.errorMessage()));
   }
-  QRVLogNotice("Deleted {} advance copies of code signing info.", sqlite3_changes(db_));
+  QRVLogNotice("Deleted {} advance copies of code signing info.", statement.changes());
   return true;
 }

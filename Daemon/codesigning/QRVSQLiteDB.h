@@ -34,7 +34,7 @@
 #include "codesigning/QRVCodeSigningEntry.h"
 
 struct sqlite3;
-struct sqlite3_stmt;
+class QRVSQLiteStatement;
 
 class QRVSQLiteDB {
  public:
@@ -149,7 +149,7 @@ class QRVSQLiteDB {
   bool _insertCodeSigningData(const QRVCodeSigningEntry& entry, std::string_view identifier,
                               QRVError* error);
   bool _insertChildIdentifier(std::string_view child, std::string_view parent, QRVError* error);
-  std::shared_ptr<QRVCodeSigningEntry> _codeSigningEntryFromStatementRow(sqlite3_stmt* statement,
+  std::shared_ptr<QRVCodeSigningEntry> _codeSigningEntryFromStatementRow(const QRVSQLiteStatement& statement,
                                                                          QRVError* error);
   bool _sqliteExec(const char* statement, QRVError* error);
 

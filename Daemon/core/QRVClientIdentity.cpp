@@ -1,15 +1,14 @@
 #include "core/QRVClientIdentity.h"
 
-#include <mutex>
-
 #include "base/QRVLog.h"
+#include "base/QRVMutex.h"
 
 namespace {
 
 // The installer's last identity. Read and written only under its lock, which
 // is never held while the platform is asked anything.
-std::mutex gInstallerSlotLock;
-std::shared_ptr<const QRVClientIdentity> gInstallerSlot;
+QRVMutex gInstallerSlotLock;
+std::shared_ptr<const QRVClientIdentity> gInstallerSlot GUARDED_BY(gInstallerSlotLock);
 
 }  // namespace
 
@@ -38,7 +37,7 @@ std::shared_ptr<const QRVClientIdentity> QRVClientIdentity::clientIdentityWithRe
   std::shared_ptr<const QRVClientIdentity> identity;
   bool cached = false;
   if (isInstaller) {
-    std::lock_guard<std::mutex> lock(gInstallerSlotLock);
+    QRVMutexLock lock(&gInstallerSlotLock);
     if (gInstallerSlot && gInstallerSlot->auditToken() == token) {
       identity = gInstallerSlot;
       cached = true;
@@ -59,7 +58,7 @@ std::shared_ptr<const QRVClientIdentity> QRVClientIdentity::clientIdentityWithRe
                                                            sandboxed, token);
     }
     if (isInstaller) {
-      std::lock_guard<std::mutex> lock(gInstallerSlotLock);
+      QRVMutexLock lock(&gInstallerSlotLock);
       gInstallerSlot = identity;
     }
   }

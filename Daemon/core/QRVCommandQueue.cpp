@@ -9,7 +9,7 @@ void QRVCommandQueue::insertCommand(std::shared_ptr<QRVCommand> command) {
   uint64_t type = command->command();
   const void* address = command.get();
   {
-    std::lock_guard<std::mutex> lock(mutex_);
+    QRVMutexLock lock(&mutex_);
     commands_.push_back(std::move(command));
   }
   QRVLogInfo("Added command <{}; {}> to queue", address, type);
@@ -18,7 +18,7 @@ void QRVCommandQueue::insertCommand(std::shared_ptr<QRVCommand> command) {
 bool QRVCommandQueue::executeNextCommandWithError(uint64_t* result) {
   std::shared_ptr<QRVCommand> command;
   {
-    std::lock_guard<std::mutex> lock(mutex_);
+    QRVMutexLock lock(&mutex_);
     if (!commands_.empty()) {
       command = std::move(commands_.front());
       commands_.pop_front();
@@ -52,13 +52,13 @@ bool QRVCommandQueue::executeAllUntilExhaustedOrError(uint64_t* result) {
   // are destroyed outside the lock, which their destructors may want.
   std::deque<std::shared_ptr<QRVCommand>> dropped;
   {
-    std::lock_guard<std::mutex> lock(mutex_);
+    QRVMutexLock lock(&mutex_);
     dropped.swap(commands_);
   }
   return false;
 }
 
 size_t QRVCommandQueue::pendingCount() {
-  std::lock_guard<std::mutex> lock(mutex_);
+  QRVMutexLock lock(&mutex_);
   return commands_.size();
 }

@@ -14,8 +14,8 @@
 #include <cstdint>
 #include <deque>
 #include <memory>
-#include <mutex>
 
+#include "base/QRVMutex.h"
 #include "base/QRVSerialQueue.h"
 
 class QRVCommandQueue;
@@ -47,6 +47,6 @@ class QRVCommandQueue {
 
  private:
   std::shared_ptr<QRVSerialQueue> queue_;
-  std::mutex mutex_;
-  std::deque<std::shared_ptr<QRVCommand>> commands_;  // GUARDED_BY(mutex_)
+  QRVMutex mutex_;
+  std::deque<std::shared_ptr<QRVCommand>> commands_ GUARDED_BY(mutex_);
 };

@@ -71,7 +71,7 @@ void QRVDaemon::quorvad_init() {
 void QRVDaemon::lockStateCallback() {
   int state = services_->platform.lockState->currentLockState();
   QRVLogDebug("LockState={}", state);
-  std::lock_guard<std::mutex> lock(lockStateMutex_);
+  QRVMutexLock lock(&lockStateMutex_);
   if (state == 1 && lockStateFlag_ != 1) {
     services_->lockStateQueue->suspend();
     lockStateFlag_ = 1;

@@ -10,8 +10,8 @@
 
 #include <atomic>
 #include <memory>
-#include <mutex>
 
+#include "base/QRVMutex.h"
 #include "base/QRVSerialQueue.h"
 #include "core/QRVRelayDispatcher.h"
 #include "core/QRVServices.h"
@@ -58,6 +58,6 @@ class QRVDaemon {
   std::shared_ptr<QRVClientConnection> sharedConnection_;
   bool firstBoot_ = false;
 
-  std::mutex lockStateMutex_;
-  int lockStateFlag_ = 0;  // GUARDED_BY(lockStateMutex_): 1 = lock-state queue suspended by us
+  QRVMutex lockStateMutex_;
+  int lockStateFlag_ GUARDED_BY(lockStateMutex_) = 0;  // 1 = lock-state queue suspended by us
 };

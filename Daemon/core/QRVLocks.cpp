@@ -3,12 +3,12 @@
 #include <algorithm>
 #include <atomic>
 #include <climits>
-#include <condition_variable>
 #include <memory>
-#include <mutex>
 #include <unordered_map>
 
+#include "base/QRVCondVar.h"
 #include "base/QRVLog.h"
+#include "base/QRVMutex.h"
 #include "core/QRVExceptionReporter.h"
 
 namespace {
@@ -18,32 +18,35 @@ namespace {
 // pthread write lock must be released by the thread that took it and our
 // callers hand locks across queues.
 struct LockRecord {
-  std::mutex mutex;  // taken after the table mutex, never before it
-  std::condition_variable changed;
-  uint32_t writersWaiting = 0;         // GUARDED_BY(mutex)
-  std::atomic<int32_t> lockState{0};   // 0 free, -1 write-held, n readers; changed under `mutex`
-  uint64_t refCount = 0;               // GUARDED_BY(LockTable::mutex): holders plus waiters
+  QRVMutex mutex;  // taken after the table mutex, never before it
+  QRVCondVar changed;
+  uint32_t writersWaiting GUARDED_BY(mutex) = 0;
+  std::atomic<int32_t> lockState{0};  // 0 free, -1 write-held, n readers; changed under `mutex`
+  // Holders plus waiters. Guarded by the table's mutex, not this record's:
+  // the analysis cannot name the mutex of another object, so this one is
+  // checked by reading take_one_lock and unlock_one_lock only.
+  uint64_t refCount = 0;
 };
 
 struct LockTable {
-  std::mutex mutex;
+  QRVMutex mutex;
   // Made on first use, like every record in it.
-  std::unique_ptr<std::unordered_map<std::string, std::unique_ptr<LockRecord>>> identifierToLockMap;
-  int32_t allReaderWriterState = 0;    // 0 none, -1 all-write held, n all-read holders
-  uint32_t identifierReaderCount = 0;  // read locks taken or being taken
-  uint32_t identifierWriterCount = 0;  // write locks taken or being taken
+  std::unique_ptr<std::unordered_map<std::string, std::unique_ptr<LockRecord>>> identifierToLockMap GUARDED_BY(mutex)
+      PT_GUARDED_BY(mutex);
+  int32_t allReaderWriterState GUARDED_BY(mutex) = 0;    // 0 none, -1 all-write held, n all-read holders
+  uint32_t identifierReaderCount GUARDED_BY(mutex) = 0;  // read locks taken or being taken
+  uint32_t identifierWriterCount GUARDED_BY(mutex) = 0;  // write locks taken or being taken
   // (a) identifier writers wait for no all-identifiers lock at all.
-  std::condition_variable identifierWritersWaitForNoGlobal;
+  QRVCondVar identifierWritersWaitForNoGlobal;
   // (b) identifier readers wait for no all-identifiers writer.
-  std::condition_variable identifierReadersWaitForNoGlobalWriter;
+  QRVCondVar identifierReadersWaitForNoGlobalWriter;
   // (c) an all-identifiers writer waits for nothing held.
-  std::condition_variable globalWriterWaitsForNothingHeld;
+  QRVCondVar globalWriterWaitsForNothingHeld;
   // (d) all-identifiers readers wait for no identifier writer and no
   // all-identifiers writer.
-  std::condition_variable globalReadersWaitForNoWriter;
+  QRVCondVar globalReadersWaitForNoWriter;
 
-  // REQUIRES: mutex held.
-  bool nothingHeld() const {
+  bool nothingHeld() const REQUIRES(mutex) {
     return identifierReaderCount == 0 && identifierWriterCount == 0 && allReaderWriterState == 0;
   }
 };
@@ -84,13 +87,13 @@ void lock_all_identifiers_in_mode(QRVLockMode mode) {
   QRVLogDebug("Waiting to lock all identifiers for {}", modeName(mode));
   LockTable& t = gQRVLocks();
   {
-    std::unique_lock<std::mutex> lock(t.mutex);
+    QRVMutexLock lock(&t.mutex);
     if (mode == QRVLockMode::kWrite) {
-      t.globalWriterWaitsForNothingHeld.wait(lock, [&] { return t.nothingHeld(); });
+      while (!t.nothingHeld()) t.globalWriterWaitsForNothingHeld.wait(&t.mutex);
       t.allReaderWriterState = -1;
     } else {
-      t.globalReadersWaitForNoWriter.wait(
-          lock, [&] { return t.identifierWriterCount == 0 && t.allReaderWriterState != -1; });
+      while (t.identifierWriterCount != 0 || t.allReaderWriterState == -1)
+        t.globalReadersWaitForNoWriter.wait(&t.mutex);
       if (t.allReaderWriterState == INT32_MAX) invariantBroken("Too many holders of the all-identifiers read lock");
       t.allReaderWriterState++;
     }
@@ -118,12 +121,12 @@ void take_one_lock(const std::string& identifier, QRVLockMode mode) {
   LockTable& t = gQRVLocks();
   LockRecord* record;
   {
-    std::unique_lock<std::mutex> lock(t.mutex);
+    QRVMutexLock lock(&t.mutex);
     if (writer) {
-      t.identifierWritersWaitForNoGlobal.wait(lock, [&] { return t.allReaderWriterState == 0; });
+      while (t.allReaderWriterState != 0) t.identifierWritersWaitForNoGlobal.wait(&t.mutex);
       t.identifierWriterCount++;
     } else {
-      t.identifierReadersWaitForNoGlobalWriter.wait(lock, [&] { return t.allReaderWriterState != -1; });
+      while (t.allReaderWriterState == -1) t.identifierReadersWaitForNoGlobalWriter.wait(&t.mutex);
       t.identifierReaderCount++;
     }
     if (!t.identifierToLockMap)
@@ -139,17 +142,17 @@ void take_one_lock(const std::string& identifier, QRVLockMode mode) {
   // Waiting here holds only the record's mutex (released while asleep), so
   // a contended identifier never blocks the table.
   {
-    std::unique_lock<std::mutex> lock(record->mutex);
+    QRVMutexLock lock(&record->mutex);
     if (writer) {
       record->writersWaiting++;
-      record->changed.wait(lock, [&] { return record->lockState.load() == 0; });
+      while (record->lockState.load() != 0) record->changed.wait(&record->mutex);
       record->writersWaiting--;
       int32_t expected = 0;
       if (!record->lockState.compare_exchange_strong(expected, -1))
         invariantBroken(fmt::format("Write lock on identifier {} found lock state {}", identifier, expected));
     } else {
       // A waiting writer holds back new readers, so it is never starved.
-      record->changed.wait(lock, [&] { return record->lockState.load() >= 0 && record->writersWaiting == 0; });
+      while (record->lockState.load() < 0 || record->writersWaiting != 0) record->changed.wait(&record->mutex);
       int32_t previous = record->lockState.fetch_add(1);
       if (previous < 0)
         invariantBroken(fmt::format("Read lock on identifier {} found lock state {}", identifier, previous));
@@ -162,7 +165,7 @@ void unlock_one_lock(const std::string& identifier) {
   LockTable& t = gQRVLocks();
   bool destroyed = false;
   {
-    std::lock_guard<std::mutex> lock(t.mutex);
+    QRVMutexLock lock(&t.mutex);
     if (!t.identifierToLockMap)
       invariantBroken(fmt::format("Unlocking identifier {} before any identifier was locked", identifier));
     auto it = t.identifierToLockMap->find(identifier);
@@ -179,7 +182,7 @@ void unlock_one_lock(const std::string& identifier) {
       if (t.identifierReaderCount == 0)
         invariantBroken(fmt::format("Unlocking reader of {} with no identifier readers counted", identifier));
       t.identifierReaderCount--;
-      if (t.nothingHeld()) t.globalWriterWaitsForNothingHeld.notify_one();
+      if (t.nothingHeld()) t.globalWriterWaitsForNothingHeld.signal();
     } else {
       if (t.allReaderWriterState != 0)
         invariantBroken(fmt::format("Identifier {} was write-locked under an all-identifiers lock (state {})",
@@ -187,13 +190,13 @@ void unlock_one_lock(const std::string& identifier) {
       if (t.identifierWriterCount == 0)
         invariantBroken(fmt::format("Unlocking writer of {} with no identifier writers counted", identifier));
       t.identifierWriterCount--;
-      if (t.nothingHeld()) t.globalWriterWaitsForNothingHeld.notify_one();
-      if (t.identifierWriterCount == 0 && t.allReaderWriterState != -1) t.globalReadersWaitForNoWriter.notify_all();
+      if (t.nothingHeld()) t.globalWriterWaitsForNothingHeld.signal();
+      if (t.identifierWriterCount == 0 && t.allReaderWriterState != -1) t.globalReadersWaitForNoWriter.signalAll();
     }
 
     record->refCount--;
     {
-      std::lock_guard<std::mutex> recordLock(record->mutex);
+      QRVMutexLock recordLock(&record->mutex);
       if (reader) {
         int32_t previous = record->lockState.fetch_sub(1);
         if (previous <= 0)
@@ -204,7 +207,7 @@ void unlock_one_lock(const std::string& identifier) {
           invariantBroken(fmt::format("Write unlock of identifier {} found lock state {}", identifier, expected));
       }
     }
-    record->changed.notify_all();
+    record->changed.signalAll();
 
     // Nobody holds or waits for it (waiters are counted): safe to free.
     if (record->refCount == 0) {
@@ -245,18 +248,18 @@ void lock_all_identifiers_for_writing() { lock_all_identifiers_in_mode(QRVLockMo
 void unlock_all_identifiers() {
   LockTable& t = gQRVLocks();
   {
-    std::lock_guard<std::mutex> lock(t.mutex);
+    QRVMutexLock lock(&t.mutex);
     if (t.allReaderWriterState != -1) {
       if (t.allReaderWriterState <= 0) invariantBroken("Unlocking all identifiers, but no all-identifiers lock is held");
       t.allReaderWriterState--;
-      if (t.allReaderWriterState == 0) t.identifierWritersWaitForNoGlobal.notify_all();
-      if (t.nothingHeld()) t.globalWriterWaitsForNothingHeld.notify_one();
+      if (t.allReaderWriterState == 0) t.identifierWritersWaitForNoGlobal.signalAll();
+      if (t.nothingHeld()) t.globalWriterWaitsForNothingHeld.signal();
     } else {
       t.allReaderWriterState = 0;
-      t.globalWriterWaitsForNothingHeld.notify_one();
-      t.globalReadersWaitForNoWriter.notify_all();
-      t.identifierWritersWaitForNoGlobal.notify_all();
-      t.identifierReadersWaitForNoGlobalWriter.notify_all();
+      t.globalWriterWaitsForNothingHeld.signal();
+      t.globalReadersWaitForNoWriter.signalAll();
+      t.identifierWritersWaitForNoGlobal.signalAll();
+      t.identifierReadersWaitForNoGlobalWriter.signalAll();
     }
   }
   QRVLogDebug("Unlocked all identifiers");
@@ -264,7 +267,7 @@ void unlock_all_identifiers() {
 
 QRVLockTableSnapshot TEST_lock_table_snapshot() {
   LockTable& t = gQRVLocks();
-  std::lock_guard<std::mutex> lock(t.mutex);
+  QRVMutexLock lock(&t.mutex);
   QRVLockTableSnapshot s;
   s.recordCount = t.identifierToLockMap ? t.identifierToLockMap->size() : 0;
   s.allReaderWriterState = t.allReaderWriterState;
@@ -275,7 +278,7 @@ QRVLockTableSnapshot TEST_lock_table_snapshot() {
 
 std::optional<QRVLockRecordSnapshot> TEST_lock_record_snapshot(const std::string& identifier) {
   LockTable& t = gQRVLocks();
-  std::lock_guard<std::mutex> lock(t.mutex);
+  QRVMutexLock lock(&t.mutex);
   if (!t.identifierToLockMap) return std::nullopt;
   auto it = t.identifierToLockMap->find(identifier);
   if (it == t.identifierToLockMap->end()) return std::nullopt;

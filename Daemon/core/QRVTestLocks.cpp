@@ -116,7 +116,7 @@ bool QRVTestLocks::setLockFromCommand(uint64_t lock, bool enable, QRVError* erro
   if (lock >= kLockCount) {
     if (lock == kLockCount && !enable) {
       {
-        std::lock_guard<std::mutex> guard(commandMutex_);
+        QRVMutexLock guard(&commandMutex_);
         heldByCommand_.reset();
       }
       setEnabled(false);
@@ -126,7 +126,7 @@ bool QRVTestLocks::setLockFromCommand(uint64_t lock, bool enable, QRVError* erro
   }
   if (enable) {
     {
-      std::lock_guard<std::mutex> guard(commandMutex_);
+      QRVMutexLock guard(&commandMutex_);
       if (heldByCommand_.test(lock)) return true;
       heldByCommand_.set(lock);
     }
@@ -136,7 +136,7 @@ bool QRVTestLocks::setLockFromCommand(uint64_t lock, bool enable, QRVError* erro
   }
   bool noneLeft;
   {
-    std::lock_guard<std::mutex> guard(commandMutex_);
+    QRVMutexLock guard(&commandMutex_);
     if (!heldByCommand_.test(lock)) return true;
     if (lock == kGlobalReadLock || lock == kGlobalWriteLock) {
       // One all-identifiers lock underneath: releasing either gives it up.

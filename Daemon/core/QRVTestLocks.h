@@ -18,10 +18,10 @@
 #include <bitset>
 #include <cstdint>
 #include <memory>
-#include <mutex>
 #include <semaphore>
 
 #include "base/QRVError.h"
+#include "base/QRVMutex.h"
 #include "base/QRVSerialQueue.h"
 
 class QRVTestLocks {
@@ -79,6 +79,6 @@ class QRVTestLocks {
   std::array<int64_t, kLockCount> lockCount_{};                    // changed on stateQueue_ only
   std::atomic<bool> enabled_{false};
 
-  std::mutex commandMutex_;
-  std::bitset<kLockCount> heldByCommand_;  // GUARDED_BY(commandMutex_)
+  QRVMutex commandMutex_;
+  std::bitset<kLockCount> heldByCommand_ GUARDED_BY(commandMutex_);
 };

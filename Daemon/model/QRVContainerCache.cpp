@@ -45,7 +45,7 @@ QRVContainerCache::QRVContainerCache(std::shared_ptr<QRVFileManager> fileManager
 // ---- The lock ----
 
 QRVContainerCache::Locker::Locker(QRVContainerCache& cache) : cache_(cache) {
-  cache_.cacheLock_.lock();
+  cache.cacheLock_.lock();
   cache_.cacheLockHolder_.store(std::this_thread::get_id(), std::memory_order_relaxed);
 }
 

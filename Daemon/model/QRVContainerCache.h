@@ -10,7 +10,8 @@
 //
 // One per process (QRVServices::containerCache). Thread-safe: both maps live
 // under one lock, which is held while a class directory is read. Methods
-// named `_lock_` require it and check that the calling thread holds it.
+// named `_lock_` require it (checked by clang's thread-safety analysis) and
+// check at run time that the calling thread holds it.
 // While the lock is held the cache calls the user identity cache, the seams
 // and the sandbox facility, none of which may call back into it. Callers that
 // create containers additionally hold the global identifier locks, which
@@ -20,7 +21,6 @@
 #include <atomic>
 #include <map>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <set>
 #include <string>
@@ -29,6 +29,7 @@
 #include <vector>
 
 #include "base/QRVError.h"
+#include "base/QRVMutex.h"
 #include "model/QRVContainerCacheSeams.h"
 #include "model/QRVContainerClass.h"
 #include "model/QRVContainerIdentity.h"
@@ -133,35 +134,38 @@ class QRVContainerCache {
   using ClassMap = std::map<std::string, Entry>;
 
   // The cache lock, recording its holder so `_lock_` methods can check it.
-  class Locker {
+  class SCOPED_CAPABILITY Locker {
    public:
-    explicit Locker(QRVContainerCache& cache);
-    ~Locker();
+    explicit Locker(QRVContainerCache& cache) ACQUIRE(cache.cacheLock_);
+    ~Locker() RELEASE();
     Locker(const Locker&) = delete;
     Locker& operator=(const Locker&) = delete;
 
    private:
     QRVContainerCache& cache_;
   };
-  void _lock_assertHeld() const;
+  // Ends the process unless the calling thread holds the lock: the run-time
+  // twin of the REQUIRES below, for builds the analysis never sees (g++).
+  void _lock_assertHeld() const ASSERT_CAPABILITY(cacheLock_);
 
   // The class's map, built from disk on first use; null with the listing's
   // error when the class directory cannot be read. With
   // `populateSandboxCache`, a map built now has its containers pushed.
   // The pointer stays valid while the lock is held.
   ClassMap* _lock_getCacheForUserIdentity(const QRVUserIdentityRef& userIdentity, QRVContainerClass contentClass,
-                                          bool transient, bool populateSandboxCache, QRVError* error);
-  ClassMap* _lock_existingCacheForUserIdentity(const QRVUserIdentityRef& userIdentity,
-                                               QRVContainerClass contentClass, bool transient);
+                                          bool transient, bool populateSandboxCache, QRVError* error)
+      REQUIRES(cacheLock_);
+  ClassMap* _lock_existingCacheForUserIdentity(const QRVUserIdentityRef& userIdentity, QRVContainerClass contentClass,
+                                               bool transient) REQUIRES(cacheLock_);
   bool _lock_shouldRegisterSandboxMappingWithUserIdentity(const QRVUserIdentityRef& userIdentity,
                                                           const std::string& identifier,
-                                                          QRVContainerClass containerClass);
+                                                          QRVContainerClass containerClass) REQUIRES(cacheLock_);
   // Takes the sandbox decision for `entry` and `userIdentity` unless it was
   // taken before, and pushes the mapping when it says so.
   void _lock_registerWithSandboxIfNeeded(Entry* entry, const QRVUserIdentityRef& userIdentity,
-                                         QRVContainerClass containerClass);
+                                         QRVContainerClass containerClass) REQUIRES(cacheLock_);
   QRVMetadataRef _lock_containerForContainerIdentity(const QRVContainerIdentity& containerIdentity, bool transient,
-                                                     bool updateSandbox, QRVError* error);
+                                                     bool updateSandbox, QRVError* error) REQUIRES(cacheLock_);
 
   const std::shared_ptr<QRVFileManager> fileManager_;
   const std::shared_ptr<QRVGlobalConfiguration> globalConfiguration_;
@@ -171,8 +175,8 @@ class QRVContainerCache {
   const std::shared_ptr<QRVWellKnownNames> wellKnownNames_;
 
   // Not recursive: nothing called under it re-enters the cache.
-  std::mutex cacheLock_;
+  QRVMutex cacheLock_;
   std::atomic<std::thread::id> cacheLockHolder_{};
-  std::unordered_map<std::string, ClassMap> liveContainerCache_;       // GUARDED_BY(cacheLock_)
-  std::unordered_map<std::string, ClassMap> transientContainerCache_;  // GUARDED_BY(cacheLock_)
+  std::unordered_map<std::string, ClassMap> liveContainerCache_ GUARDED_BY(cacheLock_);
+  std::unordered_map<std::string, ClassMap> transientContainerCache_ GUARDED_BY(cacheLock_);
 };

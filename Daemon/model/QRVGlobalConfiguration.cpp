@@ -33,7 +33,7 @@ std::string QRVGlobalConfiguration::pathUnderRoot(const std::string& path) const
 
 std::string QRVGlobalConfiguration::remembered(std::string* slot, const std::string& path, uid_t owner,
                                                uint32_t protectionClass, const char* failureMessage) {
-  std::lock_guard<std::recursive_mutex> lock(monitor_);
+  QRVRecursiveMutexLock lock(&monitor_);
   if (slot->empty()) *slot = path;
   QRVError error;
   if (!fileManager_->createDirectoryAtURL(*slot, true, 0755, owner, protectionClass, &error))
@@ -47,13 +47,13 @@ std::string QRVGlobalConfiguration::sharedContainersDirectory() {
 }
 
 std::string QRVGlobalConfiguration::bundleDirectory() {
-  std::lock_guard<std::recursive_mutex> lock(monitor_);
+  QRVRecursiveMutexLock lock(&monitor_);
   return remembered(&bundleDirectory_, join(sharedContainersDirectory(), "Bundle"), 0,
                     QRVFileManager::kLeaveProtectionClassAlone, "Failed to create bundle dir");
 }
 
 std::string QRVGlobalConfiguration::transientBundleDirectory() {
-  std::lock_guard<std::recursive_mutex> lock(monitor_);
+  QRVRecursiveMutexLock lock(&monitor_);
   return remembered(&transientBundleDirectory_, join(sharedContainersDirectory(), "Temp"), CONTAINER_INSTALLATION_UID,
                     QRVFileManager::kLeaveProtectionClassAlone, "Failed to create transient bundle dir");
 }
@@ -78,31 +78,31 @@ std::string QRVGlobalConfiguration::logDirectory() {
 }
 
 std::string QRVGlobalConfiguration::pendingUpdatesDirectory() {
-  std::lock_guard<std::recursive_mutex> lock(monitor_);
+  QRVRecursiveMutexLock lock(&monitor_);
   return remembered(&pendingUpdatesDirectory_, join(libraryDirectory(), "PendingUpdates"), 0,
                     QRVFileManager::kLeaveProtectionClassAlone, "Failed to create updates dir");
 }
 
 std::string QRVGlobalConfiguration::replaceDirectory() {
-  std::lock_guard<std::recursive_mutex> lock(monitor_);
+  QRVRecursiveMutexLock lock(&monitor_);
   return remembered(&replaceDirectory_, join(libraryDirectory(), "Replace"), 0,
                     QRVFileManager::kLeaveProtectionClassAlone, "Failed to create replace dir");
 }
 
 std::string QRVGlobalConfiguration::deathrowDirectory() {
-  std::lock_guard<std::recursive_mutex> lock(monitor_);
+  QRVRecursiveMutexLock lock(&monitor_);
   return remembered(&deathrowDirectory_, join(cachesDirectory(), "Dead"), 0,
                     QRVFileManager::kLeaveProtectionClassAlone, "Failed to create deathrow dir");
 }
 
 std::string QRVGlobalConfiguration::stagingDirectory() {
-  std::lock_guard<std::recursive_mutex> lock(monitor_);
+  QRVRecursiveMutexLock lock(&monitor_);
   return remembered(&stagingDirectory_, join(cachesDirectory(), "Staging"), 0,
                     QRVFileManager::kLeaveProtectionClassAlone, "Failed to create staging dir");
 }
 
 std::string QRVGlobalConfiguration::transientDirectory() {
-  std::lock_guard<std::recursive_mutex> lock(monitor_);
+  QRVRecursiveMutexLock lock(&monitor_);
   return remembered(&transientDirectory_, join(cachesDirectory(), "Temp"), 0,
                     QRVFileManager::kLeaveProtectionClassAlone, "Failed to create transient dir");
 }
@@ -123,7 +123,7 @@ std::optional<std::string> QRVGlobalConfiguration::globalContainerBaseURLWithCon
 
 std::optional<std::string> QRVGlobalConfiguration::containerDirectoryURLForUserIdentity(
     const QRVUserIdentityRef& userIdentity, QRVContainerClass contentClass, bool transient) {
-  std::lock_guard<std::recursive_mutex> lock(monitor_);
+  QRVRecursiveMutexLock lock(&monitor_);
   bool bundle = QRVContainerClassIsBundle(contentClass), system = QRVContainerClassIsSystem(contentClass);
   if (!bundle && !system) {
     if (!userIdentity) return std::nullopt;
@@ -141,7 +141,7 @@ std::optional<std::string> QRVGlobalConfiguration::containerDirectoryURLForUserI
 
 std::string QRVGlobalConfiguration::stagingDirectoryURLForUserIdentity(const QRVUserIdentityRef& userIdentity,
                                                                        QRVContainerClass contentClass) {
-  std::lock_guard<std::recursive_mutex> lock(monitor_);
+  QRVRecursiveMutexLock lock(&monitor_);
   if (QRVContainerClassIsPerUser(contentClass) && userIdentity)
     return getPerUserConfigurationForUserIdentity(userIdentity)->stagingDirectory();
   return stagingDirectory();
@@ -149,7 +149,7 @@ std::string QRVGlobalConfiguration::stagingDirectoryURLForUserIdentity(const QRV
 
 std::shared_ptr<QRVPerUserConfiguration> QRVGlobalConfiguration::getPerUserConfigurationForUserIdentity(
     const QRVUserIdentityRef& userIdentity) {
-  std::lock_guard<std::recursive_mutex> lock(monitor_);
+  QRVRecursiveMutexLock lock(&monitor_);
   auto& slot = perUserConfigurations_[userIdentity->identifier()];
   if (!slot) slot = std::make_shared<QRVPerUserConfiguration>(userIdentity, fileManager_);
   return slot;
@@ -172,15 +172,15 @@ bool QRVGlobalConfiguration::migrationFileExistsWithName(const std::string& name
 bool QRVGlobalConfiguration::isInternalImage() {
   std::call_once(internalOnce_, [this] {
     bool internal = systemInfo_->isInternalBuild();
-    std::lock_guard<std::mutex> lock(internalMutex_);
+    QRVMutexLock lock(&internalMutex_);
     isInternalImage_ = internal;
   });
-  std::lock_guard<std::mutex> lock(internalMutex_);
+  QRVMutexLock lock(&internalMutex_);
   return isInternalImage_;
 }
 
 void QRVGlobalConfiguration::setIsInternalImage(bool internal) {
   // A value set before the first query is replaced by that query.
-  std::lock_guard<std::mutex> lock(internalMutex_);
+  QRVMutexLock lock(&internalMutex_);
   isInternalImage_ = internal;
 }

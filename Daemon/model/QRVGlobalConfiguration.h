@@ -22,6 +22,8 @@
 #include <string>
 #include <vector>
 
+#include "base/QRVMutex.h"
+#include "base/QRVRecursiveMutex.h"
 #include "fs/QRVFileManager.h"
 #include "model/QRVContainerClass.h"
 #include "model/QRVPerUserConfiguration.h"
@@ -100,13 +102,20 @@ class QRVGlobalConfiguration {
   uid_t mobileUID_ = 0;
   gid_t mobileGID_ = 0;
 
-  std::recursive_mutex monitor_;
-  std::string sharedContainersDirectory_, bundleDirectory_, transientBundleDirectory_, libraryDirectory_,
-      cachesDirectory_, pendingUpdatesDirectory_, replaceDirectory_, deathrowDirectory_, stagingDirectory_,
-      transientDirectory_;  // GUARDED_BY(monitor_)
-  std::map<std::string, std::shared_ptr<QRVPerUserConfiguration>> perUserConfigurations_;  // GUARDED_BY(monitor_)
+  QRVRecursiveMutex monitor_;
+  std::string sharedContainersDirectory_ GUARDED_BY(monitor_);
+  std::string bundleDirectory_ GUARDED_BY(monitor_);
+  std::string transientBundleDirectory_ GUARDED_BY(monitor_);
+  std::string libraryDirectory_ GUARDED_BY(monitor_);
+  std::string cachesDirectory_ GUARDED_BY(monitor_);
+  std::string pendingUpdatesDirectory_ GUARDED_BY(monitor_);
+  std::string replaceDirectory_ GUARDED_BY(monitor_);
+  std::string deathrowDirectory_ GUARDED_BY(monitor_);
+  std::string stagingDirectory_ GUARDED_BY(monitor_);
+  std::string transientDirectory_ GUARDED_BY(monitor_);
+  std::map<std::string, std::shared_ptr<QRVPerUserConfiguration>> perUserConfigurations_ GUARDED_BY(monitor_);
 
   std::once_flag internalOnce_;
-  std::mutex internalMutex_;
-  bool isInternalImage_ = false;  // GUARDED_BY(internalMutex_)
+  QRVMutex internalMutex_;
+  bool isInternalImage_ GUARDED_BY(internalMutex_) = false;
 };

@@ -17,7 +17,7 @@ QRVPerUserConfiguration::QRVPerUserConfiguration(QRVUserIdentityRef userIdentity
 
 std::string QRVPerUserConfiguration::remembered(std::string* slot, const std::string& path,
                                                 const char* failureMessage) {
-  std::lock_guard<std::recursive_mutex> lock(monitor_);
+  QRVRecursiveMutexLock lock(&monitor_);
   if (slot->empty()) *slot = path;
   QRVError error;
   if (!fileManager_->createDirectoryAtURLWithOwner(*slot, true, 0755, userIdentity_->posixUID(), &error))
@@ -30,12 +30,12 @@ std::string QRVPerUserConfiguration::userBaseDirectory() {
 }
 
 std::string QRVPerUserConfiguration::stagingDirectory() {
-  std::lock_guard<std::recursive_mutex> lock(monitor_);
+  QRVRecursiveMutexLock lock(&monitor_);
   return remembered(&stagingDirectory_, join(userBaseDirectory(), "Staging"), "Failed to create staging dir");
 }
 
 std::string QRVPerUserConfiguration::transientDirectory() {
-  std::lock_guard<std::recursive_mutex> lock(monitor_);
+  QRVRecursiveMutexLock lock(&monitor_);
   return remembered(&transientDirectory_, join(userBaseDirectory(), "Temp"), "Failed to create transient dir");
 }
 
@@ -68,7 +68,7 @@ std::optional<std::string> QRVPerUserConfiguration::containerDirectoryURLForCont
     QRVLogError("Invalid class for a per user container directory: {}", contentClass);
     return std::nullopt;
   }
-  std::lock_guard<std::recursive_mutex> lock(monitor_);
+  QRVRecursiveMutexLock lock(&monitor_);
   std::string url = join(transient ? transientDirectory() : userBaseDirectory(),
                          QRVContainerClassRelativeDirectory(contentClass));
   QRVError error;

@@ -6,10 +6,10 @@
 #pragma once
 
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <string>
 
+#include "base/QRVRecursiveMutex.h"
 #include "fs/QRVFileManager.h"
 #include "model/QRVContainerClass.h"
 #include "model/QRVUserIdentity.h"
@@ -44,6 +44,9 @@ class QRVPerUserConfiguration {
   const std::shared_ptr<QRVFileManager> fileManager_;
   const std::string userHomeDirectory_;
 
-  std::recursive_mutex monitor_;
-  std::string userBaseDirectory_, stagingDirectory_, transientDirectory_, libraryDirectory_;  // GUARDED_BY(monitor_)
+  QRVRecursiveMutex monitor_;
+  std::string userBaseDirectory_ GUARDED_BY(monitor_);
+  std::string stagingDirectory_ GUARDED_BY(monitor_);
+  std::string transientDirectory_ GUARDED_BY(monitor_);
+  std::string libraryDirectory_ GUARDED_BY(monitor_);
 };

@@ -9,12 +9,12 @@
 
 #include <functional>
 #include <map>
-#include <mutex>
-#include <set>
-#include <vector>
 #include <memory>
 #include <optional>
+#include <set>
+#include <vector>
 
+#include "base/QRVMutex.h"
 #include "base/QRVPlist.h"
 #include "core/QRVClientIdentity.h"
 #include "core/QRVCommandQueue.h"
@@ -242,6 +242,6 @@ class QRVClientConnection {
   const std::shared_ptr<QRVCommandQueue> commandQueue_;
   const std::shared_ptr<QRVServices> services_;
 
-  std::mutex lookupMemoMutex_;
-  std::map<std::string, std::set<std::string>> lookupMemo_;  // GUARDED_BY(lookupMemoMutex_)
+  QRVMutex lookupMemoMutex_;
+  std::map<std::string, std::set<std::string>> lookupMemo_ GUARDED_BY(lookupMemoMutex_);
 };

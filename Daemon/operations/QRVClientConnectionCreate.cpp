@@ -32,7 +32,7 @@ constexpr const char* kContentProtectionClassKey = "com.kelva.Verdane.ContentPro
 const std::set<std::string>* QRVClientConnection::_lookupForContainerClass(QRVContainerClass containerClass) {
   const char* key = lookupKeyForContainerClass(containerClass);
   if (!key || !lookup_) return nullptr;
-  std::lock_guard<std::mutex> lock(lookupMemoMutex_);
+  QRVMutexLock lock(&lookupMemoMutex_);
   auto it = lookupMemo_.find(key);
   if (it == lookupMemo_.end()) {
     std::set<std::string> identifiers;

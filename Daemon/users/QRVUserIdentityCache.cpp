@@ -30,7 +30,7 @@ QRVUserIdentityCache::QRVUserIdentityCache(std::shared_ptr<QRVPersonaService> pe
   defaultIdentity_ = QRVUserIdentity::makeDefault(home);
   queue_ = QRVSerialQueue::create("com.kelva.quorvad.useridentitycache");
   observerQueue_ = QRVSerialQueue::create("com.kelva.quorvad.personaobserver");
-  std::lock_guard<std::mutex> lock(mutex_);
+  QRVMutexLock lock(&mutex_);
   _lock_flush();
 }
 
@@ -86,12 +86,12 @@ void QRVUserIdentityCache::_lock_flush() {
 }
 
 void QRVUserIdentityCache::flush() {
-  std::lock_guard<std::mutex> lock(mutex_);
+  QRVMutexLock lock(&mutex_);
   _lock_flush();
 }
 
 void QRVUserIdentityCache::flushAndRepopulateWithUserIdentities(const std::vector<QRVUserIdentityRef>& identities) {
-  std::lock_guard<std::mutex> lock(mutex_);
+  QRVMutexLock lock(&mutex_);
   _lock_flush();
   for (const auto& u : identities) {
     if (!u) continue;
@@ -184,7 +184,7 @@ QRVUserIdentityRef QRVUserIdentityCache::userIdentityForCurrentContextWithUID(ui
   applyUIDFloor(&uid, &gid);
   std::optional<uint32_t> persona = QRVCurrentPersona::get();
   QRVUserIdentityRef result;
-  std::unique_lock<std::mutex> lock(mutex_);
+  QRVMutexLock lock(&mutex_);
   _lock_resyncIfNeeded();
   if (!personasSupported_) {
     lock.unlock();
@@ -222,7 +222,7 @@ QRVUserIdentityRef QRVUserIdentityCache::userIdentityForLegacyMobileUser() {
 }
 
 QRVUserIdentityRef QRVUserIdentityCache::userIdentityWithPersonaID(int32_t personaID) {
-  std::lock_guard<std::mutex> lock(mutex_);
+  QRVMutexLock lock(&mutex_);
   _lock_resyncIfNeeded();
   auto it = personaIDToUserIdentityMap_.find(personaID);
   return it == personaIDToUserIdentityMap_.end() ? nullptr : it->second;
@@ -235,13 +235,13 @@ QRVUserIdentityRef QRVUserIdentityCache::userIdentityForPersonalPersonaWithUID(u
 }
 
 QRVUserIdentityRef QRVUserIdentityCache::userIdentityForPersonalPersona() {
-  std::lock_guard<std::mutex> lock(mutex_);
+  QRVMutexLock lock(&mutex_);
   _lock_resyncIfNeeded();
   return userIdentityForPersonalPersona_;
 }
 
 QRVUserIdentityRef QRVUserIdentityCache::unspecificUserIdentity() {
-  std::lock_guard<std::mutex> lock(mutex_);
+  QRVMutexLock lock(&mutex_);
   _lock_resyncIfNeeded();
   return userIdentityForUnspecificPersona_;
 }
@@ -251,7 +251,7 @@ QRVUserIdentityRef QRVUserIdentityCache::userIdentityForPersonaUniqueString(cons
   applyUIDFloor(&uid, &gid);
   QRVUserIdentityRef known;
   {
-    std::lock_guard<std::mutex> lock(mutex_);
+    QRVMutexLock lock(&mutex_);
     _lock_resyncIfNeeded();
     auto it = personaUniqueStringToUserIdentityMap_.find(uniqueString);
     if (it != personaUniqueStringToUserIdentityMap_.end()) known = it->second;
@@ -266,7 +266,7 @@ QRVUserIdentityRef QRVUserIdentityCache::userIdentityForCurrentUserWithPersonaUn
 
 std::vector<QRVUserIdentityRef> QRVUserIdentityCache::userIdentitiesForBundleIdentifier(
     const std::string& bundleIdentifier) {
-  std::lock_guard<std::mutex> lock(mutex_);
+  QRVMutexLock lock(&mutex_);
   _lock_resyncIfNeeded();
   auto it = bundleToEnterpriseIdentitiesMap_.find(bundleIdentifier);
   return it == bundleToEnterpriseIdentitiesMap_.end() ? std::vector<QRVUserIdentityRef>() : it->second;
@@ -284,7 +284,7 @@ void QRVUserIdentityCache::forEachAccessibleUserIdentitySynchronouslyExecuteBloc
     const std::function<void(const QRVUserIdentityRef&)>& block) {
   std::vector<QRVUserIdentityRef> all;
   {
-    std::lock_guard<std::mutex> lock(mutex_);
+    QRVMutexLock lock(&mutex_);
     _lock_resyncIfNeeded();
     if (userIdentityForPersonalPersona_) all.push_back(userIdentityForPersonalPersona_);
     // Not a structured binding: clang before 16 cannot capture one.

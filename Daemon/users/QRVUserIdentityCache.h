@@ -12,13 +12,13 @@
 #include <functional>
 #include <map>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <set>
 #include <string>
 #include <unordered_set>
 #include <vector>
 
+#include "base/QRVMutex.h"
 #include "base/QRVSerialQueue.h"
 #include "model/QRVUserIdentity.h"
 #include "platform/QRVPersonaService.h"
@@ -76,9 +76,9 @@ class QRVUserIdentityCache {
   void personaListDidUpdate();
 
  private:
-  void _lock_flush();
-  void _lock_resyncIfNeeded();
-  bool _lock_resync_fromUserPersonaAttributes(const std::vector<QRVPersona>& personas);
+  void _lock_flush() REQUIRES(mutex_);
+  void _lock_resyncIfNeeded() REQUIRES(mutex_);
+  bool _lock_resync_fromUserPersonaAttributes(const std::vector<QRVPersona>& personas) REQUIRES(mutex_);
   QRVUserIdentityRef identityFromPersona(const QRVPersona& persona, bool forceUnspecific) const;
   // Below 501: the mobile account's ids.
   void applyUIDFloor(uid_t* uid, gid_t* gid) const;
@@ -90,13 +90,13 @@ class QRVUserIdentityCache {
   std::shared_ptr<QRVSerialQueue> observerQueue_;
   std::shared_ptr<bool> alive_;
 
-  std::mutex mutex_;
-  bool cacheInvalid_ = true;                                              // GUARDED_BY(mutex_)
-  bool personasSupported_ = false;                                        // GUARDED_BY(mutex_)
-  std::map<int32_t, QRVUserIdentityRef> personaIDToUserIdentityMap_;      // GUARDED_BY(mutex_)
-  std::map<std::string, QRVUserIdentityRef> personaUniqueStringToUserIdentityMap_;  // GUARDED_BY(mutex_)
-  std::map<std::string, std::vector<QRVUserIdentityRef>> bundleToEnterpriseIdentitiesMap_;  // GUARDED_BY(mutex_)
-  QRVUserIdentityRef userIdentityForPersonalPersona_;                     // GUARDED_BY(mutex_)
-  QRVUserIdentityRef userIdentityForUnspecificPersona_;                   // GUARDED_BY(mutex_)
-  std::vector<QRVPersona> lastPersonas_;                                  // GUARDED_BY(mutex_)
+  QRVMutex mutex_;
+  bool cacheInvalid_ GUARDED_BY(mutex_) = true;
+  bool personasSupported_ GUARDED_BY(mutex_) = false;
+  std::map<int32_t, QRVUserIdentityRef> personaIDToUserIdentityMap_ GUARDED_BY(mutex_);
+  std::map<std::string, QRVUserIdentityRef> personaUniqueStringToUserIdentityMap_ GUARDED_BY(mutex_);
+  std::map<std::string, std::vector<QRVUserIdentityRef>> bundleToEnterpriseIdentitiesMap_ GUARDED_BY(mutex_);
+  QRVUserIdentityRef userIdentityForPersonalPersona_ GUARDED_BY(mutex_);
+  QRVUserIdentityRef userIdentityForUnspecificPersona_ GUARDED_BY(mutex_);
+  std::vector<QRVPersona> lastPersonas_ GUARDED_BY(mutex_);
 };

@@ -5,15 +5,16 @@
 
 #include <cstdio>
 #include <cstring>
-#include <mutex>
+
+#include "base/QRVMutex.h"
 
 // fgetpwent/fgetgrent keep their result in static storage; look-ups are
 // serialised so that concurrent callers cannot see each other's entries.
-static std::mutex gAccountsMutex;
+static QRVMutex gAccountsMutex;
 
 template <typename Pred>
 std::optional<QRVAccount> QRVLinuxAccounts::findAccount(Pred pred) {
-  std::lock_guard<std::mutex> lock(gAccountsMutex);
+  QRVMutexLock lock(&gAccountsMutex);
   FILE* f = fopen(passwdPath_.c_str(), "re");
   if (!f) return std::nullopt;
   std::optional<QRVAccount> found;
@@ -36,7 +37,7 @@ std::optional<QRVAccount> QRVLinuxAccounts::accountForUID(uid_t uid) {
 }
 
 std::optional<gid_t> QRVLinuxAccounts::groupIDForName(const std::string& name) {
-  std::lock_guard<std::mutex> lock(gAccountsMutex);
+  QRVMutexLock lock(&gAccountsMutex);
   FILE* f = fopen(groupPath_.c_str(), "re");
   if (!f) return std::nullopt;
   std::optional<gid_t> found;

@@ -51,12 +51,12 @@ class QRVLinuxMessageService::Connection : public QRVConnection {
   std::optional<uint32_t> personaID() const override { return persona_; }
 
   void setEventHandler(EventHandler handler) override {
-    std::lock_guard<std::mutex> lock(mutex_);
+    QRVMutexLock lock(&mutex_);
     handler_ = std::move(handler);
   }
 
   void resume() override {
-    std::lock_guard<std::mutex> lock(mutex_);
+    QRVMutexLock lock(&mutex_);
     if (resumed_ || closed_) return;
     resumed_ = true;
     epoll_event ev{};
@@ -67,13 +67,13 @@ class QRVLinuxMessageService::Connection : public QRVConnection {
   }
 
   void cancel() override {
-    std::lock_guard<std::mutex> lock(mutex_);
+    QRVMutexLock lock(&mutex_);
     closeLocked("");
   }
 
   void sendReply(uint64_t messageId, const QRVPlist& reply) override {
     std::vector<uint8_t> frame = QRVWireFrame::encode(reply, 0, messageId);
-    std::lock_guard<std::mutex> lock(mutex_);
+    QRVMutexLock lock(&mutex_);
     if (closed_) return;
     if (pendingOutput() == 0) lastProgress_ = nowMillis();
     out_.insert(out_.end(), frame.begin(), frame.end());
@@ -87,7 +87,7 @@ class QRVLinuxMessageService::Connection : public QRVConnection {
 
   // Runs on a worker for an epoll event of this connection.
   void process(uint32_t events) {
-    std::unique_lock<std::mutex> lock(mutex_);
+    QRVMutexLock lock(&mutex_);
     if (closed_ || busy_) return;  // another worker already owns it
     busy_ = true;
     if (events & EPOLLERR) {
@@ -96,10 +96,12 @@ class QRVLinuxMessageService::Connection : public QRVConnection {
       socklen_t len = sizeof err;
       getsockopt(fd_, SOL_SOCKET, SO_ERROR, &err, &len);
       closeLocked(err == ECONNRESET || err == EPIPE || err == 0 ? "" : fmt::format("socket error: {}", strerror(err)));
-      busy_ = false;
+      releaseWorkerLocked();
       return;
     }
     EventHandler handler = handler_;
+    // Stays open while this worker owns the connection (see closeLocked).
+    const int fd = fd_;
     // A connection keeps its worker while it has requests and its replies are
     // being read; the other workers serve everyone else meanwhile.
     for (;;) {
@@ -126,7 +128,7 @@ class QRVLinuxMessageService::Connection : public QRVConnection {
         break;
       }
       lock.unlock();
-      bool wouldBlock = readSome(&problem);
+      bool wouldBlock = readSome(fd, &problem);
       lock.lock();
       if (!problem.empty()) {
         closeLocked(problem);
@@ -134,19 +136,19 @@ class QRVLinuxMessageService::Connection : public QRVConnection {
       }
       if (wouldBlock) break;
     }
-    busy_ = false;
+    releaseWorkerLocked();
     if (!closed_) rearmLocked();
   }
 
   // True when its replies have not moved for longer than `timeout`.
   void closeIfStalled(int64_t now, int64_t timeoutMillis) {
-    std::lock_guard<std::mutex> lock(mutex_);
+    QRVMutexLock lock(&mutex_);
     if (!closed_ && pendingOutput() > 0 && now - lastProgress_ > timeoutMillis)
       closeLocked("client is not reading its replies");
   }
 
  private:
-  size_t pendingOutput() const { return out_.size() - outOffset_; }
+  size_t pendingOutput() const REQUIRES(mutex_) { return out_.size() - outOffset_; }
 
   // Takes the next complete frame out of the input buffer. Only the owning
   // worker touches in_, so no lock is needed.
@@ -179,7 +181,7 @@ class QRVLinuxMessageService::Connection : public QRVConnection {
 
   // Reads what the socket has, up to one chunk. Returns true when it had
   // nothing (would block).
-  bool readSome(std::string* problem) {
+  bool readSome(int fd, std::string* problem) {
     if (inOffset_ > 0) {
       in_.erase(in_.begin(), in_.begin() + static_cast<ptrdiff_t>(inOffset_));
       inOffset_ = 0;
@@ -188,7 +190,7 @@ class QRVLinuxMessageService::Connection : public QRVConnection {
     in_.resize(old + kReadChunk);
     ssize_t n;
     do {
-      n = recv(fd_, in_.data() + old, kReadChunk, 0);
+      n = recv(fd, in_.data() + old, kReadChunk, 0);
     } while (n < 0 && errno == EINTR);
     in_.resize(old + (n > 0 ? static_cast<size_t>(n) : 0));
     if (n == 0) {
@@ -216,7 +218,7 @@ class QRVLinuxMessageService::Connection : public QRVConnection {
   }
 
   // Writes what it can. Returns false when the connection had to be closed.
-  bool flushLocked() {
+  bool flushLocked() REQUIRES(mutex_) {
     while (pendingOutput() > 0) {
       ssize_t n = ::send(fd_, out_.data() + outOffset_, pendingOutput(), MSG_NOSIGNAL | MSG_DONTWAIT);
       if (n < 0) {
@@ -234,7 +236,7 @@ class QRVLinuxMessageService::Connection : public QRVConnection {
     return true;
   }
 
-  void rearmLocked() {
+  void rearmLocked() REQUIRES(mutex_) {
     epoll_event ev{};
     // While replies wait to be written, requests are left unread.
     ev.events = (pendingOutput() > 0 ? EPOLLOUT : EPOLLIN) | EPOLLONESHOT;
@@ -243,16 +245,34 @@ class QRVLinuxMessageService::Connection : public QRVConnection {
       closeLocked(fmt::format("cannot re-arm the connection: {}", strerror(errno)));
   }
 
+  // The worker gives up the connection, finishing a close that came while
+  // it was reading.
+  void releaseWorkerLocked() REQUIRES(mutex_) {
+    busy_ = false;
+    if (closed_ && fd_ >= 0) {
+      ::close(fd_);
+      fd_ = -1;
+    }
+  }
+
   // An empty reason is an ordinary end (the peer left, or the daemon
   // cancelled); anything else is logged as the reason for cutting it off.
-  void closeLocked(const std::string& reason) {
+  void closeLocked(const std::string& reason) REQUIRES(mutex_) {
     if (closed_) return;
     closed_ = true;
     if (!reason.empty())
       QRVLogError("closing connection from pid {} (uid {}): {}", cred_.pid, cred_.uid, reason);
     epoll_ctl(service_->epollFd_, EPOLL_CTL_DEL, fd_, nullptr);
-    ::close(fd_);
-    fd_ = -1;
+    // A worker that owns the connection may be reading the descriptor
+    // outside the lock. Closing it now could give its number to the next
+    // open, and the worker would read another client's bytes. It is shut
+    // down instead, which ends that read at once, and the worker closes it.
+    if (busy_) {
+      ::shutdown(fd_, SHUT_RDWR);
+    } else {
+      ::close(fd_);
+      fd_ = -1;
+    }
     out_.clear();
     outOffset_ = 0;
     service_->forget(id_);
@@ -260,20 +280,20 @@ class QRVLinuxMessageService::Connection : public QRVConnection {
 
   QRVLinuxMessageService* const service_;
   const uint64_t id_;
-  int fd_;
+  int fd_ GUARDED_BY(mutex_);
   int pidfd_;
   const ucred cred_;
   const QRVAuditToken token_;
   const std::optional<uint32_t> persona_;
 
-  std::mutex mutex_;
-  EventHandler handler_;           // GUARDED_BY(mutex_)
-  bool resumed_ = false;           // GUARDED_BY(mutex_)
-  bool busy_ = false;              // GUARDED_BY(mutex_): a worker owns the connection
-  bool closed_ = false;            // GUARDED_BY(mutex_)
-  std::vector<uint8_t> out_;       // GUARDED_BY(mutex_)
-  size_t outOffset_ = 0;           // GUARDED_BY(mutex_)
-  int64_t lastProgress_ = 0;       // GUARDED_BY(mutex_)
+  QRVMutex mutex_;
+  EventHandler handler_ GUARDED_BY(mutex_);
+  bool resumed_ GUARDED_BY(mutex_) = false;
+  bool busy_ GUARDED_BY(mutex_) = false;  // a worker owns the connection
+  bool closed_ GUARDED_BY(mutex_) = false;
+  std::vector<uint8_t> out_ GUARDED_BY(mutex_);
+  size_t outOffset_ GUARDED_BY(mutex_) = 0;
+  int64_t lastProgress_ GUARDED_BY(mutex_) = 0;
 
   // Owned by the worker that holds busy_.
   std::vector<uint8_t> in_;
@@ -293,7 +313,7 @@ QRVLinuxMessageService::~QRVLinuxMessageService() {
   for (auto& t : workers_) t.join();
   std::map<uint64_t, std::shared_ptr<Connection>> connections;
   {
-    std::lock_guard<std::mutex> lock(mutex_);
+    QRVMutexLock lock(&mutex_);
     connections.swap(connections_);
   }
   for (auto& [id, c] : connections) c->cancel();
@@ -420,7 +440,7 @@ void QRVLinuxMessageService::acceptPending() {
     std::optional<uint32_t> persona = QRVProcInfo::personaFromCgroup(cred.pid);
     std::shared_ptr<Connection> connection;
     {
-      std::lock_guard<std::mutex> lock(mutex_);
+      QRVMutexLock lock(&mutex_);
       uint64_t id = nextConnectionId_++;
       connection = std::make_shared<Connection>(this, id, fd, cred, token, pidfd, persona);
       connections_[id] = connection;
@@ -440,7 +460,7 @@ void QRVLinuxMessageService::handleConnectionEvent(uint64_t id, uint32_t events)
 void QRVLinuxMessageService::sweepStalledConnections() {
   std::vector<std::shared_ptr<Connection>> all;
   {
-    std::lock_guard<std::mutex> lock(mutex_);
+    QRVMutexLock lock(&mutex_);
     for (auto& [id, c] : connections_) all.push_back(c);
   }
   int64_t now = nowMillis();
@@ -448,12 +468,12 @@ void QRVLinuxMessageService::sweepStalledConnections() {
 }
 
 void QRVLinuxMessageService::forget(uint64_t id) {
-  std::lock_guard<std::mutex> lock(mutex_);
+  QRVMutexLock lock(&mutex_);
   connections_.erase(id);
 }
 
 std::shared_ptr<QRVLinuxMessageService::Connection> QRVLinuxMessageService::find(uint64_t id) const {
-  std::lock_guard<std::mutex> lock(mutex_);
+  QRVMutexLock lock(&mutex_);
   auto it = connections_.find(id);
   return it == connections_.end() ? nullptr : it->second;
 }
@@ -464,6 +484,6 @@ void QRVLinuxMessageService::endTransaction() { transactions_--; }
 bool QRVLinuxMessageService::isIdle() const { return transactions_ == 0 && openConnections() == 0; }
 
 size_t QRVLinuxMessageService::openConnections() const {
-  std::lock_guard<std::mutex> lock(mutex_);
+  QRVMutexLock lock(&mutex_);
   return connections_.size();
 }

@@ -14,11 +14,11 @@
 #include <chrono>
 #include <map>
 #include <memory>
-#include <mutex>
 #include <string>
 #include <thread>
 #include <vector>
 
+#include "base/QRVMutex.h"
 #include "platform/QRVMessageService.h"
 
 class QRVLinuxMessageService : public QRVMessageService {
@@ -60,9 +60,9 @@ class QRVLinuxMessageService : public QRVMessageService {
   std::shared_ptr<QRVSerialQueue> listenerQueue_;
   ConnectionHandler onConnection_;
 
-  mutable std::mutex mutex_;
-  std::map<uint64_t, std::shared_ptr<Connection>> connections_;  // GUARDED_BY(mutex_)
-  uint64_t nextConnectionId_ = 1;                                 // GUARDED_BY(mutex_)
+  mutable QRVMutex mutex_;
+  std::map<uint64_t, std::shared_ptr<Connection>> connections_ GUARDED_BY(mutex_);
+  uint64_t nextConnectionId_ GUARDED_BY(mutex_) = 1;
 
   std::atomic<long> transactions_{0};
   std::atomic<bool> stopping_{false};

@@ -283,9 +283,12 @@ std::optional<QRVLinuxSandbox::Key> QRVLinuxSandbox::readKey(const std::string& 
   return key;
 }
 
-const QRVLinuxSandbox::Key* QRVLinuxSandbox::key(int* errnum) {
+// Not analysed: the first check reads key_ without the lock, which is safe
+// because key_ is written once, before keyLoaded_ is released, and never
+// again; the analysis sees only the unlocked read.
+const QRVLinuxSandbox::Key* QRVLinuxSandbox::key(int* errnum) NO_THREAD_SAFETY_ANALYSIS {
   if (keyLoaded_.load(std::memory_order_acquire)) return &*key_;
-  std::lock_guard<std::mutex> lock(keyMutex_);
+  QRVMutexLock lock(&keyMutex_);
   if (keyLoaded_.load(std::memory_order_relaxed)) return &*key_;
   int err = 0;
   std::optional<Key> loaded = readKey(options_.keyPath, &err);
@@ -364,7 +367,7 @@ int QRVLinuxSandbox::setUserStateItem(const QRVSandboxUserStateItem& item) {
     return EINVAL;
 
   ItemKey key{item.uid, item.personaID, item.itemType, item.identifier};
-  std::lock_guard<std::mutex> lock(registryMutex_);
+  QRVMutexLock lock(&registryMutex_);
   bool changed;
   if (item.path) {
     auto [it, inserted] = mappings_.try_emplace(key, *item.path);
@@ -384,7 +387,7 @@ int QRVLinuxSandbox::setUserStateItem(const QRVSandboxUserStateItem& item) {
 void QRVLinuxSandbox::writeRegistry() {
   std::map<ItemKey, std::string> snapshot;
   {
-    std::lock_guard<std::mutex> lock(registryMutex_);
+    QRVMutexLock lock(&registryMutex_);
     snapshot = mappings_;
     // A change from now on needs a write of its own.
     writeScheduled_ = false;
@@ -408,7 +411,7 @@ void QRVLinuxSandbox::writeRegistry() {
     QRVLogError("Failed to write the sandbox registry {}: {}", options_.registryPath, strerror(err));
     return;
   }
-  std::lock_guard<std::mutex> lock(registryMutex_);
+  QRVMutexLock lock(&registryMutex_);
   writeCount_++;
 }
 
@@ -426,7 +429,7 @@ void QRVLinuxSandbox::loadRegistry() {
     QRVLogError("Ignoring unreadable sandbox registry {}", options_.registryPath);
     return;
   }
-  std::lock_guard<std::mutex> lock(registryMutex_);
+  QRVMutexLock lock(&registryMutex_);
   for (const QRVPlist& item : root->arrayForKey(kRegistryItemsKey)) {
     const std::string& identifier = item.stringForKey(kItemIdentifierKey);
     const std::string& path = item.stringForKey(kItemPathKey);
@@ -440,7 +443,7 @@ void QRVLinuxSandbox::loadRegistry() {
 void QRVLinuxSandbox::flushRegistry() { registryQueue_->sync([] {}); }
 
 std::vector<QRVSandboxUserStateItem> QRVLinuxSandbox::userStateItems() const {
-  std::lock_guard<std::mutex> lock(registryMutex_);
+  QRVMutexLock lock(&registryMutex_);
   std::vector<QRVSandboxUserStateItem> items;
   for (const auto& [key, path] : mappings_)
     items.push_back({std::get<0>(key), std::get<1>(key), std::get<2>(key), std::get<3>(key), path});
@@ -448,6 +451,6 @@ std::vector<QRVSandboxUserStateItem> QRVLinuxSandbox::userStateItems() const {
 }
 
 uint64_t QRVLinuxSandbox::registryWriteCount() const {
-  std::lock_guard<std::mutex> lock(registryMutex_);
+  QRVMutexLock lock(&registryMutex_);
   return writeCount_;
 }

@@ -26,12 +26,12 @@
 #include <cstdint>
 #include <map>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <tuple>
 #include <vector>
 
+#include "base/QRVMutex.h"
 #include "base/QRVSerialQueue.h"
 #include "platform/QRVSandbox.h"
 
@@ -103,12 +103,12 @@ class QRVLinuxSandbox : public QRVSandbox {
   const Options options_;
   const std::shared_ptr<QRVSerialQueue> registryQueue_;
 
-  std::mutex keyMutex_;
-  std::optional<Key> key_;  // GUARDED_BY(keyMutex_) until `keyLoaded_`, then immutable
+  QRVMutex keyMutex_;
+  std::optional<Key> key_ GUARDED_BY(keyMutex_);  // until `keyLoaded_`, then immutable
   std::atomic<bool> keyLoaded_{false};
 
-  mutable std::mutex registryMutex_;
-  std::map<ItemKey, std::string> mappings_;  // GUARDED_BY(registryMutex_)
-  bool writeScheduled_ = false;              // GUARDED_BY(registryMutex_)
-  uint64_t writeCount_ = 0;                  // GUARDED_BY(registryMutex_)
+  mutable QRVMutex registryMutex_;
+  std::map<ItemKey, std::string> mappings_ GUARDED_BY(registryMutex_);
+  bool writeScheduled_ GUARDED_BY(registryMutex_) = false;
+  uint64_t writeCount_ GUARDED_BY(registryMutex_) = 0;
 };

@@ -104,14 +104,14 @@ const QRVLinuxTrustStore::Entry* QRVLinuxTrustStore::match(const QRVAuditToken& 
 
 std::optional<std::string> QRVLinuxTrustStore::signingIdentifierForAuditToken(const QRVAuditToken& token,
                                                                               QRVError* error) {
-  std::lock_guard<std::mutex> lock(mutex_);
+  QRVMutexLock lock(&mutex_);
   if (const Entry* e = match(token)) return e->signingIdentifier;
   QRVFail(error, QRV_POSIX_ERROR_QUIET(ESRCH, "no signing identifier for pid {}", token.pid()));
   return std::nullopt;
 }
 
 std::optional<QRVPlist> QRVLinuxTrustStore::entitlementsForAuditToken(const QRVAuditToken& token) {
-  std::lock_guard<std::mutex> lock(mutex_);
+  QRVMutexLock lock(&mutex_);
   if (const Entry* e = match(token)) return e->entitlements;
   return std::nullopt;
 }

@@ -8,10 +8,10 @@
 // a change, so look-ups cost no file I/O in the steady state.
 #pragma once
 
-#include <mutex>
 #include <string>
 #include <vector>
 
+#include "base/QRVMutex.h"
 #include "platform/QRVTrustStore.h"
 #include "platform/linux/QRVProcInfo.h"
 
@@ -35,13 +35,13 @@ class QRVLinuxTrustStore : public QRVTrustStore {
   };
 
   // The entry for the live process behind `token`, or null.
-  const Entry* match(const QRVAuditToken& token);
-  void reloadIfChangedLocked();
-  void loadLocked();
+  const Entry* match(const QRVAuditToken& token) REQUIRES(mutex_);
+  void reloadIfChangedLocked() REQUIRES(mutex_);
+  void loadLocked() REQUIRES(mutex_);
 
   const std::string directory_;
-  std::mutex mutex_;
+  QRVMutex mutex_;
   int inotifyFd_ = -1;
-  bool loaded_ = false;        // GUARDED_BY(mutex_)
-  std::vector<Entry> entries_;  // GUARDED_BY(mutex_)
+  bool loaded_ GUARDED_BY(mutex_) = false;
+  std::vector<Entry> entries_ GUARDED_BY(mutex_);
 };

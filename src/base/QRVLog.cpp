@@ -1,16 +1,16 @@
 #include "base/QRVLog.h"
 
+#include <spdlog/sinks/rotating_file_sink.h>
+#include <spdlog/spdlog.h>
 #include <unistd.h>
 
 #include <atomic>
 #include <cstdio>
 #include <cstdlib>
 #include <memory>
-#include <mutex>
 #include <vector>
 
-#include <spdlog/sinks/rotating_file_sink.h>
-#include <spdlog/spdlog.h>
+#include "base/QRVMutex.h"
 
 namespace {
 
@@ -22,8 +22,8 @@ struct Handle {
 // Handles are never freed: a writer on another thread may still hold the
 // pointer it loaded. Only tests ever open more than one.
 std::atomic<Handle*> gHandle{nullptr};
-std::mutex gOpenMutex;
-std::vector<std::unique_ptr<Handle>> gAllHandles;
+QRVMutex gOpenMutex;
+std::vector<std::unique_ptr<Handle>> gAllHandles GUARDED_BY(gOpenMutex);
 
 const char* levelName(int level) {
   switch (level) {
@@ -46,7 +46,7 @@ spdlog::level::level_enum spdLevel(int level) {
 
 bool QRVLog::open(const std::string& subsystem, const std::string& path, int level,
                   size_t rotationCount, size_t sizeLimit) {
-  std::lock_guard<std::mutex> lock(gOpenMutex);
+  QRVMutexLock lock(&gOpenMutex);
   std::shared_ptr<spdlog::logger> logger;
   try {
     auto sink = std::make_shared<spdlog::sinks::rotating_file_sink_mt>(path, sizeLimit,
@@ -71,7 +71,7 @@ bool QRVLog::open(const std::string& subsystem, const std::string& path, int lev
 }
 
 void QRVLog::close() {
-  std::lock_guard<std::mutex> lock(gOpenMutex);
+  QRVMutexLock lock(&gOpenMutex);
   gHandle.store(nullptr);
 }
 

@@ -4,11 +4,14 @@
 #include <unistd.h>
 
 #include <atomic>
+#include <chrono>
 #include <cstdio>
 #include <cstdlib>
 #include <exception>
 #include <system_error>
 #include <thread>
+
+#include "base/QRVCondVar.h"
 
 namespace {
 
@@ -22,11 +25,11 @@ class ThreadPool {
  public:
   explicit ThreadPool(int nice) : nice_(nice) {}
 
-  void submit(std::function<void()> job) {
-    std::unique_lock<std::mutex> lock(mutex_);
+  void submit(std::function<void()> job) EXCLUDES(mutex_) {
+    QRVMutexLock lock(&mutex_);
     jobs_.push_back(std::move(job));
     if (idle_ >= jobs_.size()) {
-      cv_.notify_one();
+      cv_.signal();
       return;
     }
     try {
@@ -43,12 +46,19 @@ class ThreadPool {
   }
 
  private:
-  void work() {
+  void work() EXCLUDES(mutex_) {
     if (nice_) setpriority(PRIO_PROCESS, static_cast<id_t>(gettid()), nice_);
-    std::unique_lock<std::mutex> lock(mutex_);
+    QRVMutexLock lock(&mutex_);
     for (;;) {
       idle_++;
-      bool got = cv_.wait_for(lock, std::chrono::seconds(30), [this] { return !jobs_.empty(); });
+      bool got = true;
+      const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(30);
+      while (jobs_.empty()) {
+        if (!cv_.waitUntil(&mutex_, deadline)) {
+          got = !jobs_.empty();
+          break;
+        }
+      }
       idle_--;
       if (!got) {
         threads_--;
@@ -63,11 +73,11 @@ class ThreadPool {
   }
 
   const int nice_;
-  std::mutex mutex_;
-  std::condition_variable cv_;
-  std::deque<std::function<void()>> jobs_;
-  size_t idle_ = 0;
-  size_t threads_ = 0;
+  QRVMutex mutex_;
+  QRVCondVar cv_;
+  std::deque<std::function<void()>> jobs_ GUARDED_BY(mutex_);
+  size_t idle_ GUARDED_BY(mutex_) = 0;
+  size_t threads_ GUARDED_BY(mutex_) = 0;
 };
 
 // Never destroyed: detached workers may still be waiting when the process
@@ -109,7 +119,7 @@ void QRVSerialQueue::setUncaughtExceptionHandler(ExceptionHandler handler) {
 }
 
 void QRVSerialQueue::async(Job job) {
-  std::lock_guard<std::mutex> lock(mutex_);
+  QRVMutexLock lock(&mutex_);
   jobs_.push_back(std::move(job));
   if (!draining_ && suspendCount_ == 0) scheduleDrainLocked();
 }
@@ -129,7 +139,7 @@ void QRVSerialQueue::drain() {
   for (bool ranOne = false;; ranOne = true) {
     Job job;
     {
-      std::lock_guard<std::mutex> lock(mutex_);
+      QRVMutexLock lock(&mutex_);
       if (jobs_.empty() || suspendCount_ > 0) {
         draining_ = false;
         return;
@@ -150,7 +160,7 @@ void QRVSerialQueue::drain() {
 
 bool QRVSerialQueue::targetWantsTurn() const {
   for (const QRVSerialQueue* q = target_.get(); q; q = q->target_.get()) {
-    std::lock_guard<std::mutex> lock(q->mutex_);
+    QRVMutexLock lock(&q->mutex_);
     if (q->suspendCount_ > 0 || !q->jobs_.empty()) return true;
   }
   return false;
@@ -175,7 +185,7 @@ void QRVSerialQueue::sync(const Job& job) {
   // Fast path: an idle queue without target is taken over by the caller,
   // with no other thread involved.
   {
-    std::unique_lock<std::mutex> lock(mutex_);
+    QRVMutexLock lock(&mutex_);
     if (!target_ && !draining_ && jobs_.empty() && suspendCount_ == 0) {
       draining_ = true;
       lock.unlock();
@@ -193,37 +203,38 @@ void QRVSerialQueue::sync(const Job& job) {
   // the job is done on this thread. The handshake state is shared because the
   // worker may still be waking up after this function has returned.
   struct Handshake {
-    std::mutex m;
-    std::condition_variable cv;
-    bool turn = false, done = false;
+    QRVMutex m;
+    QRVCondVar cv;
+    bool turn GUARDED_BY(m) = false;
+    bool done GUARDED_BY(m) = false;
   };
   auto h = std::make_shared<Handshake>();
   async([h] {
-    std::unique_lock<std::mutex> l(h->m);
+    QRVMutexLock l(&h->m);
     h->turn = true;
-    h->cv.notify_all();
-    h->cv.wait(l, [&] { return h->done; });
+    h->cv.signalAll();
+    while (!h->done) h->cv.wait(&h->m);
   });
   {
-    std::unique_lock<std::mutex> l(h->m);
-    h->cv.wait(l, [&] { return h->turn; });
+    QRVMutexLock l(&h->m);
+    while (!h->turn) h->cv.wait(&h->m);
   }
   {
     CurrentQueueScope scope(this);
     run(job);
   }
-  std::lock_guard<std::mutex> l(h->m);
+  QRVMutexLock l(&h->m);
   h->done = true;
-  h->cv.notify_all();
+  h->cv.signalAll();
 }
 
 void QRVSerialQueue::suspend() {
-  std::lock_guard<std::mutex> lock(mutex_);
+  QRVMutexLock lock(&mutex_);
   suspendCount_++;
 }
 
 void QRVSerialQueue::resume() {
-  std::lock_guard<std::mutex> lock(mutex_);
+  QRVMutexLock lock(&mutex_);
   if (suspendCount_ == 0) {
     fprintf(stderr, "quorvad: queue \"%s\" resumed more often than suspended\n", label_.c_str());
     abort();
@@ -232,7 +243,7 @@ void QRVSerialQueue::resume() {
 }
 
 bool QRVSerialQueue::isSuspended() const {
-  std::lock_guard<std::mutex> lock(mutex_);
+  QRVMutexLock lock(&mutex_);
   return suspendCount_ > 0;
 }
 

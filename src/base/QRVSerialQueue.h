@@ -12,12 +12,12 @@
 // Thread-safe. Create queues with `create`; they are shared by reference.
 #pragma once
 
-#include <condition_variable>
 #include <deque>
 #include <functional>
 #include <memory>
-#include <mutex>
 #include <string>
+
+#include "base/QRVMutex.h"
 
 class QRVSerialQueue : public std::enable_shared_from_this<QRVSerialQueue> {
  public:
@@ -35,11 +35,11 @@ class QRVSerialQueue : public std::enable_shared_from_this<QRVSerialQueue> {
 
   const std::string& label() const { return label_; }
 
-  void async(Job job);
+  void async(Job job) EXCLUDES(mutex_);
   // Runs `job` on the calling thread once every job submitted before it has
   // finished, with the queue held for its duration. Must not be called from
   // a job of this queue (that would wait for itself).
-  void sync(const Job& job);
+  void sync(const Job& job) EXCLUDES(mutex_);
   // On a serial queue every job already excludes all others; the barrier
   // forms exist so that code written against the queue reads as intended.
   void barrierAsync(Job job) { async(std::move(job)); }
@@ -48,9 +48,9 @@ class QRVSerialQueue : public std::enable_shared_from_this<QRVSerialQueue> {
   // Suspension stops the queue before its next job (a running job
   // finishes). Calls must balance: resuming more often than suspending is a
   // programming error and aborts.
-  void suspend();
-  void resume();
-  bool isSuspended() const;
+  void suspend() EXCLUDES(mutex_);
+  void resume() EXCLUDES(mutex_);
+  bool isSuspended() const EXCLUDES(mutex_);
 
   // True when the calling thread is running a job of this queue.
   bool isCurrent() const;
@@ -59,19 +59,18 @@ class QRVSerialQueue : public std::enable_shared_from_this<QRVSerialQueue> {
 
  private:
   QRVSerialQueue(std::string label, std::shared_ptr<QRVSerialQueue> target, Priority priority);
-  void scheduleDrainLocked();
-  void drain();
-  // REQUIRES: mutex_ held (targets are locked after the queues aiming at
-  // them, never before).
-  bool targetWantsTurn() const;
+  void scheduleDrainLocked() REQUIRES(mutex_);
+  void drain() EXCLUDES(mutex_);
+  // Targets are locked after the queues aiming at them, never before.
+  bool targetWantsTurn() const REQUIRES(mutex_);
   static void run(const Job& job);
 
   const std::string label_;
   const std::shared_ptr<QRVSerialQueue> target_;
   const Priority priority_;
 
-  mutable std::mutex mutex_;
-  std::deque<Job> jobs_;       // GUARDED_BY(mutex_)
-  bool draining_ = false;      // GUARDED_BY(mutex_): a drain is scheduled or running
-  int suspendCount_ = 0;       // GUARDED_BY(mutex_)
+  mutable QRVMutex mutex_;
+  std::deque<Job> jobs_ GUARDED_BY(mutex_);
+  bool draining_ GUARDED_BY(mutex_) = false;  // a drain is scheduled or running
+  int suspendCount_ GUARDED_BY(mutex_) = 0;
 };
