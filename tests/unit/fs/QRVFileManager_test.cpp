@@ -20,6 +20,8 @@
 
 #include "platform/fake/QRVFakeFileSystemExtras.h"
 #include "platform/fake/QRVFakePlatform.h"
+#include "platform/fake/QRVFaultInjectionFileSystem.h"
+#include "platform/linux/QRVLinuxFileSystem.h"
 #include "platform/linux/QRVLinuxFileSystemExtras.h"
 #include "support/QRVTestServices.h"
 
@@ -83,7 +85,9 @@ class FileManagerTest : public testing::Test {
   std::shared_ptr<QRVFakeFileSystemExtras> fileSystem = std::make_shared<QRVFakeFileSystemExtras>(real, lockState);
   std::shared_ptr<QRVFakeAccounts> accounts = std::make_shared<QRVFakeAccounts>();
   std::shared_ptr<QRVFakeFeatureFlags> flags = std::make_shared<QRVFakeFeatureFlags>();
-  QRVFileManager fm{root.path(), fileSystem, accounts, flags};
+  std::shared_ptr<QRVFaultInjectionFileSystem> files =
+      std::make_shared<QRVFaultInjectionFileSystem>(std::make_shared<QRVLinuxFileSystem>());
+  QRVFileManager fm{root.path(), files, fileSystem, accounts, flags};
 
   // The errno a call that took `&error` failed with (-1 for an error of
   // another domain, or none); 0 when it succeeded. Clears the error, so that
@@ -108,7 +112,7 @@ TEST(FileManagerDepthWalkTest, CountsComponentsAndFailsOnlyBelowTheStart) {
                {"", 5, true, 5},         {"/a/b/../../c", 1, true, 2}, {"/x/../../y", 4, false, 0}};
   for (const auto& c : cases) {
     int64_t end = -99;
-    bool ok = QRVFileManager::_validateSymlink(c.path, c.start, &end);
+    bool ok = QRVFileManager::TEST_validateSymlink(c.path, c.start, &end);
     EXPECT_EQ(std::pair(ok, ok ? end : 0), std::pair(c.ok, c.end)) << c.path;
   }
 }
@@ -200,7 +204,7 @@ TEST_F(FileManagerTest, TraversalVisitsDirectoriesBeforeAndAfterAndNeverFollowsL
   write("t/c/d");
   link("c", "t/l");
   std::vector<std::string> seen;
-  ASSERT_TRUE(fm._traverseDirectory(at("t"), &error, [&](const QRVDirectoryEntry& e, QRVError*) {
+  ASSERT_TRUE(fm.TEST_traverseDirectory(at("t"), &error, [&](const QRVDirectoryEntry& e, QRVError*) {
     using K = QRVDirectoryEntry::Kind;
     const char* kind = e.kind == K::kDirectory            ? "D"
                        : e.kind == K::kDirectoryPostOrder ? "P"
@@ -217,14 +221,14 @@ TEST_F(FileManagerTest, TraversalVisitsDirectoriesBeforeAndAfterAndNeverFollowsL
 
   // The block ends the walk, and its error becomes the walk's.
   int visited = 0;
-  EXPECT_EQ(failed(fm._traverseDirectory(at("t"), &error,
+  EXPECT_EQ(failed(fm.TEST_traverseDirectory(at("t"), &error,
                                          [&](const QRVDirectoryEntry&, QRVError* e) {
                                            *e = QRV_POSIX_ERROR_QUIET(ECANCELED, "stopped");
                                            return ++visited < 2;
                                          })),
             ECANCELED);
   EXPECT_EQ(visited, 2);
-  EXPECT_EQ(failed(fm._traverseDirectory(at("missing"), &error, [](auto&, QRVError*) { return true; })), ENOENT);
+  EXPECT_EQ(failed(fm.TEST_traverseDirectory(at("missing"), &error, [](auto&, QRVError*) { return true; })), ENOENT);
 }
 
 // ---- Creation ----
