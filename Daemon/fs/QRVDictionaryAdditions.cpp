@@ -2,7 +2,8 @@
 
 #include <vector>
 
-bool QRV_writeToURL(QRVFileManager& fileManager, const QRVPlist& dictionary, const std::string& path, QRVError* error) {
+bool QRV_writeToURL(QRVFileManager& fileManager, const QRVPlist& dictionary, const std::string& path,
+                    QRVError* error) {
   return fileManager.writeFileAtomically(path, dictionary.toBinary(), 0644, error);
 }
 
