@@ -294,6 +294,51 @@ TEST_F(FileManagerTest, DirectoriesGetExactModeOwnerAsGroupAndClassAndFailuresCa
   EXPECT_EQ(failed(fm.createDirectoryAtURL(at("locked"), false, 0755, 0, 1, &error)), EPERM);
 }
 
+// Failures halfway through, injected into single calls of the file system.
+TEST_F(FileManagerTest, FailuresHalfwayLeaveTheOldStateAndNoLeftovers) {
+  using FOp = QRVFaultInjectionFileSystem::Operation;
+  const std::vector<uint8_t> oldBytes{'o', 'l', 'd'}, newBytes{'n', 'e', 'w'};
+  ASSERT_TRUE(fm.writeFileAtomically(at("f"), oldBytes, 0644, &error));
+  // An atomic write that cannot be flushed, or renamed into place, keeps the
+  // old contents and removes its temporary file.
+  for (FOp op : {FOp::kSynchronize, FOp::kRename}) {
+    files->failNext(op, EIO, at("f.tmp-"));
+    EXPECT_EQ(failed(fm.writeFileAtomically(at("f"), newBytes, 0644, &error)), EIO);
+    std::vector<uint8_t> read;
+    ASSERT_TRUE(fm.readFileAtURL(at("f"), &read, &error));
+    EXPECT_EQ(read, oldBytes);
+    EXPECT_EQ(std::distance(fs::directory_iterator(root.path()), fs::directory_iterator()), 1);
+  }
+  // A plain write that fails removes what it began; a failing read says so.
+  files->failNext(FOp::kWrite, ENOSPC, at("g"));
+  EXPECT_EQ(failed(fm.writeFileAtURL(at("g"), newBytes, 0600, &error)), ENOSPC);
+  EXPECT_FALSE(fs::exists(at("g")));
+  std::vector<uint8_t> read;
+  files->failNext(FOp::kRead, EIO, at("f"));
+  EXPECT_EQ(failed(fm.readFileAtURL(at("f"), &read, &error)), EIO);
+
+  // A directory whose contents cannot be read is delivered as such, without
+  // a post-order visit, and the walk goes on with its siblings.
+  makeDirectories("w/locked/inner");
+  makeDirectories("w/open");
+  files->failNext(FOp::kReadDirectory, EACCES, at("w/locked"));
+  std::vector<std::string> seen;
+  ASSERT_TRUE(fm.TEST_traverseDirectory(at("w"), &error, [&](const QRVDirectoryEntry& e, QRVError*) {
+    using K = QRVDirectoryEntry::Kind;
+    std::string name = std::string(e.path).substr(root.path().size() + 1);
+    if (e.kind == K::kUnreadableDirectory) name = "unreadable " + name + " " + std::to_string(e.errnum);
+    if (e.kind == K::kDirectoryPostOrder) name = "after " + name;
+    seen.push_back(name);
+    return true;
+  }));
+  std::sort(seen.begin(), seen.end());
+  EXPECT_EQ(seen, (std::vector<std::string>{"after w", "after w/open", "unreadable w/locked " + std::to_string(EACCES),
+                                            "w", "w/locked", "w/open"}));
+  // An entry that cannot be examined ends the walk with its errno.
+  files->inject(FOp::kStatus, {.errnum = EIO, .pathContains = at("w/open")});
+  EXPECT_EQ(failed(fm.TEST_traverseDirectory(at("w"), &error, [](auto&, QRVError*) { return true; })), EIO);
+}
+
 TEST_F(FileManagerTest, TemporaryDirectoriesAreUniqueAndPrivate) {
   auto a = fm.createTemporaryDirectoryInDirectoryURL(root.path(), &error);
   auto b = fm.createTemporaryDirectoryInDirectoryURL(root.path() + "/", "com.kelva.UserManagedAssets.", &error);
