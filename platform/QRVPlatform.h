@@ -9,6 +9,7 @@
 #include "platform/QRVAccounts.h"
 #include "platform/QRVApplicationTermination.h"
 #include "platform/QRVFeatureFlags.h"
+#include "platform/QRVFileSystem.h"
 #include "platform/QRVFileSystemExtras.h"
 #include "platform/QRVFirstBootMarker.h"
 #include "platform/QRVLockStateService.h"
@@ -30,6 +31,8 @@ struct QRVPlatform {
   std::shared_ptr<QRVSystemInfo> systemInfo;
   std::shared_ptr<QRVAccounts> accounts;
   std::shared_ptr<QRVFeatureFlags> featureFlags;
+  // The file manager's two seams: the POSIX calls, and what lies beyond them.
+  std::shared_ptr<QRVFileSystem> posixFileSystem;
   std::shared_ptr<QRVFileSystemExtras> fileSystem;
   std::shared_ptr<QRVApplicationTermination> applicationTermination;
 

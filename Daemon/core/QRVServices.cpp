@@ -3,7 +3,7 @@
 std::shared_ptr<QRVServices> QRVServices::make(const std::string& root, QRVPlatform platform) {
   auto s = std::make_shared<QRVServices>();
   s->platform = std::move(platform);
-  s->fileManager = std::make_shared<QRVFileManager>(root, s->platform.fileSystem, s->platform.accounts,
+  s->fileManager = std::make_shared<QRVFileManager>(root, s->platform.posixFileSystem, s->platform.fileSystem, s->platform.accounts,
                                                    s->platform.featureFlags);
   s->globalConfiguration =
       std::make_shared<QRVGlobalConfiguration>(root, s->platform.systemInfo, s->platform.accounts, s->fileManager);

@@ -12,9 +12,17 @@
 //
 // Paths ("URLs") are absolute path strings. The file manager keeps no state
 // of its own: it is reentrant, and callers serialise work on one tree through
-// the identifier locks. What lies beyond POSIX (classes, the immutable flag,
-// group ACLs, cloning copies, directory statistics) comes from the
-// QRVFileSystemExtras it is given.
+// the identifier locks. It reaches the operating system only through the two
+// objects it is given: every POSIX call goes through the QRVFileSystem, and
+// what lies beyond POSIX (classes, the immutable flag, group ACLs, cloning
+// copies, recursive removal, directory statistics) through the
+// QRVFileSystemExtras. Tests wrap either to make single calls fail.
+//
+// The implementation is split by concern: QRVFileManager.cpp (construction,
+// whole files, homes), QRVFileManagerPaths.cpp (paths supplied by clients),
+// QRVFileManagerCreation.cpp (creation and ownership),
+// QRVFileManagerRemoval.cpp (move, copy, remove), QRVFileManagerProtection.cpp
+// (classes and ACLs) and QRVFileManagerUsage.cpp (listing, traversal, sizes).
 #pragma once
 
 #include <sys/stat.h>
@@ -31,6 +39,7 @@
 #include "base/QRVError.h"
 #include "platform/QRVAccounts.h"
 #include "platform/QRVFeatureFlags.h"
+#include "platform/QRVFileSystem.h"
 #include "platform/QRVFileSystemExtras.h"
 
 // One entry of a traversal, as the walk delivers it.
@@ -68,7 +77,7 @@ class QRVFileManager {
 
   // `root` is the directory every absolute path of the system lives under
   // ("/" on a device); it places home directories.
-  QRVFileManager(std::string root, std::shared_ptr<QRVFileSystemExtras> fileSystem,
+  QRVFileManager(std::string root, std::shared_ptr<QRVFileSystem> files, std::shared_ptr<QRVFileSystemExtras> extras,
                  std::shared_ptr<QRVAccounts> accounts, std::shared_ptr<QRVFeatureFlags> featureFlags);
 
   // ---- Paths supplied by clients ----
@@ -81,11 +90,6 @@ class QRVFileManager {
   // resolved existing part; an existing link that cannot be resolved is
   // refused. Every refusal is logged.
   std::optional<std::string> realPathForURL(const std::string& url, const std::string& ifChildOfURL);
-  // Depth walk over `path`'s components starting at `startingDepth`: ".."
-  // subtracts one, "", "." and "/" nothing, any other component adds one.
-  // False as soon as the depth drops below the start; otherwise true with the
-  // final depth stored through `endingDepth` (when not null).
-  static bool _validateSymlink(const std::string& path, int64_t startingDepth, int64_t* endingDepth);
 
   // lstat-based. itemExistsAtURL is true when lstat succeeds;
   // itemDoesNotExistAtURL only when it fails with ENOENT. Other failures are
@@ -109,11 +113,6 @@ class QRVFileManager {
   // Called for each entry of a walk; returning false ends the walk, and what
   // the block stored through its error argument becomes the walk's error.
   using TraversalBlock = std::function<bool(const QRVDirectoryEntry& entry, QRVError* error)>;
-  // Walks `url` and everything below it in pre-order (directories also once
-  // more after their contents), never following links or leaving the file
-  // system. An entry that cannot be read or examined ends the walk with its
-  // errno. Components that use the file manager's walk go through this.
-  bool _traverseDirectory(const std::string& url, QRVError* error, const TraversalBlock& block);
 
   // ---- Creation ----
 
@@ -203,11 +202,7 @@ class QRVFileManager {
   // Sets the top-level ACL on the one directory `url`.
   bool setTopLevelSystemContainerACLAtURL(const std::string& url, QRVError* error);
 
-  // The ACLs themselves (for the group "systemusers", which must exist).
   using ACL = std::vector<QRVFileSystemExtras::GroupACE>;
-  std::optional<ACL> _CopyTopLevelSystemContainerACLWithError(QRVError* error);
-  std::optional<ACL> _CopySystemContainerACLWithNumACEs(int numACEs, bool isDir, bool inheritOnly, QRVError* error);
-  bool _CreateSystemUserACEInACL(ACL* acl, uint32_t withPermissions, uint32_t andFlags, QRVError* error);
 
   // ---- Sizes, debugging, homes ----
 
@@ -240,15 +235,44 @@ class QRVFileManager {
   // (ELOOP), anything but a regular file is refused without blocking on it
   // (a fifo or a device: EINVAL), and a file larger than `maxLength` bytes
   // fails with EFBIG instead of filling memory. Refusals are not logged.
-  bool readRegularFileAtURL(const std::string& path, size_t maxLength, std::vector<uint8_t>* contents,
-                            QRVError* error);
+  bool readRegularFileAtURL(const std::string& path, size_t maxLength, std::vector<uint8_t>* contents, QRVError* error);
   // Writes `contents` as a new file at `path` with `mode` and flushes it to
   // disk. Whatever was at `path` is removed first, so a link or hard link
   // planted there is never written through. Not atomic: for a temporary file
   // that is renamed into place afterwards.
   bool writeFileAtURL(const std::string& path, const std::vector<uint8_t>& contents, mode_t mode, QRVError* error);
 
+  // ---- For tests only ----
+
+  static bool TEST_validateSymlink(const std::string& path, int64_t startingDepth, int64_t* endingDepth) {
+    return _validateSymlink(path, startingDepth, endingDepth);
+  }
+  bool TEST_traverseDirectory(const std::string& url, QRVError* error, const TraversalBlock& block) {
+    return _traverseDirectory(url, error, block);
+  }
+
  private:
+  // Depth walk over `path`'s components starting at `startingDepth`: ".."
+  // subtracts one, "", "." and "/" nothing, any other component adds one.
+  // False as soon as the depth drops below the start; otherwise true with the
+  // final depth stored through `endingDepth` (when not null).
+  static bool _validateSymlink(const std::string& path, int64_t startingDepth, int64_t* endingDepth);
+
+  // Walks `url` and everything below it in pre-order (directories also once
+  // more after their contents), never following links or leaving the file
+  // system: a directory on another device is delivered before and after, but
+  // not entered. The entries of a directory are all examined (lstat) when the
+  // walk enters it, before the first of them is delivered. A directory whose
+  // contents cannot be read is delivered as kUnreadableDirectory instead of
+  // its post-order visit; an entry that cannot be examined ends the walk with
+  // its errno. Sibling order is the file system's.
+  bool _traverseDirectory(const std::string& url, QRVError* error, const TraversalBlock& block);
+
+  // The ACLs themselves (for the group "systemusers", which must exist).
+  std::optional<ACL> _CopyTopLevelSystemContainerACLWithError(QRVError* error);
+  std::optional<ACL> _CopySystemContainerACLWithNumACEs(int numACEs, bool isDir, bool inheritOnly, QRVError* error);
+  bool _CreateSystemUserACEInACL(ACL* acl, uint32_t withPermissions, uint32_t andFlags, QRVError* error);
+
   bool _moveItemAtURL(const std::string& url, const std::string& toURL, bool failIfSrcMissing, QRVError* error);
   bool _copyItemAtURL(const std::string& url, const std::string& toURL, bool failIfSrcMissing, QRVError* error);
   // True when the source check lets the operation go on; false with
@@ -263,8 +287,24 @@ class QRVFileManager {
   bool _setClassAndOwnerOfDirectory(int fd, const std::string& url, uid_t owner, uint32_t protectionClass,
                                     QRVError* error);
 
+  // Helpers over the seam that several concerns share.
+  int _open(const std::string& path, int flags, int* fd);
+  int _openDirectoryNoFollow(int directoryFD, const std::string& path, int* fd);
+  int _lstat(const std::string& path, struct stat* st);
+  int _syncDirectory(const std::string& directory);
+  int _writeAll(int fd, const std::vector<uint8_t>& bytes);
+  int _readAll(int fd, size_t maxLength, std::vector<uint8_t>* contents);
+  void _close(int fd);
+  void _standardizeMode(const std::string& path, const struct stat& st);
+  // The rest of makeDirectory/makePath for createDirectoryAtURL.
+  int _makeDirectory(const std::string& path, mode_t mode, bool* created);
+  int _makePath(const std::string& path, mode_t mode, bool* created);
+  struct Walk;
+  bool _walk(Walk* walk, const std::string& path, int level, const struct stat& st);
+
   const std::string root_;
-  const std::shared_ptr<QRVFileSystemExtras> fileSystem_;
+  const std::shared_ptr<QRVFileSystem> files_;
+  const std::shared_ptr<QRVFileSystemExtras> extras_;
   const std::shared_ptr<QRVAccounts> accounts_;
   const std::shared_ptr<QRVFeatureFlags> featureFlags_;
 };

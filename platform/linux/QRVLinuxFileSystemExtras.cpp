@@ -18,6 +18,8 @@
 #include <unordered_set>
 #include <utility>
 
+#include "platform/linux/QRVLinuxTreeRemover.h"
+
 namespace {
 
 // Owns a descriptor for the length of a scope.
@@ -279,223 +281,6 @@ int copyEntry(int fromDirectory, const char* fromName, int toDirectory, const ch
 // directory being emptied is a frame; frames far from the current one have
 // their stream closed to bound the descriptors in use, and are re-found
 // through ".." of their child when the walk climbs back.
-class TreeRemover {
- public:
-  TreeRemover(QRVFileSystemExtras::RemovalErrorHandler onError, std::string topPath)
-      : onError_(std::move(onError)), topPath_(std::move(topPath)) {}
-  ~TreeRemover() {
-    for (Frame& f : frames_)
-      if (f.dir) closedir(f.dir);
-  }
-
-  int run(int parentFD, const std::string& name) {
-    struct stat st;
-    if (fstatat(parentFD, name.c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0) return errno;
-    if (!S_ISDIR(st.st_mode)) {
-      if (unlinkat(parentFD, name.c_str(), 0) != 0) report(parentFD, name, topPath_, errno, false);
-      return 0;
-    }
-    topParentFD_ = parentFD;
-    int fd = openat(parentFD, name.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC | O_NONBLOCK);
-    DIR* dir = fd >= 0 ? fdopendir(fd) : nullptr;
-    if (!dir) {
-      int e = errno;
-      if (fd >= 0) close(fd);
-      if (unlinkat(parentFD, name.c_str(), AT_REMOVEDIR) != 0) report(parentFD, name, topPath_, e, false);
-      return 0;
-    }
-    push(dir, st, name);
-    while (!frames_.empty()) {
-      if (int e = step()) return e;
-    }
-    return 0;
-  }
-
- private:
-  static constexpr int kMaxPasses = 4;
-
-  struct Frame {
-    DIR* dir = nullptr;  // null while closed to save descriptors
-    dev_t dev = 0;
-    ino_t ino = 0;
-    std::string name;
-    std::unordered_set<std::string> kept;  // entries that could not be removed
-    bool progress = false;                 // something was removed in this pass
-    int passes = 0;
-  };
-
-  void push(DIR* dir, const struct stat& st, std::string name) {
-    if (openCount_ >= QRVLinuxFileSystemExtras::kMaxOpenDirectories) {
-      for (Frame& f : frames_) {
-        if (f.dir) {
-          closedir(f.dir);
-          f.dir = nullptr;
-          openCount_--;
-          break;
-        }
-      }
-    }
-    Frame f;
-    f.dir = dir;
-    f.dev = st.st_dev;
-    f.ino = st.st_ino;
-    f.name = std::move(name);
-    frames_.push_back(std::move(f));
-    openCount_++;
-  }
-
-  // The path of `name` inside the innermost frame, for messages.
-  std::string pathInCurrentFrame(const std::string& name) const {
-    std::string path = topPath_;
-    for (size_t i = 1; i < frames_.size(); i++) path += "/" + frames_[i].name;
-    return path + "/" + name;
-  }
-
-  bool report(int directoryFD, const std::string& name, const std::string& path, int errnum, bool inTree) {
-    if (!onError_) return false;
-    QRVFileSystemExtras::RemovalFailure failure{directoryFD, name.c_str(), path, errnum, inTree};
-    return onError_(failure);
-  }
-
-  // Records the outcome of a failed removal of `name` in the current frame.
-  void failed(int directoryFD, const std::string& name, int errnum) {
-    Frame& f = frames_.back();
-    if (report(directoryFD, name, pathInCurrentFrame(name), errnum, true))
-      f.progress = true;
-    else
-      f.kept.insert(name);
-  }
-
-  int step() {
-    Frame& f = frames_.back();
-    int fd = dirfd(f.dir);
-    errno = 0;
-    dirent* entry = readdir(f.dir);
-    if (!entry) {
-      // Entries removed during a pass may hide others on some file systems:
-      // read again until a pass removes nothing.
-      if (errno == 0 && f.progress && f.passes < kMaxPasses) {
-        f.progress = false;
-        f.passes++;
-        rewinddir(f.dir);
-        return 0;
-      }
-      return finishFrame();
-    }
-    std::string name = entry->d_name;
-    if (name == "." || name == ".." || f.kept.count(name)) return 0;
-    bool isDirectory = entry->d_type == DT_DIR;
-    if (entry->d_type == DT_UNKNOWN) {
-      struct stat st;
-      if (fstatat(fd, name.c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0) {
-        if (errno != ENOENT) failed(fd, name, errno);
-        return 0;
-      }
-      isDirectory = S_ISDIR(st.st_mode);
-    }
-    if (!isDirectory) {
-      if (unlinkat(fd, name.c_str(), 0) == 0 || errno == ENOENT) {
-        f.progress = true;
-        return 0;
-      }
-      if (errno != EISDIR) {
-        failed(fd, name, errno);
-        return 0;
-      }
-    }
-    int childFD = openat(fd, name.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC | O_NONBLOCK);
-    if (childFD < 0) {
-      int e = errno;
-      if (e == ENOENT) return 0;
-      // Not enterable (or no longer a directory): remove it as it is.
-      int flags = (e == ENOTDIR || e == ELOOP) ? 0 : AT_REMOVEDIR;
-      if (unlinkat(fd, name.c_str(), flags) == 0)
-        f.progress = true;
-      else
-        failed(fd, name, e);
-      return 0;
-    }
-    struct stat st;
-    if (fstat(childFD, &st) != 0 || st.st_dev != f.dev) {
-      // Another file system is mounted here: never descend into it. Removing
-      // the mount point fails (EBUSY), and that is reported.
-      close(childFD);
-      if (unlinkat(fd, name.c_str(), AT_REMOVEDIR) == 0)
-        f.progress = true;
-      else
-        failed(fd, name, errno);
-      return 0;
-    }
-    DIR* child = fdopendir(childFD);
-    if (!child) {
-      int e = errno;
-      close(childFD);
-      failed(fd, name, e);
-      return 0;
-    }
-    push(child, st, std::move(name));
-    return 0;
-  }
-
-  // The current frame is empty (or holds only what could not be removed):
-  // remove it from its parent.
-  int finishFrame() {
-    Frame done = std::move(frames_.back());
-    frames_.pop_back();
-    int parentFD = topParentFD_;
-    if (!frames_.empty()) {
-      Frame& parent = frames_.back();
-      if (!parent.dir) {
-        int e = reopen(parent, dirfd(done.dir));
-        if (e) {
-          closedir(done.dir);
-          openCount_--;
-          return e;
-        }
-      }
-      parentFD = dirfd(parent.dir);
-    }
-    closedir(done.dir);
-    openCount_--;
-    if (unlinkat(parentFD, done.name.c_str(), AT_REMOVEDIR) == 0 || errno == ENOENT) {
-      if (!frames_.empty()) frames_.back().progress = true;
-      return 0;
-    }
-    int e = errno;
-    if (frames_.empty()) {
-      report(parentFD, done.name, topPath_, e, false);
-    } else {
-      failed(parentFD, done.name, e);
-    }
-    return 0;
-  }
-
-  // Re-finds `parent` as ".." of its child, refusing a directory that is not
-  // the one the walk came from (the tree was moved beneath us).
-  int reopen(Frame& parent, int childFD) {
-    int fd = openat(childFD, "..", O_RDONLY | O_DIRECTORY | O_CLOEXEC);
-    if (fd < 0) return errno;
-    struct stat st;
-    if (fstat(fd, &st) != 0 || st.st_dev != parent.dev || st.st_ino != parent.ino) {
-      close(fd);
-      return ESTALE;
-    }
-    parent.dir = fdopendir(fd);
-    if (!parent.dir) {
-      int e = errno;
-      close(fd);
-      return e;
-    }
-    openCount_++;
-    return 0;
-  }
-
-  const QRVFileSystemExtras::RemovalErrorHandler onError_;
-  const std::string topPath_;
-  int topParentFD_ = -1;
-  std::vector<Frame> frames_;
-  size_t openCount_ = 0;
-};
 
 }  // namespace
 
@@ -588,7 +373,7 @@ int QRVLinuxFileSystemExtras::copyItem(const std::string& from, const std::strin
   int e = copyEntry(source.get(), fromName.c_str(), destination.get(), toName.c_str());
   if (e && e != EEXIST) {
     // Leave no half copy behind.
-    TreeRemover remover(nullptr, to);
+    QRVLinuxTreeRemover remover(nullptr, to);
     remover.run(destination.get(), toName);
   }
   return e;
@@ -599,7 +384,7 @@ int QRVLinuxFileSystemExtras::removeTree(const std::string& path, const RemovalE
   if (!splitPath(path, &directory, &name)) return EINVAL;
   ScopedFD parent(openDirectory(directory));
   if (!parent) return errno;
-  TreeRemover remover(onError, path);
+  QRVLinuxTreeRemover remover(onError, path);
   return remover.run(parent.get(), name);
 }
 

@@ -22,7 +22,7 @@
 // - Removal: a descriptor-relative walk (openat/unlinkat), so that neither
 //   links nor the length of paths matter; it keeps at most kMaxOpenDirectories
 //   directories open and re-finds shallower ones through "..", checking that
-//   each is still the directory it left.
+//   each is still the directory it left (QRVLinuxTreeRemover).
 // - Directory statistics: a walk summing st_blocks * 512 (hard-linked files
 //   once). Fast-only answers from the same walk: Linux file systems keep no
 //   directory sizes, so there is nothing faster to ask and nothing to enable.

@@ -2,6 +2,7 @@
 #include "platform/linux/QRVLinuxAccounts.h"
 #include "platform/linux/QRVLinuxApplicationTermination.h"
 #include "platform/linux/QRVLinuxFeatureFlags.h"
+#include "platform/linux/QRVLinuxFileSystem.h"
 #include "platform/linux/QRVLinuxFileSystemExtras.h"
 #include "platform/linux/QRVLinuxFirstBootMarker.h"
 #include "platform/linux/QRVLinuxLockStateService.h"
@@ -35,6 +36,7 @@ QRVPlatform QRVPlatform::makeLinux(const std::string& root, const LinuxOptions& 
   p.systemInfo = std::make_shared<QRVLinuxSystemInfo>(under("/etc/os-release"));
   p.accounts = std::make_shared<QRVLinuxAccounts>(under("/etc/passwd"), under("/etc/group"));
   p.featureFlags = std::make_shared<QRVLinuxFeatureFlags>(under("/etc/quorva/features.plist"));
+  p.posixFileSystem = std::make_shared<QRVLinuxFileSystem>();
   p.fileSystem = std::make_shared<QRVLinuxFileSystemExtras>(p.lockState);
   p.applicationTermination = std::make_shared<QRVLinuxApplicationTermination>(under(linuxOptions.applicationSlice));
   return p;

@@ -11,7 +11,9 @@
 
 #include "core/QRVServices.h"
 #include "platform/fake/QRVFakeFileSystemExtras.h"
+#include "platform/fake/QRVFaultInjectionFileSystem.h"
 #include "platform/fake/QRVFakePlatform.h"
+#include "platform/linux/QRVLinuxFileSystem.h"
 #include "platform/linux/QRVLinuxFileSystemExtras.h"
 
 class QRVTemporaryDirectory {
@@ -61,6 +63,10 @@ struct QRVTestServices {
   // when the tests cannot write trusted extended attributes (not root).
   std::shared_ptr<QRVFakeFileSystemExtras> fileSystem = std::make_shared<QRVFakeFileSystemExtras>(
       std::make_shared<QRVLinuxFileSystemExtras>(lockState), lockState);
+  // The real POSIX calls, wrapped so that single calls can be made to fail;
+  // ownership changes are recorded instead of made when not root.
+  std::shared_ptr<QRVFaultInjectionFileSystem> posixFileSystem =
+      std::make_shared<QRVFaultInjectionFileSystem>(std::make_shared<QRVLinuxFileSystem>());
   std::shared_ptr<QRVServices> services;
 
   QRVTestServices() {
@@ -75,9 +81,11 @@ struct QRVTestServices {
     p.accounts = accounts;
     p.featureFlags = featureFlags;
     p.personas = personas;
+    p.posixFileSystem = posixFileSystem;
     p.fileSystem = fileSystem;
     p.applicationTermination = applicationTermination;
     fileSystem->setInMemoryProtectionClasses(geteuid() != 0);
+    posixFileSystem->setRecordOwnership(geteuid() != 0);
     accounts->accounts = {{"root", 0, 0, "/private/var/root"},
                           {"installer", 33, 33, "/private/var/installer"},
                           {"mobile", 501, 501, "/private/var/mobile"}};

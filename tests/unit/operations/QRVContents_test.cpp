@@ -110,7 +110,7 @@ TEST_F(ContentsTest, AssetsPathIsCreatedOnceOwnedByTheUserAndAnsweredRelativeOrA
   EXPECT_EQ(*path, container->url() + "/" + name);
   EXPECT_EQ(name.rfind("com.kelva.UserManagedAssets.", 0), 0u) << name;
   struct stat st;
-  ASSERT_EQ(stat(path->c_str(), &st), 0);
+  ASSERT_EQ(statThroughSeam(*path, &st), 0);
   EXPECT_TRUE(S_ISDIR(st.st_mode));
   EXPECT_EQ(st.st_uid, 501u);
   EXPECT_EQ(st.st_gid, 501u);
