@@ -9,8 +9,8 @@
 // Usage:
 //   QRVContainerClient containers(std::move(*client));
 //   QRVClientError error;
-//   auto r = containers.createOrLookupContainer({.identifier = "com.example.app",
-//                                                .containerClass = 2}, true, false, &error);
+//   auto r = containers.createOrLookupContainer({.identifier = "com.example.app", .containerClass = 2},
+//                                               /*create=*/true, /*transient=*/false, &error);
 //   if (r && r->ok()) use(*r->path);
 #pragma once
 

@@ -117,7 +117,7 @@ std::optional<QRVFileManager::ACL> QRVFileManager::_CopySystemContainerACLWithNu
 }
 
 std::optional<QRVFileManager::ACL> QRVFileManager::_CopyTopLevelSystemContainerACLWithError(QRVError* error) {
-  std::optional<ACL> acl = _CopySystemContainerACLWithNumACEs(2, true, true, error);
+  std::optional<ACL> acl = _CopySystemContainerACLWithNumACEs(2, /*isDir=*/true, /*inheritOnly=*/true, error);
   if (!acl || !_CreateSystemUserACEInACL(&*acl, kSystemTopLevelRights, 0, error)) return std::nullopt;
   return acl;
 }
@@ -125,9 +125,9 @@ std::optional<QRVFileManager::ACL> QRVFileManager::_CopyTopLevelSystemContainerA
 bool QRVFileManager::standardizeACLsAtURL(const std::string& url, bool isSystemContainer, QRVError* error) {
   std::optional<ACL> topLevel = _CopyTopLevelSystemContainerACLWithError(error);
   if (!topLevel) return false;
-  std::optional<ACL> directory = _CopySystemContainerACLWithNumACEs(1, true, false, error);
+  std::optional<ACL> directory = _CopySystemContainerACLWithNumACEs(1, /*isDir=*/true, /*inheritOnly=*/false, error);
   if (!directory) return false;
-  std::optional<ACL> file = _CopySystemContainerACLWithNumACEs(1, false, false, error);
+  std::optional<ACL> file = _CopySystemContainerACLWithNumACEs(1, /*isDir=*/false, /*inheritOnly=*/false, error);
   if (!file) return false;
 
   return _traverseDirectory(url, error, [&](const QRVDirectoryEntry& entry, QRVError*) {
