@@ -116,13 +116,13 @@ bool QRVFileManager::writeFileAtomically(const std::string& path, const std::vec
   int fd = -1;
   if (int e = files_->makeTemporaryFile(&temp, O_CLOEXEC, &fd))
     return QRVFail(error, QRV_POSIX_ERROR(e, "Failed to create {}: {}", temp, errnoText(e)));
-  int e = _writeAll(fd, contents);
-  if (!e) e = files_->changeModeOfFD(fd, mode);
-  if (!e) e = files_->synchronize(fd);
+  int written = _writeAll(fd, contents);
+  if (!written) written = files_->changeModeOfFD(fd, mode);
+  if (!written) written = files_->synchronize(fd);
   _close(fd);
-  if (e) {
+  if (written) {
     files_->unlink(AT_FDCWD, temp, 0);
-    return QRVFail(error, QRV_POSIX_ERROR(e, "Failed to write {}: {}", temp, errnoText(e)));
+    return QRVFail(error, QRV_POSIX_ERROR(written, "Failed to write {}: {}", temp, errnoText(written)));
   }
   if (int e = files_->rename(AT_FDCWD, temp, AT_FDCWD, path, 0)) {
     files_->unlink(AT_FDCWD, temp, 0);

@@ -162,8 +162,8 @@ bool QRVFileManager::setOwnerAndModeOfDirectoryAtURL(const std::string& url, uid
   bool ok = true;
   if (int e = files_->changeOwnerOfFD(fd, uid, gid)) {
     ok = QRVFail(error, QRV_POSIX_ERROR(e, "Failed to chown({},{}) {}: {}", uid, gid, url, errnoText(e)));
-  } else if (int e = files_->changeModeOfFD(fd, mode)) {
-    ok = QRVFail(error, QRV_POSIX_ERROR(e, "Failed to chmod({:o}) {}: {}", mode, url, errnoText(e)));
+  } else if (int modeError = files_->changeModeOfFD(fd, mode)) {
+    ok = QRVFail(error, QRV_POSIX_ERROR(modeError, "Failed to chmod({:o}) {}: {}", mode, url, errnoText(modeError)));
   }
   _close(fd);
   return ok;
