@@ -28,7 +28,7 @@ void QRVHandleCreateOrLookupContainer(const QRVPlist& request, const std::shared
   out.set("ReplyIdentifier", QRVPlist::string(metadata->identifier()));
   const std::string& persona = metadata->userIdentity()->personaUniqueString();
   if (!persona.empty()) out.set("ReplyPersonaUniqueString", QRVPlist::string(persona));
-  if (auto token = QRVRequestUnpacking::issueSandboxExtension(connection, metadata->url()))
+  if (auto token = QRVRequestUnpacking::issueSandboxExtension(connection, *metadata))
     out.set("SandboxToken", QRVPlist::string(*token));
 }
 
@@ -66,7 +66,7 @@ void QRVHandleContainerMetadata(const QRVPlist& request, const std::shared_ptr<Q
   out.set("ReplyTransient", QRVPlist::boolean(metadata->transient()));
   if (request.boolForKey("InfoDictRequested"))
     out.set("ReplyInfoDictionary", metadata->info().isDictionary() ? metadata->info() : QRVPlist::dictionary());
-  if (auto token = QRVRequestUnpacking::issueSandboxExtension(connection, metadata->url()))
+  if (auto token = QRVRequestUnpacking::issueSandboxExtension(connection, *metadata))
     out.set("SandboxToken", QRVPlist::string(*token));
 }
 

@@ -78,4 +78,10 @@ std::optional<std::string> issueSandboxExtension(QRVClientConnection& connection
   return token;
 }
 
+std::optional<std::string> issueSandboxExtension(QRVClientConnection& connection, const QRVMetadata& container) {
+  const char* extensionClass = container.containerClass() == QRVContainerClassAppGroup ? kApplicationGroupExtensionClass
+                                                                                       : kContainerExtensionClass;
+  return issueSandboxExtension(connection, container.url(), extensionClass);
+}
+
 }  // namespace QRVRequestUnpacking

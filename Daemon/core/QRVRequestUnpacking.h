@@ -31,6 +31,10 @@ inline constexpr const char* kApplicationGroupExtensionClass = "com.kelva.sandbo
 
 // A token letting the caller's process reach `path`, or nothing (logged).
 std::optional<std::string> issueSandboxExtension(QRVClientConnection& connection, const std::string& path,
-                                                 const char* extensionClass = kContainerExtensionClass);
+                                                 const char* extensionClass);
+// The same for a container's directory, with the extension class its
+// container class calls for: application groups have their own, so that the
+// sandbox can tell a shared group from an application's private data.
+std::optional<std::string> issueSandboxExtension(QRVClientConnection& connection, const QRVMetadata& container);
 
 }  // namespace QRVRequestUnpacking

@@ -54,11 +54,10 @@ std::string QRVContainerIdentity::description() const {
 QRVConcreteContainerIdentityRef QRVConcreteContainerIdentity::containerIdentityWithUUID(
     const QRVUUID& uuid, QRVUserIdentityRef userIdentity, const std::string& identifier,
     QRVContainerClass containerClass, QRVError* error) {
+  // Any UUID value names a container, the all-zero one included: a UUID that
+  // names none is simply not found. Data that is no UUID at all is refused
+  // where the request is unpacked.
   if (!validate(userIdentity, identifier, containerClass, error)) return nullptr;
-  if (uuid.isNull()) {
-    QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidObject, "Invalid object: uuid = [{}]", uuid.string()));
-    return nullptr;
-  }
   return QRVConcreteContainerIdentityRef(
       new QRVConcreteContainerIdentity(std::move(userIdentity), identifier, containerClass, uuid));
 }

@@ -195,9 +195,12 @@ TEST_F(RelayDispatcherTest, LookupDictionaryOpensOnlyTheLookupCommands) {
 
 TEST_F(RelayDispatcherTest, InvalidCommandsAnswer49) {
   setClient(700, entitlement(kEntitlementAllowed));
-  for (uint64_t c : {uint64_t{27}, uint64_t{32}, UINT64_MAX}) {  // 27 is retired: no handler
-    EXPECT_EQ(resultOf(700, c), 49u) << c;
-    EXPECT_FALSE(gSeen.called);
+  setClient(701, QRVPlist::dictionary());
+  for (pid_t pid : {700, 701, 702}) {  // entitled, without entitlements, unknown to the trust store
+    for (uint64_t c : {uint64_t{27}, uint64_t{32}, UINT64_MAX}) {  // 27 is retired: no handler
+      EXPECT_EQ(resultOf(pid, c), 49u) << "pid " << pid << " command " << c;
+      EXPECT_FALSE(gSeen.called);
+    }
   }
   // An entry that does not describe its own index is refused.
   table_[5].command = 6;
