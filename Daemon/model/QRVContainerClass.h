@@ -36,6 +36,9 @@ constexpr uid_t CONTAINER_SYSTEM_UID = 0;
 constexpr bool QRVContainerClassIsBundle(QRVContainerClass c) { return c < 9 && ((0x12aULL >> c) & 1); }
 // 12, 13.
 constexpr bool QRVContainerClassIsSystem(QRVContainerClass c) { return (c | 1) == 13; }
+// 2, 4, 6, 9, 10, 11: data containers, an application's or a service's own
+// data in a user's tree (system data, class 12, is a system container).
+constexpr bool QRVContainerClassIsData(QRVContainerClass c) { return c < 12 && ((0xe54ULL >> c) & 1); }
 // 2, 4, 6, 7, 9, 10, 11: containers that live in a user's tree.
 constexpr bool QRVContainerClassIsPerUser(QRVContainerClass c) { return c < 12 && ((0xed4ULL >> c) & 1); }
 // 1 to 13.

@@ -34,10 +34,10 @@ constexpr const char* kDestURLKey = "QRVReplaceOperationDestURL";
 
 // The data classes: the only ones whose contents belong to an application's
 // user and may be wiped.
-bool isWipeableDataClass(QRVContainerClass c) {
-  return c == QRVContainerClassAppData || c == QRVContainerClassPluginData || c == QRVContainerClassVPNPluginData ||
-         c == QRVContainerClassSystemData;
-}
+// Only data containers are wiped: a bundle is replaced by its installer, a
+// group is shared by several applications, and a system container belongs
+// to a service that is not asked.
+bool isWipeableDataClass(QRVContainerClass c) { return QRVContainerClassIsData(c); }
 
 // Widens a connection for the span of a wipe, whose look-up and creation
 // are on behalf of an identifier the caller was found entitled to wipe.

@@ -227,6 +227,35 @@ TEST_F(ReplaceTest, WipeKeepsUUIDAndPathAndLeavesOnlyTheDefaultStructure) {
   EXPECT_EQ(QRVEntriesIn(replaceDir()), 0u);
 }
 
+TEST_F(ReplaceTest, OnlyDataContainersAreWiped) {
+  // Data containers of every kind come back empty under their own UUID.
+  for (QRVContainerClass c : {2, 4, 6, 9, 10, 11}) {
+    SCOPED_TRACE(c);
+    auto id = identity("com.example.data", c);
+    auto old = create(id);
+    ASSERT_NE(old, nullptr);
+    QRVWriteText(old->url() + "/old.txt", "old");
+    QRVError error;
+    ASSERT_TRUE(admin()->deleteDataContainerContentWithContainerIdentity(id, &error)) << error.description();
+    EXPECT_FALSE(fs::exists(old->url() + "/old.txt"));
+    auto found = lookup(id, &error);
+    ASSERT_NE(found, nullptr) << error.description();
+    EXPECT_EQ(found->uuid(), old->uuid());
+  }
+  // Bundles, groups and system containers are not, and keep their content.
+  for (QRVContainerClass c : {1, 3, 7, 12, 13}) {
+    SCOPED_TRACE(c);
+    auto id = identity("com.example.other", c);
+    auto kept = create(id);
+    ASSERT_NE(kept, nullptr);
+    QRVWriteText(kept->url() + "/kept.txt", "kept");
+    QRVError error;
+    EXPECT_FALSE(admin()->deleteDataContainerContentWithContainerIdentity(id, &error));
+    EXPECT_EQ(error.code(), 11u);
+    EXPECT_EQ(QRVReadText(kept->url() + "/kept.txt"), "kept");
+  }
+}
+
 TEST_F(ReplaceTest, DeleteCommandsStageThroughTheQueue) {
   auto app = identity("com.example.app");
   auto a = create(app), b = create(identity("com.example.other"));
