@@ -70,7 +70,10 @@ void QRVRelayDispatcher::QRVProcessRelayEvent(const std::shared_ptr<QRVConnectio
   auto commandQueue = std::make_shared<QRVCommandQueue>();
   std::shared_ptr<const QRVClientIdentity> identity =
       QRVClientIdentity::clientIdentityWithRelayConnection(*connection, *services_);
-  const std::string clientName = identity ? identity->bundleIdentifier() : "<unknown>";
+  // A caller without a signing identifier has no name: the log lines say
+  // "(null)", as they would of any missing object.
+  const std::string clientName =
+      identity && !identity->bundleIdentifier().empty() ? identity->bundleIdentifier() : "(null)";
 
   if (!entry) {
     result = QRVResultCode::kInvalidCommand;

@@ -310,6 +310,17 @@ TEST_F(RelayDispatcherTest, FailuresWithoutAResultCodeAnswer40AndAreLogged) {
       << text;
 }
 
+TEST_F(RelayDispatcherTest, ACallerWithoutANameIsNullInTheLog) {
+  const std::string logPath = env_.root.path() + "/names.log";
+  ASSERT_TRUE(QRVLog::open("test", logPath, QRVLogLevel::kDebug, 2, 1 << 20));
+  EXPECT_EQ(resultOf(600, 2), 55u);  // unknown to the trust store
+  QRVLog::close();
+  std::stringstream log;
+  log << std::ifstream(logPath).rdbuf();
+  EXPECT_NE(log.str().find("connection attempt from pid 600 ((null)) is not entitled"), std::string::npos) << log.str();
+  EXPECT_NE(log.str().find("command=2, client=(null), error=55"), std::string::npos) << log.str();
+}
+
 TEST_F(RelayDispatcherTest, RegisteredEntitlementsAreRecordedOnlyForCallersWithPowers) {
   std::vector<std::string> recorded;
   processor_ = [&](const QRVPlist&, const std::string& id, QRVCommandQueue&) {
