@@ -138,6 +138,7 @@ bool QRVUserIdentityCache::_lock_resync_fromUserPersonaAttributes(const std::vec
   for (const QRVPersona& p : personas) {
     QRVLogInfo("Looking at universal={} system={} attributes: {}", p.isUniversal ? 1 : 0, p.isSystem ? 1 : 0,
                describePersonas({p}));
+    QRVUserIdentityRef identity;
     if (p.type == QRVPersonaTypePersonal && !personal) {
       if (p.uniqueString.empty()) {
         QRVLogError("Invalid persona unique string for personal {}", describePersonas({p}));
@@ -148,16 +149,19 @@ bool QRVUserIdentityCache::_lock_resync_fromUserPersonaAttributes(const std::vec
       if (!personal || !unspecific) continue;
       QRVLogInfo("Found personal persona {}: created personal {}, unspecific {}", p.personaID,
                  personal->shortDescription(), unspecific->shortDescription());
-      continue;
+      identity = personal;
+    } else {
+      if (p.uniqueString.empty()) {
+        QRVLogError("Invalid persona unique string for {}", describePersonas({p}));
+        continue;
+      }
+      identity = identityFromPersona(p, false);
+      if (!identity) continue;
+      byID[static_cast<int32_t>(p.personaID)] = identity;
+      byString[p.uniqueString] = identity;
     }
-    if (p.uniqueString.empty()) {
-      QRVLogError("Invalid persona unique string for {}", describePersonas({p}));
-      continue;
-    }
-    QRVUserIdentityRef identity = identityFromPersona(p, false);
-    if (!identity) continue;
-    byID[static_cast<int32_t>(p.personaID)] = identity;
-    byString[p.uniqueString] = identity;
+    // The personal persona's list counts like any other: an application in
+    // it and in an enterprise persona is installed in both.
     if (p.isUniversal || p.isSystem) {
       QRVLogInfo("Fetched bundle ID list for universal/system {}: ({})", p.uniqueString,
                  fmt::join(p.bundleIdentifiers, ", "));

@@ -97,17 +97,17 @@ class ContainerCacheTest : public testing::Test {
     return urls;
   }
 
-  // A personal persona, two enterprise personas ("WORK" has the mail
-  // application, "OTHER" nothing) and, for applications installed in more
-  // than one persona, a second record of the personal user.
+  // A personal persona with the shared application and two enterprise
+  // personas ("WORK" has the mail and the shared application, "OTHER"
+  // nothing). The personal and WORK personas are universal: their bundle
+  // lists say where each application is installed.
   void usePersonas() {
     env_.personas->supported = true;
     const std::vector<std::string> work = {"com.example.mail", "com.example.shared"}, shared = {"com.example.shared"};
     const std::string mobile = "/private/var/mobile";
-    env_.personas->list = {{1000, 501, 501, QRVPersonaTypePersonal, "PERSONAL", mobile, {}, false, false},
+    env_.personas->list = {{1000, 501, 501, QRVPersonaTypePersonal, "PERSONAL", mobile, shared, true, false},
                            {1001, 501, 501, QRVPersonaTypeEnterprise, "WORK", "/private/var/work", work, true, false},
-                           {1002, 501, 501, QRVPersonaTypeEnterprise, "OTHER", "/private/var/other", {}, false, false},
-                           {1003, 501, 501, QRVPersonaTypePersonal, "PERSONAL2", mobile, shared, true, false}};
+                           {1002, 501, 501, QRVPersonaTypeEnterprise, "OTHER", "/private/var/other", {}, false, false}};
     identities().flush();
     personal_ = identities().userIdentityForPersonalPersona();
     work_ = identities().userIdentityWithPersonaID(1001);
