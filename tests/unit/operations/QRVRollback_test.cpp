@@ -184,18 +184,16 @@ TEST_F(RollbackTest, CreationThatFailsBetweenItsStagingStepsPublishesNothing) {
     std::string pathContains;
     int nth;
     uint64_t code;
-    bool stagingCleared;  // only a failed move to the live place cleans up; the rest is left to the cleanup
   } steps[] = {
-      {"staging directory", Op::kMakeDirectory, stagingParent() + "/", 1, 7, true},
-      {"default subdirectory", Op::kMakeDirectory, "Documents", 1, 6, false},
+      {"staging directory", Op::kMakeDirectory, stagingParent() + "/", 1, 7},
+      {"default subdirectory", Op::kMakeDirectory, "Documents", 1, 6},
       // The metadata is written beside the staging directory, then moved in.
-      {"metadata write", Op::kOpen, "temp_metadata-", 1, 34, false},
-      {"metadata move", Op::kRename, "temp_metadata-", 1, 34, false},
-      {"move live", Op::kRename, stagingParent() + "/", 2, 8, true},
+      {"metadata write", Op::kOpen, "temp_metadata-", 1, 34},
+      {"metadata move", Op::kRename, "temp_metadata-", 1, 34},
+      {"move live", Op::kRename, stagingParent() + "/", 2, 8},
   };
   for (const Step& step : steps) {
     SCOPED_TRACE(step.what);
-    const size_t stagedBefore = parked();
     files().inject(step.op, {.errnum = EIO, .nth = step.nth, .pathContains = step.pathContains});
     QRVError error;
     EXPECT_EQ(admin()->createOrLookupContainerWithContainerIdentity(other, /*createIfNecessary=*/true,
@@ -203,7 +201,9 @@ TEST_F(RollbackTest, CreationThatFailsBetweenItsStagingStepsPublishesNothing) {
               nullptr);
     EXPECT_EQ(error.code(), step.code) << error.description();
     EXPECT_EQ(QRVEntriesIn(live), liveBefore);
-    EXPECT_EQ(parked(), stagedBefore + (step.stagingCleared ? 0 : 1));
+    // The half-built directory does not wait for the next start: the space
+    // it holds may be what just ran out.
+    EXPECT_EQ(parked(), 0u);
     freshCache();
     EXPECT_EQ(lookup(other, &error), nullptr);
     EXPECT_EQ(error.code(), 21u);
