@@ -80,11 +80,41 @@ TEST_F(RollbackTest, ReplaceThatCannotParkTheOldContainerLeavesEverythingInPlace
   EXPECT_EQ(replace(), 14u);
   EXPECT_EQ(parked(), 0u);
   EXPECT_EQ(QRVReadText(fresh_->url() + "/Documents/new"), "new");
-  // The journal outlives the failure; recovery sees the old container in
-  // place and only discards it.
-  EXPECT_EQ(QRVEntriesIn(replaceDir()), 1u);
+  // Nothing moved, so the journal goes with the failure: left behind it
+  // would name nothing to put back.
+  EXPECT_EQ(QRVEntriesIn(replaceDir()), 0u);
+  expectOldWhole();
   recover();
   expectOldWhole();
+}
+
+TEST_F(RollbackTest, ReplaceWhoseJournalCannotBeWrittenAnswers34AndLeavesNothing) {
+  struct {
+    const char* what;
+    Op op;
+    std::string pathContains;
+  } cases[] = {
+      {"the replace directory", Op::kMakeDirectory, replaceDir()},
+      {"the staging directory", Op::kMakeDirectory, stagingParent()},
+      {"the journal's temporary file", Op::kMakeTemporaryFile, replaceDir()},
+      {"the journal's write", Op::kWrite, replaceDir()},
+      {"the journal's move into place", Op::kRename, replaceDir()},
+      // The journal is in place, but its directory cannot be flushed: a
+      // power loss could still lose it, so the replace must not go on.
+      {"the flush of the replace directory", Op::kSynchronize, replaceDir()},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.what);
+    files().inject(c.op, {.errnum = ENOSPC, .nth = 1, .times = QRVFaultInjectionFileSystem::kForever,
+                          .pathContains = c.pathContains});
+    EXPECT_EQ(replace(), 34u);
+    files().clearFaults();
+    EXPECT_EQ(QRVEntriesIn(replaceDir()), 0u);
+    EXPECT_EQ(parked(), 0u);
+    EXPECT_EQ(QRVReadText(fresh_->url() + "/Documents/new"), "new");
+    expectOldWhole();
+  }
+  EXPECT_EQ(replace(), 1u);
 }
 
 TEST_F(RollbackTest, ReplaceThatCannotPlaceTheNewContainerMovesTheOldOneBack) {
