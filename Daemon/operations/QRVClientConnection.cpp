@@ -72,7 +72,8 @@ void QRVClientConnection::quorvaCleanupWithCompletion(std::function<void()> comp
     QRVError error;
     std::optional<std::vector<std::string>> items = fm.urlsForItemsInDirectoryAtURL(staging, &error);
     if (!items) {
-      if (!(error.isPOSIX() && error.code() == ENOENT)) QRVLogError(fmt::runtime(failure), staging, error.description());
+      if (!(error.isPOSIX() && error.code() == ENOENT))
+        QRVLogError(fmt::runtime(failure), staging, error.description());
       return;
     }
     for (const std::string& item : *items) {

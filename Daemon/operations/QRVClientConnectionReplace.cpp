@@ -265,8 +265,8 @@ bool QRVClientConnection::_recoverFromReplaceOperationsWithError(QRVError* error
       // what it moved is gone; there is nothing to put back, and keeping the
       // journal would stop every later start at it.
       const bool oneInPlace = fm.directoryExistsAtURL(oldURL) || fm.directoryExistsAtURL(dest);
-      const bool nothingLeft = !oneInPlace && fm.itemDoesNotExistAtURL(staging) &&
-                               fm.itemDoesNotExistAtURL(oldURL) && fm.itemDoesNotExistAtURL(dest);
+      const bool nothingLeft = !oneInPlace && fm.itemDoesNotExistAtURL(staging) && fm.itemDoesNotExistAtURL(oldURL) &&
+                               fm.itemDoesNotExistAtURL(dest);
       if (nothingLeft) {
         QRVLogNotice("Discarding replace file {}: nothing to move back ({}, {} and {} are all absent)", journalURL,
                      staging, oldURL, dest);

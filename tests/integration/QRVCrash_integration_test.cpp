@@ -4,8 +4,8 @@
 // empty staging and death row, and nothing else in the root changed. Also
 // recovers replace journals written by hand in each state a replace can be
 // caught in.
-#include <gtest/gtest.h>
 #include <fcntl.h>
+#include <gtest/gtest.h>
 #include <signal.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
@@ -405,7 +405,8 @@ void expectConsistentAfterRestart(const QRVDaemonProcess& daemon) {
     const std::string path = entry.path().string();
     std::ifstream in(path + "/" + kMetadataFile, std::ios::binary);
     const std::string bytes((std::istreambuf_iterator<char>(in)), {});
-    std::optional<QRVPlist> metadata = QRVPlist::fromBytes(reinterpret_cast<const uint8_t*>(bytes.data()), bytes.size());
+    std::optional<QRVPlist> metadata =
+        QRVPlist::fromBytes(reinterpret_cast<const uint8_t*>(bytes.data()), bytes.size());
     ASSERT_TRUE(metadata && metadata->isDictionary()) << "unreadable metadata in " << path;
     EXPECT_EQ(metadata->stringForKey("QRVMetadataUUID"), entry.path().filename().string()) << path;
     const std::string identifier = metadata->stringForKey("QRVMetadataIdentifier");

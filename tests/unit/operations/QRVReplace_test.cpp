@@ -2,8 +2,8 @@
 #include <unistd.h>
 
 #include <algorithm>
-#include <filesystem>
 #include <chrono>
+#include <filesystem>
 #include <fstream>
 #include <future>
 
@@ -110,9 +110,7 @@ class RecoveryTest : public ReplaceTest {
               QRVUUID::random().string();
     fs::create_directories(replaceDir());
   }
-  void writeJournal(const std::string& name = "j") {
-    writeJournal(name, oldURL_, newURL_, staging_, dest_);
-  }
+  void writeJournal(const std::string& name = "j") { writeJournal(name, oldURL_, newURL_, staging_, dest_); }
   void writeJournal(const std::string& name, const std::string& o, const std::string& n, const std::string& s,
                     const std::string& d) {
     QRVError error;

@@ -105,8 +105,9 @@ TEST_F(RollbackTest, ReplaceWhoseJournalCannotBeWrittenAnswers34AndLeavesNothing
   };
   for (const auto& c : cases) {
     SCOPED_TRACE(c.what);
-    files().inject(c.op, {.errnum = ENOSPC, .nth = 1, .times = QRVFaultInjectionFileSystem::kForever,
-                          .pathContains = c.pathContains});
+    files().inject(
+        c.op,
+        {.errnum = ENOSPC, .nth = 1, .times = QRVFaultInjectionFileSystem::kForever, .pathContains = c.pathContains});
     EXPECT_EQ(replace(), 34u);
     files().clearFaults();
     EXPECT_EQ(QRVEntriesIn(replaceDir()), 0u);
