@@ -1,6 +1,9 @@
 #include "operations/QRVClientConnection.h"
 
+#include <set>
+
 #include "base/QRVLog.h"
+#include "fs/QRVDictionaryAdditions.h"
 
 QRVClientConnection::QRVClientConnection(std::shared_ptr<const QRVClientIdentity> clientIdentity, bool entitled,
                                          bool allowOtherIdLookup, bool unrestricted,
@@ -56,23 +59,39 @@ void QRVClientConnection::rebootQuorvaCleanupWithCompletion(std::function<void()
 void QRVClientConnection::quorvaCleanupWithCompletion(std::function<void()> completion) {
   // What lies in staging now was left by an earlier run: collect it here, at
   // start-up, before any request can build something new there.
+  // A replace journal that recovery could not finish still names an old
+  // container parked in staging, the only copy of it: such items stay. When
+  // the journals cannot be read, nothing in staging is known to be spare.
   QRVFileManager& fm = *services_->fileManager;
   QRVGlobalConfiguration& config = *services_->globalConfiguration;
   std::vector<std::string> leftovers;
+  std::set<std::string> named;
+  const bool journalsKnown = _stagingItemsNamedByReplaceFiles(&named);
+  if (!journalsKnown) QRVLogError("Leaving staging alone: the replace files left cannot all be read");
   auto collect = [&](const std::string& staging, const char* failure) {
     QRVError error;
     std::optional<std::vector<std::string>> items = fm.urlsForItemsInDirectoryAtURL(staging, &error);
-    if (items)
-      leftovers.insert(leftovers.end(), items->begin(), items->end());
-    else if (!(error.isPOSIX() && error.code() == ENOENT))
-      QRVLogError(fmt::runtime(failure), staging, error.description());
+    if (!items) {
+      if (!(error.isPOSIX() && error.code() == ENOENT))
+        QRVLogError(fmt::runtime(failure), staging, error.description());
+      return;
+    }
+    for (const std::string& item : *items) {
+      if (named.count(QRVLastPathComponent(item))) {
+        QRVLogNotice("Keeping {} in staging: a replace file still names it", item);
+        continue;
+      }
+      leftovers.push_back(item);
+    }
   };
-  collect(config.stagingDirectory(), "Failed to get items at global staging URL: {} : {}");
-  services_->userIdentityCache->forEachAccessibleUserIdentitySynchronouslyExecuteBlock(
-      [&](const QRVUserIdentityRef& user) {
-        collect(config.stagingDirectoryURLForUserIdentity(user, QRVContainerClassAppData),
-                "Failed to get items at per-user staging URL: {} : {}");
-      });
+  if (journalsKnown) {
+    collect(config.stagingDirectory(), "Failed to get items at global staging URL: {} : {}");
+    services_->userIdentityCache->forEachAccessibleUserIdentitySynchronouslyExecuteBlock(
+        [&](const QRVUserIdentityRef& user) {
+          collect(config.stagingDirectoryURLForUserIdentity(user, QRVContainerClassAppData),
+                  "Failed to get items at per-user staging URL: {} : {}");
+        });
+  }
 
   // The work outlives this call; it runs as the daemon's own connection.
   std::shared_ptr<QRVClientConnection> worker = makeSharedClientConnection(services_);

@@ -225,6 +225,11 @@ class QRVClientConnection {
                              const std::string& stagingURL, const std::string& destinationURL, QRVError* error);
   // Finishes or rolls back every replace left in the replace directory.
   bool _recoverFromReplaceOperationsWithError(QRVError* error);
+  // Adds the last path component of the staging directory each journal left
+  // in the replace directory names: parked old containers that the start-up
+  // cleanup must leave alone. False when a journal there cannot be read (or
+  // the directory cannot be listed), so that nothing it may name is known.
+  bool _stagingItemsNamedByReplaceFiles(std::set<std::string>* names);
   // Look-up without creation for the operations above; 21 carries the
   // identity. Without `useLocking` the caller holds the global lock.
   QRVMetadataRef _existingContainer(const QRVContainerIdentityRef& containerIdentity, bool useLocking,

@@ -171,10 +171,20 @@ QRVMetadataRef QRVClientConnection::createOrLookupContainerWithContainerIdentity
     const std::string staging = config.stagingDirectoryURLForUserIdentity(userIdentity, containerClass) + "/" +
                                 uuid.string();
     QRVError step;
+    // A creation that fails often failed for want of space, which the half
+    // built directory holds: it goes to death row at once, and death row is
+    // emptied, rather than waiting in staging for the next start. Where even
+    // that fails it is removed in place. False when it is still there.
+    auto discardStaging = [&](QRVError* discardError) {
+      QRVError deathRowError;
+      if (_moveItemAtURLToDeathRow(staging, /*isDir=*/true, /*startDeletionThread=*/true, &deathRowError)) return true;
+      return fm.removeItemAtURL(staging, discardError);
+    };
     if (!_createTopLevelContainerDirectory(staging, containerClass, userIdentity->posixUIDForContainerClass(containerClass),
                                            &step)) {
       QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kStagingNotCreated, step,
                                           "Failed to create staging dir at \"{}\": {}", staging, step.description()));
+      discardStaging(nullptr);
       return nullptr;
     }
     QRVCrashPoint(*services_, "create.staged");
@@ -182,6 +192,7 @@ QRVMetadataRef QRVClientConnection::createOrLookupContainerWithContainerIdentity
         QRVConcreteContainerIdentity::containerIdentityWithUUID(uuid, userIdentity, identifier, containerClass, &step);
     if (!concrete) {
       QRVFail(error, step);
+      discardStaging(nullptr);
       return nullptr;
     }
     QRVMetadataRef metadata = QRVMetadata::make(*concrete, QRVPlist(), staging, "");
@@ -189,6 +200,7 @@ QRVMetadataRef QRVClientConnection::createOrLookupContainerWithContainerIdentity
         (QRVContainerClassIsSystem(containerClass) && !fm.setTopLevelSystemContainerACLAtURL(staging, &step)) ||
         !_createSubDirectories(staging, *metadata, &step)) {
       QRVFail(error, step);
+      discardStaging(nullptr);
       return nullptr;
     }
     QRVCrashPoint(*services_, "create.metadata-written");
@@ -197,6 +209,7 @@ QRVMetadataRef QRVClientConnection::createOrLookupContainerWithContainerIdentity
                                                                                     transient);
     if (!parent) {
       QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidObject, "Invalid object: container class = {}", containerClass));
+      discardStaging(nullptr);
       return nullptr;
     }
     std::optional<std::string> wellKnownName;
@@ -209,7 +222,7 @@ QRVMetadataRef QRVClientConnection::createOrLookupContainerWithContainerIdentity
     if (!fm.moveItemAtURL(staging, live, &step)) {
       QRVError moveError = QRV_ERROR_UNDERLYING(QRVResultCode::kNotMovedLive, step,
                                                 "Failed to move staging dir: {} to live dir: {}", staging, live);
-      if (!fm.removeItemAtURL(staging, &step))
+      if (!discardStaging(&step))
         moveError =
             QRV_ERROR_UNDERLYING(QRVResultCode::kStagingNotRemoved, step, "Failed to remove staging dir: {}", staging);
       QRVFail(error, moveError);

@@ -15,6 +15,7 @@
 #include <cstdlib>
 #include <cstring>
 #include <exception>
+#include <set>
 
 #include "base/QRVLog.h"
 #include "core/QRVCommandStageForDelete.h"
@@ -22,7 +23,9 @@
 #include "core/QRVExceptionReporter.h"
 #include "core/QRVLocks.h"
 #include "fs/QRVDictionaryAdditions.h"
+#include "fs/QRVPathComponents.h"
 #include "model/QRVContainerCache.h"
+#include "model/QRVPerUserConfiguration.h"
 #include "operations/QRVClientConnection.h"
 
 namespace {
@@ -52,6 +55,76 @@ class UnrestrictedScope {
   QRVClientConnection& connection_;
   const bool was_;
 };
+
+// Where a journal's paths may lie: the trees holding containers (live and
+// transient, device-wide and each known user's) and the staging directories
+// that the old container is parked in.
+struct JournalTrees {
+  std::vector<std::string> containers;
+  std::vector<std::string> staging;
+};
+
+JournalTrees journalTrees(QRVServices& services) {
+  QRVGlobalConfiguration& config = *services.globalConfiguration;
+  JournalTrees trees;
+  trees.containers = {config.sharedContainersDirectory(), config.transientDirectory()};
+  trees.staging = {config.stagingDirectory()};
+  auto addUser = [&](const QRVUserIdentityRef& user) {
+    if (!user) return;
+    std::shared_ptr<QRVPerUserConfiguration> perUser = config.getPerUserConfigurationForUserIdentity(user);
+    trees.containers.push_back(perUser->userBaseDirectory());
+    trees.staging.push_back(perUser->stagingDirectory());
+  };
+  addUser(services.userIdentityCache->defaultUserIdentity());
+  services.userIdentityCache->forEachAccessibleUserIdentitySynchronouslyExecuteBlock(addUser);
+  for (std::string& tree : trees.containers) tree = QRVPathWithoutTrailingSlashes(tree);
+  for (std::string& tree : trees.staging) tree = QRVPathWithoutTrailingSlashes(tree);
+  return trees;
+}
+
+// Whether `path` is spelled as a plain absolute path: no empty, "." or ".."
+// component that would make its text say something other than where it leads.
+bool isPlainAbsolutePath(const std::string& path) {
+  if (path.empty() || path[0] != '/') return false;
+  std::vector<std::string> components = QRVPathComponents::split(path);
+  for (size_t i = 1; i < components.size(); i++)
+    if (components[i] == "." || components[i] == "..") return false;
+  return path.find("//") == std::string::npos;
+}
+
+// Whether `path` lies strictly inside `tree`, reached from it through real
+// directories only: a link on the way, or the item itself being a link,
+// would make the rename act somewhere the text does not say.
+bool liesInside(QRVFileManager& fm, const std::string& path, const std::string& tree) {
+  if (path.size() <= tree.size() + 1 || path.compare(0, tree.size(), tree) != 0 || path[tree.size()] != '/')
+    return false;
+  std::optional<std::string> realTree = fm.realPathForURL(tree, tree);
+  std::optional<std::string> real = fm.realPathForURL(path, tree);
+  return realTree && real && *real == *realTree + path.substr(tree.size());
+}
+
+bool liesInsideAny(QRVFileManager& fm, const std::string& path, const std::vector<std::string>& trees) {
+  for (const std::string& tree : trees)
+    if (liesInside(fm, path, tree)) return true;
+  return false;
+}
+
+// A container's place: inside a container tree, and not in staging (which a
+// user's container tree holds).
+bool isContainerPlace(QRVFileManager& fm, const std::string& path, const JournalTrees& trees) {
+  for (const std::string& staging : trees.staging)
+    if (path == staging || path.compare(0, staging.size() + 1, staging + "/") == 0) return false;
+  return liesInsideAny(fm, path, trees.containers);
+}
+
+// A parking place: a UUID-named item directly in a staging directory.
+bool isParkingPlace(QRVFileManager& fm, const std::string& path, const JournalTrees& trees) {
+  if (!QRVUUID::fromString(QRVLastPathComponent(path))) return false;
+  const std::string parent = QRVPathComponents::parentDirectory(path);
+  for (const std::string& staging : trees.staging)
+    if (parent == staging && liesInside(fm, path, staging)) return true;
+  return false;
+}
 
 }  // namespace
 
@@ -114,11 +187,55 @@ std::optional<QRVPlist> QRVClientConnection::_readAndValidateReplaceFileAtUrl(co
                       "Invalid replace data: Old: {}, New: {}, Staging: {}, Dest: {}", oldURL, newURL, staging, dest));
     return std::nullopt;
   }
+  oldURL = QRVPathWithoutTrailingSlashes(oldURL);
+  newURL = QRVPathWithoutTrailingSlashes(newURL);
+  staging = QRVPathWithoutTrailingSlashes(staging);
+  dest = QRVPathWithoutTrailingSlashes(dest);
+  // Recovery renames what the journal names, as root: every path must be one
+  // this daemon could have written, inside its own trees under the root.
+  QRVFileManager& fm = *services_->fileManager;
+  const JournalTrees trees = journalTrees(*services_);
+  auto contained = [&](const std::string& path, bool parked) {
+    return isPlainAbsolutePath(path) && (parked ? isParkingPlace(fm, path, trees) : isContainerPlace(fm, path, trees));
+  };
+  if (!contained(oldURL, false) || !contained(newURL, false) || !contained(staging, true) || !contained(dest, false)) {
+    QRVFail(error, QRV_ERROR(QRVResultCode::kFileUnreadableOrRollbackFailed,
+                             "Replace data names a place outside the daemon's trees: Old: {}, New: {}, Staging: {}, "
+                             "Dest: {}",
+                             oldURL, newURL, staging, dest));
+    return std::nullopt;
+  }
   return QRVPlist::dictionary()
-      .set(kOldURLKey, QRVPlist::string(QRVPathWithoutTrailingSlashes(oldURL)))
-      .set(kNewURLKey, QRVPlist::string(QRVPathWithoutTrailingSlashes(newURL)))
-      .set(kStagingURLKey, QRVPlist::string(QRVPathWithoutTrailingSlashes(staging)))
-      .set(kDestURLKey, QRVPlist::string(QRVPathWithoutTrailingSlashes(dest)));
+      .set(kOldURLKey, QRVPlist::string(oldURL))
+      .set(kNewURLKey, QRVPlist::string(newURL))
+      .set(kStagingURLKey, QRVPlist::string(staging))
+      .set(kDestURLKey, QRVPlist::string(dest));
+}
+
+bool QRVClientConnection::_stagingItemsNamedByReplaceFiles(std::set<std::string>* names) {
+  QRVFileManager& fm = *services_->fileManager;
+  const std::string replaceDirectory = services_->globalConfiguration->replaceDirectory();
+  QRVError listError;
+  std::optional<std::vector<std::string>> journals = fm.urlsForItemsInDirectoryAtURL(replaceDirectory, &listError);
+  if (!journals) {
+    if (listError.isPOSIX() && listError.code() == ENOENT) return true;
+    QRVLogError("Failed to get items at replace URL {} : {}", replaceDirectory, listError.description());
+    return false;
+  }
+  for (const std::string& journalURL : *journals) {
+    // Read as written, unvalidated: this only keeps things, and a journal
+    // that recovery has not judged yet may still be the only record of
+    // where an old container is parked.
+    QRVError readError;
+    std::optional<QRVPlist> journal = QRV_dictionaryWithContentsOfURL(fm, journalURL, &readError);
+    const QRVPlist* staging = journal ? journal->get(kStagingURLKey) : nullptr;
+    if (!staging || !staging->isString()) {
+      QRVLogError("Replace file {} cannot be read: {}", journalURL, readError.description());
+      return false;
+    }
+    names->insert(QRVLastPathComponent(QRVPathWithoutTrailingSlashes(staging->stringValue())));
+  }
+  return true;
 }
 
 bool QRVClientConnection::_recoverFromReplaceOperationsWithError(QRVError* error) {
@@ -134,7 +251,9 @@ bool QRVClientConnection::_recoverFromReplaceOperationsWithError(QRVError* error
   for (const std::string& journalURL : *journals) {
     QRVError readError;
     std::optional<QRVPlist> journal = _readAndValidateReplaceFileAtUrl(journalURL, &readError);
-    if (journal) {
+    if (!journal) {
+      QRVLogError("Discarding replace file {}: {}", journalURL, readError.description());
+    } else {
       const std::string& oldURL = journal->stringForKey(kOldURLKey);
       const std::string& staging = journal->stringForKey(kStagingURLKey);
       const std::string& dest = journal->stringForKey(kDestURLKey);
@@ -142,15 +261,22 @@ bool QRVClientConnection::_recoverFromReplaceOperationsWithError(QRVError* error
       // The old directory in place: the swap never started. The new one at
       // the destination: it finished, and the parked directory is left for
       // the next cleanup. Neither: the old directory is parked; put it back.
-      if (!fm.directoryExistsAtURL(oldURL) && !fm.directoryExistsAtURL(dest)) {
+      // Nothing anywhere: the replace never got as far as its first move, or
+      // what it moved is gone; there is nothing to put back, and keeping the
+      // journal would stop every later start at it.
+      const bool oneInPlace = fm.directoryExistsAtURL(oldURL) || fm.directoryExistsAtURL(dest);
+      const bool nothingLeft = !oneInPlace && fm.itemDoesNotExistAtURL(staging) && fm.itemDoesNotExistAtURL(oldURL) &&
+                               fm.itemDoesNotExistAtURL(dest);
+      if (nothingLeft) {
+        QRVLogNotice("Discarding replace file {}: nothing to move back ({}, {} and {} are all absent)", journalURL,
+                     staging, oldURL, dest);
+      } else if (!oneInPlace) {
         QRVLogNotice("Recovering from failed replace by moving: {} to {}", staging, oldURL);
         QRVError moveError;
         if (!fm.moveItemAtURL(staging, oldURL, &moveError))
           return QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kFileUnreadableOrRollbackFailed, moveError,
                                                      "Failed to recover replace move: {} to {}", staging, oldURL));
       }
-    } else {
-      QRVLogError("Discarding replace file {}: {}", journalURL, readError.description());
     }
     QRVError discardError;
     if (!_moveItemAtURLToDeathRow(journalURL, /*isDir=*/false, /*startDeletionThread=*/false, &discardError))
@@ -255,19 +381,39 @@ bool QRVClientConnection::replaceContainerIdentity(const QRVContainerIdentityRef
     const std::string staging = QRVPathWithoutTrailingSlashes(stagingParent) + "/" + QRVUUID::random().string();
     const std::string replaceDirectory = config.replaceDirectory();
     const std::string journalURL = QRVPathWithoutTrailingSlashes(replaceDirectory) + "/" + QRVUUID::random().string() + ".plist";
+    // While nothing has moved, a failure takes the journal with it: a
+    // journal naming nothing to put back would only stand in the way of
+    // every later start's recovery. It is removed in place, which needs no
+    // room on death row.
+    auto discardJournal = [&] {
+      QRVError removeError;
+      if (!fm.removeFileAtURL(journalURL, &removeError))
+        QRVLogError("Failed to remove replace file {}: {}", journalURL, removeError.description());
+    };
     QRVError step;
     if (!fm.createDirectoryAtURL(replaceDirectory, true, 0755, &step) ||
-        !fm.createDirectoryAtURL(stagingParent, true, 0755, &step) ||
-        !_writeToDiskReplaceAt(journalURL, oldURL, newURL, staging, dest, &step)) {
+        !fm.createDirectoryAtURL(stagingParent, true, 0755, &step)) {
+      return QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kFileNotWritten, step,
+                                                 "Failed to prepare the replace file's directories: {}, {}",
+                                                 replaceDirectory, stagingParent));
+    }
+    if (!_writeToDiskReplaceAt(journalURL, oldURL, newURL, staging, dest, &step)) {
+      // The file may be in place and only its directory's flush have failed.
+      discardJournal();
       QRVLogError("Failed to write replace file: {}", step.description());
       return QRVFail(error, step);
     }
     QRVCrashPoint(*services_, "replace.journal-written");
 
     // Park the old directory; from here on the journal knows where it is.
-    if (!fm.moveItemAtURL(oldURL, staging, &step))
-      return QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kOldNotMovedAside, step,
-                                                 "Failed to move old {} to staging {}", oldURL, staging));
+    if (!fm.moveItemAtURL(oldURL, staging, &step)) {
+      QRVError parkError = QRV_ERROR_UNDERLYING(QRVResultCode::kOldNotMovedAside, step,
+                                                "Failed to move old {} to staging {}", oldURL, staging);
+      // A rename is all or nothing, but the journal goes only when the disk
+      // agrees that nothing moved.
+      if (fm.directoryExistsAtURL(oldURL) && fm.itemDoesNotExistAtURL(staging)) discardJournal();
+      return QRVFail(error, parkError);
+    }
     if (!cache.removeContainerForUserIdentity(userIdentity, containerClass, oldMetadata->identifier(), transient,
                                               &step))
       return QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kCacheRemoveFailed, step,
@@ -287,7 +433,7 @@ bool QRVClientConnection::replaceContainerIdentity(const QRVContainerIdentityRef
         return QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kFileUnreadableOrRollbackFailed, backError,
                                                    "Failed to recover replace move: {} to {}", staging, oldURL));
       cache.addContainerMetadata(oldMetadata, oldURL, transient, true, nullptr);
-      _moveItemAtURLToDeathRow(journalURL, /*isDir=*/false, /*startDeletionThread=*/false, nullptr);
+      discardJournal();
       return QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kCacheAddFailed, step,
                                                  "Failed to add to cache: {}, url: {}, transient: {}",
                                                  newIdentity->description(), dest, transient ? 1 : 0));
@@ -305,7 +451,7 @@ bool QRVClientConnection::replaceContainerIdentity(const QRVContainerIdentityRef
       cache.addContainerMetadata(oldMetadata, oldURL, transient, true, nullptr);
       // The new container keeps its own identity where it is.
       if (keptUUID != newMetadata->uuid()) newMetadata->writeMetadataToDisk(fm, config, nullptr);
-      _moveItemAtURLToDeathRow(journalURL, /*isDir=*/false, /*startDeletionThread=*/false, nullptr);
+      discardJournal();
       return QRVFail(error, replaceError);
     }
     QRVCrashPoint(*services_, "replace.new-placed");

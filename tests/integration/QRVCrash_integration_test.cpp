@@ -4,16 +4,22 @@
 // empty staging and death row, and nothing else in the root changed. Also
 // recovers replace journals written by hand in each state a replace can be
 // caught in.
+#include <fcntl.h>
 #include <gtest/gtest.h>
+#include <signal.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
+#include <cstdio>
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
 #include <functional>
 #include <map>
+#include <random>
+#include <thread>
 
 #include "client/QRVClient.h"
 #include "integration/QRVDaemonProcess.h"
@@ -322,4 +328,140 @@ TEST(CrashIntegrationTest, HandWrittenJournalsOfEachStateAreRecoveredAtTheNextSt
     }
     EXPECT_EQ(containers, 1u);
   }
+}
+
+namespace {
+
+// One client process of the kill loop: as the installer, creates, replaces,
+// wipes and deletes containers of a few identifiers in a random mix until
+// the daemon goes away under it, writing a byte to `answered` for each
+// request that succeeded. Never returns.
+[[noreturn]] void runMixedLoadClient(const std::string& root, unsigned seed, int answered) {
+  if (setgid(kInstallerUID) != 0 || setuid(kInstallerUID) != 0) _exit(2);
+  std::srand(seed);
+  const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(20);
+  while (std::chrono::steady_clock::now() < deadline) {
+    QRVClientError error;
+    std::optional<QRVClient> client = QRVClient::connect(root, &error);
+    if (!client) _exit(0);  // the daemon is gone
+    auto send = [&](const QRVPlist& request) -> std::optional<QRVPlist> {
+      return client->sendRequest(request, std::chrono::seconds(5), &error);
+    };
+    const std::string identifier = "com.example.load" + std::to_string(std::rand() % 3);
+    auto identity = [&](uint64_t command) {
+      return QRVRequest(command)
+          .set("Identifier", QRVPlist::string(identifier))
+          .set("ContainerClass", QRVPlist::uinteger(2));
+    };
+    std::optional<QRVPlist> reply;
+    switch (std::rand() % 4) {
+      case 0:
+        reply = send(QRVCreateRequest(identifier, 2));
+        break;
+      case 1: {
+        std::optional<QRVPlist> old = send(QRVCreateRequest(identifier, 2));
+        std::optional<QRVPlist> fresh = old ? send(QRVCreateRequest(identifier, 2, /*transient=*/true)) : std::nullopt;
+        if (!fresh) _exit(0);
+        if (!old->get("ReplyUUID") || !fresh->get("ReplyUUID")) continue;  // raced with a delete
+        reply = send(QRVRequest(2)
+                         .set("OldIdentifier", QRVPlist::string(identifier))
+                         .set("OldContainerClass", QRVPlist::uinteger(2))
+                         .set("OldContainerUUID", QRVPlist::data(old->dataForKey("ReplyUUID")))
+                         .set("NewIdentifier", QRVPlist::string(identifier))
+                         .set("NewContainerClass", QRVPlist::uinteger(2))
+                         .set("NewContainerUUID", QRVPlist::data(fresh->dataForKey("ReplyUUID"))));
+        break;
+      }
+      case 2:
+        reply = send(identity(12));
+        break;
+      default:
+        reply = send(identity(10));
+        break;
+    }
+    if (!reply) _exit(0);
+    if (QRVClient::resultCode(*reply) == 1 && write(answered, "+", 1) != 1) _exit(3);
+  }
+  _exit(0);
+}
+
+// What a start must leave whatever moment the previous daemon died at: no
+// journal, staging and death row emptied by the cleanup, and each live
+// container whole (its metadata readable and naming its own directory's
+// UUID), one at most per identifier.
+void expectConsistentAfterRestart(const QRVDaemonProcess& daemon) {
+  const std::string root = daemon.root();
+  EXPECT_TRUE(isEmptyOrAbsent(root + kReplaceDirectory)) << "a replace journal survived the recovery";
+  EXPECT_TRUE(QRVEventually(
+      [&] {
+        return isEmptyOrAbsent(root + kUserStaging) && isEmptyOrAbsent(root + kCaches + "/Staging") &&
+               isEmptyOrAbsent(root + kCaches + "/Dead");
+      },
+      std::chrono::seconds(10)))
+      << "staging or death row still holds something";
+  std::map<std::string, std::string> liveByIdentifier;
+  if (!fs::exists(root + kDataClassDirectory)) return;
+  for (const auto& entry : fs::directory_iterator(root + kDataClassDirectory)) {
+    const std::string path = entry.path().string();
+    std::ifstream in(path + "/" + kMetadataFile, std::ios::binary);
+    const std::string bytes((std::istreambuf_iterator<char>(in)), {});
+    std::optional<QRVPlist> metadata =
+        QRVPlist::fromBytes(reinterpret_cast<const uint8_t*>(bytes.data()), bytes.size());
+    ASSERT_TRUE(metadata && metadata->isDictionary()) << "unreadable metadata in " << path;
+    EXPECT_EQ(metadata->stringForKey("QRVMetadataUUID"), entry.path().filename().string()) << path;
+    const std::string identifier = metadata->stringForKey("QRVMetadataIdentifier");
+    auto [it, first] = liveByIdentifier.emplace(identifier, path);
+    EXPECT_TRUE(first) << identifier << " is live twice: " << it->second << " and " << path;
+  }
+}
+
+}  // namespace
+
+// Several clients create, replace, wipe and delete containers while the
+// daemon is killed at random moments and restarted. Every start must recover
+// to a consistent state. A handful of rounds by default; QUORVAD_KILL_ROUNDS
+// asks for more.
+TEST(CrashIntegrationTest, KillsUnderMixedLoadAlwaysRestartConsistent) {
+  if (geteuid() != 0) GTEST_SKIP() << "needs root: clients run under other uids";
+  int rounds = 4;
+  if (const char* asked = std::getenv("QUORVAD_KILL_ROUNDS")) rounds = std::max(1, std::atoi(asked));
+  constexpr int kClients = 3;
+  QRVDaemonProcess daemon;
+  trustInstaller(daemon);
+  std::mt19937 random(std::random_device{}());
+  // The clients count their successes here, so that a loop whose load never
+  // got through cannot pass.
+  int answered[2];
+  ASSERT_EQ(pipe2(answered, O_NONBLOCK), 0);
+  size_t succeeded = 0;
+  for (int round = 0; round < rounds; round++) {
+    SCOPED_TRACE("round " + std::to_string(round));
+    daemon.start();
+    expectConsistentAfterRestart(daemon);
+    if (HasFatalFailure()) return;
+
+    std::vector<pid_t> clients;
+    for (int i = 0; i < kClients; i++) {
+      pid_t pid = fork();
+      ASSERT_GE(pid, 0);
+      if (pid == 0) runMixedLoadClient(daemon.root(), static_cast<unsigned>(random()), answered[1]);
+      clients.push_back(pid);
+    }
+    std::this_thread::sleep_for(std::chrono::milliseconds(50 + random() % 400));
+    ASSERT_EQ(kill(daemon.pid(), SIGKILL), 0);
+    ASSERT_TRUE(daemon.waitForExit(std::chrono::seconds(5)).has_value());
+    for (pid_t pid : clients) {
+      int status = 0;
+      ASSERT_EQ(waitpid(pid, &status, 0), pid);
+      EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << "client " << pid << " status " << status;
+    }
+    char bytes[4096];
+    for (ssize_t n; (n = read(answered[0], bytes, sizeof bytes)) > 0;) succeeded += static_cast<size_t>(n);
+  }
+  close(answered[0]);
+  close(answered[1]);
+  daemon.start();
+  expectConsistentAfterRestart(daemon);
+  EXPECT_GT(succeeded, static_cast<size_t>(rounds)) << "the clients' requests hardly ever got through";
+  std::printf("kill loop: %d rounds, %zu requests succeeded\n", rounds, succeeded);
 }

@@ -2,8 +2,10 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <chrono>
 #include <filesystem>
 #include <fstream>
+#include <future>
 
 #include "core/QRVDeleteHandlers.h"
 #include "fs/QRVDictionaryAdditions.h"
@@ -97,17 +99,22 @@ class RecoveryTest : public ReplaceTest {
   void SetUp() override {
     ReplaceTest::SetUp();
     if (IsSkipped()) return;
-    const std::string base = env_.root.path() + "/replace-test";
-    oldURL_ = base + "/live/" + QRVUUID::random().string();
-    staging_ = base + "/staging/" + QRVUUID::random().string();
-    dest_ = base + "/live/" + QRVUUID::random().string();
-    newURL_ = base + "/transient/" + QRVUUID::random().string();
-    for (const char* d : {"/live", "/staging", "/transient"}) fs::create_directories(base + d);
+    // The places a real replace of the mobile user's application data uses.
+    QRVGlobalConfiguration& config = *env_.services->globalConfiguration;
+    live_ = *config.containerDirectoryURLForUserIdentity(mobile(), QRVContainerClassAppData, false);
+    stagingParent_ = config.stagingDirectoryURLForUserIdentity(mobile(), QRVContainerClassAppData);
+    oldURL_ = live_ + "/" + QRVUUID::random().string();
+    staging_ = stagingParent_ + "/" + QRVUUID::random().string();
+    dest_ = live_ + "/" + QRVUUID::random().string();
+    newURL_ = *config.containerDirectoryURLForUserIdentity(mobile(), QRVContainerClassAppData, true) + "/" +
+              QRVUUID::random().string();
     fs::create_directories(replaceDir());
   }
-  void writeJournal() {
+  void writeJournal(const std::string& name = "j") { writeJournal(name, oldURL_, newURL_, staging_, dest_); }
+  void writeJournal(const std::string& name, const std::string& o, const std::string& n, const std::string& s,
+                    const std::string& d) {
     QRVError error;
-    ASSERT_TRUE(admin()->TEST_writeToDiskReplaceAt(replaceDir() + "/j.plist", oldURL_, newURL_, staging_, dest_, &error))
+    ASSERT_TRUE(admin()->TEST_writeToDiskReplaceAt(replaceDir() + "/" + name + ".plist", o, n, s, d, &error))
         << error.description();
   }
   void marked(const std::string& dir, const std::string& mark) {
@@ -120,6 +127,7 @@ class RecoveryTest : public ReplaceTest {
     EXPECT_EQ(QRVEntriesIn(replaceDir()), 0u);
   }
 
+  std::string live_, stagingParent_;
   std::string oldURL_, staging_, dest_, newURL_;
 };
 
@@ -183,6 +191,103 @@ TEST_F(RecoveryTest, UnreadableOrIncompleteJournalsAreDiscardedWithoutAMove) {
   recover();
   EXPECT_FALSE(fs::exists(oldURL_));
   EXPECT_EQ(QRVReadText(staging_ + "/mark"), "old");
+}
+
+TEST_F(RecoveryTest, AJournalWithNothingLeftToMoveBackIsDiscardedAndTheOthersStillRun) {
+  // One journal names nothing that exists any more; another names an old
+  // container parked in staging. Whatever order they are read in, the first
+  // must not stop the recovery of the second.
+  writeJournal("empty");
+  const std::string otherOld = live_ + "/" + QRVUUID::random().string();
+  const std::string otherStaging = stagingParent_ + "/" + QRVUUID::random().string();
+  marked(otherStaging, "parked");
+  writeJournal("parked", otherOld, newURL_, otherStaging, live_ + "/" + QRVUUID::random().string());
+  recover();
+  EXPECT_EQ(QRVReadText(otherOld + "/mark"), "parked");
+  EXPECT_FALSE(fs::exists(otherStaging));
+  EXPECT_FALSE(fs::exists(oldURL_));
+}
+
+TEST_F(RecoveryTest, AFailedMoveBackStopsRecoveryAndTheCleanupKeepsWhatJournalsName) {
+  marked(staging_, "parked");
+  writeJournal();
+  // The move back fails, once.
+  env_.posixFileSystem->failNext(QRVFaultInjectionFileSystem::Operation::kRename, EIO, staging_);
+  // A staging leftover no journal names.
+  const std::string leftover = stagingParent_ + "/" + QRVUUID::random().string();
+  marked(leftover, "leftover");
+
+  QRVError error;
+  EXPECT_FALSE(admin()->TEST_recoverFromReplaceOperationsWithError(&error));
+  EXPECT_EQ(error.code(), 35u);
+  EXPECT_EQ(QRVEntriesIn(replaceDir()), 1u);
+
+  std::promise<void> done;
+  admin()->quorvaCleanupWithCompletion([&] { done.set_value(); });
+  ASSERT_EQ(done.get_future().wait_for(std::chrono::seconds(10)), std::future_status::ready);
+  EXPECT_EQ(QRVReadText(staging_ + "/mark"), "parked");
+  EXPECT_FALSE(fs::exists(leftover));
+
+  // A journal that cannot be read says nothing of what it protects: the
+  // cleanup leaves staging alone.
+  QRVWriteText(replaceDir() + "/garbage.plist", "not a property list");
+  marked(leftover, "leftover");
+  std::promise<void> again;
+  admin()->quorvaCleanupWithCompletion([&] { again.set_value(); });
+  ASSERT_EQ(again.get_future().wait_for(std::chrono::seconds(10)), std::future_status::ready);
+  EXPECT_EQ(QRVReadText(staging_ + "/mark"), "parked");
+  EXPECT_EQ(QRVReadText(leftover + "/mark"), "leftover");
+
+  // The next start puts the old container back.
+  fs::remove(replaceDir() + "/garbage.plist");
+  recover();
+  EXPECT_EQ(QRVReadText(oldURL_ + "/mark"), "parked");
+}
+
+TEST_F(RecoveryTest, JournalsNamingPlacesOutsideTheirTreesAreDiscardedWithoutAMove) {
+  // A directory outside the root that must never be moved or filled.
+  QRVTemporaryDirectory outside;
+  const std::string sentinel = outside.path() + "/" + QRVUUID::random().string();
+  marked(sentinel, "outside");
+  // A link inside the container tree that leads out of it.
+  const std::string escape = live_ + "/escape";
+  fs::create_directories(live_);
+  fs::create_directory_symlink(outside.path(), escape);
+  const std::string uuid = QRVUUID::random().string();
+  marked(staging_, "parked");
+
+  struct {
+    const char* what;
+    std::string old, staging, dest;
+  } cases[] = {
+      {"the root of the file system as the parked directory", oldURL_, "/", dest_},
+      {"the root of the file system as the old place", "/", staging_, dest_},
+      {"a parked directory outside the root", oldURL_, sentinel, dest_},
+      {"an old place outside the root", outside.path() + "/" + uuid, staging_, dest_},
+      {"'..' climbing out of the container tree", live_ + "/../../../../../../../../" + uuid, staging_, dest_},
+      {"'..' climbing out of staging", oldURL_, stagingParent_ + "/../" + uuid, dest_},
+      {"a link in the container tree leading out", escape + "/" + uuid, staging_, dest_},
+      {"a parked directory that is itself a link", oldURL_, stagingParent_ + "/" + uuid, dest_},
+      {"a destination in staging", oldURL_, staging_, stagingParent_ + "/" + uuid},
+      {"a parked directory not directly in staging", oldURL_, live_ + "/" + uuid, dest_},
+  };
+  fs::create_directory_symlink(outside.path(), stagingParent_ + "/" + uuid);
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.what);
+    writeJournal("bad", c.old, newURL_, c.staging, c.dest);
+    QRVError error;
+    EXPECT_FALSE(admin()->TEST_readAndValidateReplaceFileAtUrl(replaceDir() + "/bad.plist", &error));
+    EXPECT_EQ(error.code(), 35u);
+    recover();
+    EXPECT_EQ(QRVReadText(sentinel + "/mark"), "outside");
+    EXPECT_EQ(QRVEntriesIn(outside.path()), 1u);
+    EXPECT_EQ(QRVReadText(staging_ + "/mark"), "parked");
+    EXPECT_FALSE(fs::exists(oldURL_));
+  }
+  // The same journal naming the daemon's own places is followed.
+  writeJournal();
+  recover();
+  EXPECT_EQ(QRVReadText(oldURL_ + "/mark"), "parked");
 }
 
 TEST_F(ReplaceTest, WipeKeepsUUIDAndPathAndLeavesOnlyTheDefaultStructure) {
