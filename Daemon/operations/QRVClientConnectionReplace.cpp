@@ -195,8 +195,9 @@ std::optional<QRVPlist> QRVClientConnection::_readAndValidateReplaceFileAtUrl(co
   // this daemon could have written, inside its own trees under the root.
   QRVFileManager& fm = *services_->fileManager;
   const JournalTrees trees = journalTrees(*services_);
-  auto contained = [&](const std::string& path, bool parked) {
-    return isPlainAbsolutePath(path) && (parked ? isParkingPlace(fm, path, trees) : isContainerPlace(fm, path, trees));
+  auto contained = [&](const std::string& place, bool parked) {
+    return isPlainAbsolutePath(place) &&
+           (parked ? isParkingPlace(fm, place, trees) : isContainerPlace(fm, place, trees));
   };
   if (!contained(oldURL, false) || !contained(newURL, false) || !contained(staging, true) || !contained(dest, false)) {
     QRVFail(error, QRV_ERROR(QRVResultCode::kFileUnreadableOrRollbackFailed,
