@@ -372,7 +372,19 @@ std::optional<uint64_t> QRVClientConnection::diskUsageWithContainerIdentity(
     if (recorded && recorded->type() == QRVPlist::Type::UInteger) return recorded->uint64Value();
 
     services_->testLocks->waitOnLock(kTestLockDiskUsage);
-    uint64_t measured = services_->fileManager->fastDiskUsageForURL(metadata->url());
+    // A tree that cannot be measured whole has no size to report: a partial
+    // count (or 0) would be believed, and for a bundle recorded for good.
+    // The failure is wrapped in a code of ours so that no errno (EPERM is 1)
+    // can read as success.
+    QRVError measureError;
+    std::optional<uint64_t> usage = services_->fileManager->fastDiskUsageForURL(metadata->url(), &measureError);
+    if (!usage) {
+      QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kUnexpectedPath, measureError,
+                                          "Failed to measure disk usage of {}: {}", metadata->url(),
+                                          measureError.description()));
+      return std::nullopt;
+    }
+    const uint64_t measured = *usage;
     if (QRVContainerClassIsBundle(metadata->containerClass())) {
       QRVError recordError;
       // A failure only costs a measurement next time; the answer stands.

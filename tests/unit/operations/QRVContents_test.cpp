@@ -1,3 +1,4 @@
+#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -247,6 +248,49 @@ TEST_F(ContentsTest, DataContainersAreMeasuredEveryTimeBundlesOnce) {
   locks.releaseLock(2);
   measuring.join();
   locks.setEnabled(false);
+}
+
+// An application can nest directories far past the longest path the system
+// accepts; its usage must still be measured whole, as `du` counts it.
+TEST_F(ContentsTest, DiskUsageOfADeepTreeIsMeasuredWholeAndAFailureIsNoAnswer) {
+  auto data = identity("com.example.app");
+  auto container = create(data);
+  int fd = open(container->url().c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+  ASSERT_GE(fd, 0);
+  for (int level = 0; level < 300; level++) {
+    ASSERT_EQ(mkdirat(fd, "twenty-character-dir", 0755), 0);
+    int child = openat(fd, "twenty-character-dir", O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+    close(fd);
+    ASSERT_GE(child, 0);
+    fd = child;
+  }
+  int file = openat(fd, "bottom", O_WRONLY | O_CREAT | O_CLOEXEC, 0644);
+  close(fd);
+  ASSERT_GE(file, 0);
+  std::string data1m(1 << 20, 'd');
+  ASSERT_EQ(write(file, data1m.data(), data1m.size()), static_cast<ssize_t>(data1m.size()));
+  close(file);
+
+  QRVError error;
+  auto usage = admin()->diskUsageWithContainerIdentity(data, &error);
+  ASSERT_TRUE(usage.has_value()) << error.description();
+  EXPECT_GE(*usage, (1u << 20) + 300u * 512u);
+  FILE* du = popen(("du -sB1 '" + container->url() + "' 2>/dev/null").c_str(), "r");
+  unsigned long long duBytes = 0;
+  if (du && fscanf(du, "%llu", &duBytes) == 1 && pclose(du) == 0) {
+    EXPECT_EQ(*usage, duBytes);
+  }
+
+  // A walk that fails answers a failure, and for a bundle nothing is recorded.
+  auto bundle = identity("com.example.app", QRVContainerClassAppBundle);
+  create(bundle);
+  env_.fileSystem->failNext(QRVFakeFileSystemExtras::Operation::kDirectoryStatistics, EPERM);
+  EXPECT_FALSE(admin()->diskUsageWithContainerIdentity(bundle, &error).has_value());
+  EXPECT_EQ(error.code(), 10u);  // not EPERM, which would read as success
+  EXPECT_FALSE(admin()->infoValueForKey(key("com.kelva.Verdane.StaticDiskUsage"), bundle, true, &error));
+  EXPECT_TRUE(admin()->diskUsageWithContainerIdentity(bundle, &error).has_value());
+  // The chain is beyond what the test's own clean-up can remove.
+  EXPECT_TRUE(env_.services->fileManager->removeItemAtURL(container->url() + "/twenty-character-dir", &error));
 }
 
 TEST_F(ContentsTest, NewDirectoryUUIDKeepsTheContainerReachable) {
