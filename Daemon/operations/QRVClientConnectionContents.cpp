@@ -247,23 +247,22 @@ bool QRVClientConnection::deleteUserManagedAssetWithContainerIdentity(const QRVC
       return QRVFail(error, QRV_ERROR(QRVResultCode::kUnexpectedPath, "Unable to get realpath for resource {}",
                                       containerURL + "/" + metadata->userManagedAssetsDirName()));
 
-    // The whole path, links included, must resolve inside the directory.
-    // What is removed is then the item the path names: for a link, the link
-    // itself (which lies inside), never what it points to.
+    // The asset is what the path resolves to, links included, and it must
+    // exist: removing nothing is no success, since the client would believe
+    // an asset gone that it only misnamed. The resolution refuses ".." and
+    // links that leave the directory; the prefix check below refuses
+    // anything else that is not strictly inside it.
     std::string path = relativePath;
     while (path.size() > 1 && path.back() == '/') path.pop_back();
-    std::optional<std::string> target = fm.realPathForURL(*assets + "/" + path, *assets);
-    const std::string last = QRVLastPathComponent(path);
-    if (target && isInside(*target, *assets) && !last.empty() && last != "." && last != "..") {
-      const std::string parent = deletingLastPathComponent(path);
-      std::optional<std::string> parentReal =
-          parent.empty() ? assets : fm.realPathForURL(*assets + "/" + parent, *assets);
-      target = parentReal ? std::optional<std::string>(*parentReal + "/" + last) : std::nullopt;
-    }
-    if (target && *target == *assets)
+    const std::string resource = *assets + "/" + path;
+    std::optional<std::string> target = fm.realPathForURL(resource, *assets);
+    if (!target || !fm.itemExistsAtURL(*target))
+      return QRVFail(error,
+                     QRV_ERROR(QRVResultCode::kUnexpectedPath, "Unable to get realpath for resource {}", resource));
+    if (*target == *assets)
       return QRVFail(error, QRV_ERROR(QRVResultCode::kUnexpectedPath,
                                       "Illegal attempt to delete user managed assets directory at {}", *assets));
-    if (!target || !isInside(*target, *assets))
+    if (!isInside(*target, *assets))
       return QRVFail(error, QRV_ERROR(QRVResultCode::kUnexpectedPath,
                                       "Illegal attempt to delete asset not residing in user managed assets "
                                       "directory {}",

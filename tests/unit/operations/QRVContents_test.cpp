@@ -183,15 +183,43 @@ TEST_F(AssetDeletionTest, RemovesOnlyWhatLiesInsideTheAssetsDirectory) {
 
   EXPECT_EQ(remove("file"), 1u);
   EXPECT_FALSE(fs::exists(assets_ + "/file"));
-  // A link inside is removed itself, not what it names.
-  EXPECT_EQ(remove("inner"), 1u);
-  EXPECT_FALSE(fs::is_symlink(assets_ + "/inner"));
-  EXPECT_TRUE(fs::exists(assets_ + "/sub/deeper/file"));
   EXPECT_EQ(remove("sub/"), 1u);
   EXPECT_FALSE(fs::exists(assets_ + "/sub"));
-  // Removing what is already gone is no failure.
-  EXPECT_EQ(remove("nothing-here"), 1u);
   expectNothingOutsideTouched();
+}
+
+TEST_F(AssetDeletionTest, AMissingAssetIsAnErrorNotASuccess) {
+  // The client would believe gone an asset it only misnamed.
+  EXPECT_EQ(remove("nothing-here"), 10u);
+  EXPECT_EQ(remove("sub/nothing/here"), 10u);
+  EXPECT_EQ(remove("file/below-a-file"), 10u);
+  // A link whose target is gone names nothing either.
+  fs::create_symlink("gone", assets_ + "/dangling");
+  EXPECT_EQ(remove("dangling"), 10u);
+  EXPECT_TRUE(fs::is_symlink(assets_ + "/dangling"));
+  EXPECT_TRUE(fs::exists(assets_ + "/file"));
+}
+
+TEST_F(AssetDeletionTest, WhatIsRemovedIsTheResolvedItemInsideTheDirectory) {
+  // A nested asset, by its own path and through a link to it.
+  writeFile(assets_ + "/sub/deeper/second", 10);
+  EXPECT_EQ(remove("sub/deeper/second"), 1u);
+  EXPECT_FALSE(fs::exists(assets_ + "/sub/deeper/second"));
+  EXPECT_EQ(remove("inner"), 1u);
+  EXPECT_FALSE(fs::exists(assets_ + "/sub/deeper/file"));
+  EXPECT_TRUE(fs::is_directory(assets_ + "/sub/deeper"));
+
+  // Links that resolve out of the directory, by any route, and ".." in the
+  // path, even when it would come back inside.
+  fs::create_symlink("..", assets_ + "/sub/deeper/up");
+  fs::create_symlink("../../..", assets_ + "/sub/out");
+  fs::create_symlink(container_->url() + "/Documents", assets_ + "/docs");
+  for (const char* path : {"sub/deeper/up/../../Documents/precious", "sub/out", "sub/out/Documents/precious", "docs",
+                           "docs/precious", "sub/../file", "sub/deeper/../../file", "../" /* the container */})
+    EXPECT_EQ(remove(path), 10u) << path;
+  expectNothingOutsideTouched();
+  EXPECT_TRUE(fs::exists(assets_ + "/file"));
+  EXPECT_TRUE(fs::is_symlink(assets_ + "/sub/out"));
 }
 
 TEST_F(AssetDeletionTest, FailuresAndAnAssetsDirectorySwappedForALink) {
