@@ -300,27 +300,38 @@ std::optional<std::string> QRVClientConnection::stageSharedContentForIdentifier(
   }
   return guarded<std::optional<std::string>>(*this, error, std::nullopt, [&]() -> std::optional<std::string> {
     QRVUserIdentityRef systemUser = services_->userIdentityCache->defaultUserIdentity();
-    QRVContainerCache& cache = *services_->containerCache;
     QRVError step;
-    // The right to the group was checked above and the caller's own
-    // container is its own, so the cache is asked directly, without the
-    // look-up rights of create-or-lookup.
+    // Both containers are found the way any look-up finds them, with the
+    // caller's look-up rights: being allowed to stage into a group does not
+    // make a caller entitled to find a container it could not look up.
+    // Neither may be created here. A refusal passes through as it is.
     QRVGlobalReadLock lock;
-    QRVContainerIdentityRef groupIdentity = QRVContainerIdentity::containerIdentityWithUserIdentity(
-        systemUser, identifier, QRVContainerClassSystemGroup, &step);
-    QRVMetadataRef group = groupIdentity ? cache.containerForContainerIdentity(*groupIdentity, &step) : nullptr;
+    auto lookUp = [&](const std::string& id, QRVContainerClass containerClass) -> QRVMetadataRef {
+      QRVContainerIdentityRef identity =
+          QRVContainerIdentity::containerIdentityWithUserIdentity(systemUser, id, containerClass, &step);
+      if (!identity) return nullptr;
+      return createOrLookupContainerWithContainerIdentity(identity, /*createIfNecessary=*/false, /*transient=*/false,
+                                                          /*useLocking=*/false, &step);
+    };
+    auto notFound = [&]() { return step.code() == 0 || QRVContainerCache::isNotFoundError(step); };
+    QRVMetadataRef group = lookUp(identifier, QRVContainerClassSystemGroup);
     if (!group) {
-      QRVFail(error,
-              QRV_ERROR(QRVResultCode::kNoSuchContainer, "System group container with identifier {} not found: {}",
-                        identifier, step.description()));
+      if (notFound())
+        QRVFail(error,
+                QRV_ERROR(QRVResultCode::kNoSuchContainer, "System group container with identifier {} not found: {}",
+                          identifier, step.description()));
+      else
+        QRVFail(error, step);
       return std::nullopt;
     }
-    QRVContainerIdentityRef ownIdentity =
-        QRVContainerIdentity::containerIdentityWithUserIdentity(systemUser, caller, QRVContainerClassSystemData, &step);
-    QRVMetadataRef own = ownIdentity ? cache.containerForContainerIdentity(*ownIdentity, &step) : nullptr;
+    step = QRVError();
+    QRVMetadataRef own = lookUp(caller, QRVContainerClassSystemData);
     if (!own) {
-      QRVFail(error, QRV_ERROR(QRVResultCode::kNoSuchContainer, "No Container with identity: {}",
-                               ownIdentity ? ownIdentity->description() : caller));
+      if (notFound())
+        QRVFail(error, QRV_ERROR(QRVResultCode::kNoSuchContainer, "No Container with identity: {} (class {})", caller,
+                                 QRVContainerClassSystemData));
+      else
+        QRVFail(error, step);
       return std::nullopt;
     }
     QRVFileManager& fm = *services_->fileManager;

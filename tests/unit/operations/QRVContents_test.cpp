@@ -20,9 +20,15 @@ namespace {
 class GrantsOneGroup : public QRVNoSystemGroupQueries {
  public:
   std::vector<std::string> systemGroupIdentifiersForIdentifier(const std::string& id) override {
-    if (id == "com.example.daemon") return {"systemgroup.com.example.shared"};
+    if (id == "com.example.daemon") return {"systemgroup.com.example.shared", "systemgroup.com.example.absent"};
     return {};
   }
+};
+
+// The daemon of the shared-content tests has a system container of its own.
+class SaysHasSystemContainer : public QRVNoCodeSigningQueries {
+ public:
+  bool identifierHasSystemContainer(const std::string& id) override { return id == "com.example.daemon"; }
 };
 
 void writeFile(const std::string& path, size_t bytes) {
@@ -363,11 +369,11 @@ TEST_F(ContentsTest, SharedContentGoesOnlyToAGrantedGroupAndNeverLeavesEitherCon
   const std::string payload = own->url() + "/Library/out/payload";
   fs::create_directories(fs::path(payload).parent_path());
   writeFile(payload, 10);
+  // The daemon as a caller that may look up system groups.
+  auto daemon = [&] { return QRVContainerTest::connectionFor("com.example.daemon", {.groups = true}); };
   auto stage = [&](const std::string& groupId, const std::string& source, const std::string& dest) -> uint64_t {
     QRVError error;
-    return connectionFor("com.example.daemon")->stageSharedContentForIdentifier(groupId, source, dest, &error)
-               ? 1
-               : error.code();
+    return daemon()->stageSharedContentForIdentifier(groupId, source, dest, &error) ? 1 : error.code();
   };
   const std::string shared = "systemgroup.com.example.shared";
   // Without code signing no group is granted.
@@ -376,6 +382,7 @@ TEST_F(ContentsTest, SharedContentGoesOnlyToAGrantedGroupAndNeverLeavesEitherCon
   EXPECT_EQ(stage("", "Library/out/payload", "payload"), 11u);
 
   env_.services->systemGroups = std::make_shared<GrantsOneGroup>();
+  env_.services->codeSigning = std::make_shared<SaysHasSystemContainer>();
   EXPECT_EQ(stage("systemgroup.com.example.other", "Library/out/payload", "payload"), 55u);
   fs::create_symlink("../../..", own->url() + "/Library/up");
   EXPECT_EQ(stage(shared, "Library/up", "payload"), 10u);
@@ -384,9 +391,19 @@ TEST_F(ContentsTest, SharedContentGoesOnlyToAGrantedGroupAndNeverLeavesEitherCon
   EXPECT_EQ(stage(shared, "Library/out/payload", "../payload"), 38u);
   EXPECT_TRUE(fs::exists(payload));
 
+  // Granted the group, but not allowed to look it up: the look-up's refusal.
   QRVError error;
-  auto dest = connectionFor("com.example.daemon")
-                  ->stageSharedContentForIdentifier(shared, "Library/out/payload", "payload", &error);
+  EXPECT_FALSE(connectionFor("com.example.daemon")
+                   ->stageSharedContentForIdentifier(shared, "Library/out/payload", "payload", &error));
+  EXPECT_EQ(error.code(), 55u);
+  // A group that is granted but does not exist is not made by staging.
+  EXPECT_EQ(stage("systemgroup.com.example.absent", "Library/out/payload", "payload"), 21u);
+  EXPECT_EQ(admin()->metadataWithContainerIdentity(
+                identity("systemgroup.com.example.absent", QRVContainerClassSystemGroup), &error),
+            nullptr);
+  EXPECT_TRUE(fs::exists(payload));
+
+  auto dest = daemon()->stageSharedContentForIdentifier(shared, "Library/out/payload", "payload", &error);
   ASSERT_TRUE(dest.has_value()) << error.description();
   EXPECT_EQ(*dest, group->url() + "/payload");
   EXPECT_TRUE(fs::exists(*dest));
