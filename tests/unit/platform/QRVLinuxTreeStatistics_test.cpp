@@ -148,7 +148,8 @@ TEST_F(LinuxTreeStatisticsTest, FailureIsNoPartialAnswer) {
   makeChain(100);
   Statistics statistics{12345, 6};
   {
-    // No descriptor to spare for the walk's second level.
+    // Too few descriptors for the walk to get far: it must fail, not
+    // answer what it saw before it had to stop.
     size_t before = openDescriptors();
     struct rlimit saved;
     ASSERT_EQ(getrlimit(RLIMIT_NOFILE, &saved), 0);
