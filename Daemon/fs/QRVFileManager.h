@@ -206,12 +206,15 @@ class QRVFileManager {
 
   // ---- Sizes, debugging, homes ----
 
-  // Allocated bytes of the tree at `url`; 0 on failure (logged).
-  uint64_t diskUsageForURL(const std::string& url);
+  // Allocated bytes of the whole tree at `url`, or nothing when the tree
+  // could not be measured (a partial count would be a wrong answer, and 0 a
+  // plausible one). The error is in the POSIX domain.
+  std::optional<uint64_t> diskUsageForURL(const std::string& url, QRVError* error);
   // The same from statistics the file system maintains, turning them on for
   // the directory the first time they are missing, when the feature flag
-  // "fast_container_sizing" of "quorvad" is on; otherwise diskUsageForURL.
-  uint64_t fastDiskUsageForURL(const std::string& url);
+  // "fast_container_sizing" of "quorvad" is on; otherwise, and whenever the
+  // fast answer fails, diskUsageForURL.
+  std::optional<uint64_t> fastDiskUsageForURL(const std::string& url, QRVError* error);
 
   // Logs the tree at `url`, one line per entry.
   void printDirectoryStructureAtURL(const std::string& url);

@@ -139,30 +139,31 @@ bool QRVFileManager::_walk(Walk* walk, const std::string& path, int level, const
 
 // ---- Sizes and debugging ----
 
-uint64_t QRVFileManager::diskUsageForURL(const std::string& url) {
+std::optional<uint64_t> QRVFileManager::diskUsageForURL(const std::string& url, QRVError* error) {
   if (url.empty()) {
-    QRVLogError("Failed to get path to url {}", orNil(url));
-    return 0;
+    QRVFail(error, QRV_POSIX_ERROR(ENOENT, "Failed to get path to url {}", orNil(url)));
+    return std::nullopt;
   }
   QRVFileSystemExtras::DirectoryStatistics statistics;
   int e = extras_->directoryStatistics(url, QRVFileSystemExtras::StatisticsMode::kComprehensive, &statistics);
   if (e) {
-    QRVLogError("Failed to get dirstats on {} using fallback: (err {}) {}", url, e, errnoText(e));
-    return 0;
+    QRVFail(error,
+            QRV_POSIX_ERROR(e, "Failed to get dirstats on {} using fallback: (err {}) {}", url, e, errnoText(e)));
+    return std::nullopt;
   }
   if (statistics.totalSize < 0) {
-    QRVLogError("Invalid size ({}) from dirstats on {} using fallback: (err {}) {}", statistics.totalSize, url, 0,
-                errnoText(0));
-    return 0;
+    QRVFail(error, QRV_POSIX_ERROR(EOVERFLOW, "Invalid size ({}) from dirstats on {} using fallback: (err {}) {}",
+                                   statistics.totalSize, url, 0, errnoText(0)));
+    return std::nullopt;
   }
   QRVLogInfo("[{}]: descendants: {}, total size: {}, using fallback", url, statistics.descendants,
              statistics.totalSize);
   return static_cast<uint64_t>(statistics.totalSize);
 }
 
-uint64_t QRVFileManager::fastDiskUsageForURL(const std::string& url) {
+std::optional<uint64_t> QRVFileManager::fastDiskUsageForURL(const std::string& url, QRVError* error) {
   if (!featureFlags_ || !featureFlags_->isEnabled("quorvad", "fast_container_sizing") || url.empty())
-    return diskUsageForURL(url);
+    return diskUsageForURL(url, error);
   using Mode = QRVFileSystemExtras::StatisticsMode;
   QRVFileSystemExtras::DirectoryStatistics statistics;
   int e = extras_->directoryStatistics(url, Mode::kFastOnly, &statistics);
@@ -174,13 +175,14 @@ uint64_t QRVFileManager::fastDiskUsageForURL(const std::string& url) {
       e = extras_->directoryStatistics(url, Mode::kFastOnly, &statistics);
     }
   }
+  // The fast source failing is no answer yet: the walk decides.
   if (e) {
     QRVLogError("Failed to get dirstats on {}: (err {}) {}", url, e, errnoText(e));
-    return diskUsageForURL(url);
+    return diskUsageForURL(url, error);
   }
   if (statistics.totalSize < 0) {
     QRVLogError("Invalid size ({}) from dirstats on {}: (err {}) {}", statistics.totalSize, url, 0, errnoText(0));
-    return diskUsageForURL(url);
+    return diskUsageForURL(url, error);
   }
   QRVLogInfo("[{}]: descendants: {}, total size: {}", url, statistics.descendants, statistics.totalSize);
   return static_cast<uint64_t>(statistics.totalSize);

@@ -247,23 +247,22 @@ bool QRVClientConnection::deleteUserManagedAssetWithContainerIdentity(const QRVC
       return QRVFail(error, QRV_ERROR(QRVResultCode::kUnexpectedPath, "Unable to get realpath for resource {}",
                                       containerURL + "/" + metadata->userManagedAssetsDirName()));
 
-    // The whole path, links included, must resolve inside the directory.
-    // What is removed is then the item the path names: for a link, the link
-    // itself (which lies inside), never what it points to.
+    // The asset is what the path resolves to, links included, and it must
+    // exist: removing nothing is no success, since the client would believe
+    // an asset gone that it only misnamed. The resolution refuses ".." and
+    // links that leave the directory; the prefix check below refuses
+    // anything else that is not strictly inside it.
     std::string path = relativePath;
     while (path.size() > 1 && path.back() == '/') path.pop_back();
-    std::optional<std::string> target = fm.realPathForURL(*assets + "/" + path, *assets);
-    const std::string last = QRVLastPathComponent(path);
-    if (target && isInside(*target, *assets) && !last.empty() && last != "." && last != "..") {
-      const std::string parent = deletingLastPathComponent(path);
-      std::optional<std::string> parentReal =
-          parent.empty() ? assets : fm.realPathForURL(*assets + "/" + parent, *assets);
-      target = parentReal ? std::optional<std::string>(*parentReal + "/" + last) : std::nullopt;
-    }
-    if (target && *target == *assets)
+    const std::string resource = *assets + "/" + path;
+    std::optional<std::string> target = fm.realPathForURL(resource, *assets);
+    if (!target || !fm.itemExistsAtURL(*target))
+      return QRVFail(error,
+                     QRV_ERROR(QRVResultCode::kUnexpectedPath, "Unable to get realpath for resource {}", resource));
+    if (*target == *assets)
       return QRVFail(error, QRV_ERROR(QRVResultCode::kUnexpectedPath,
                                       "Illegal attempt to delete user managed assets directory at {}", *assets));
-    if (!target || !isInside(*target, *assets))
+    if (!isInside(*target, *assets))
       return QRVFail(error, QRV_ERROR(QRVResultCode::kUnexpectedPath,
                                       "Illegal attempt to delete asset not residing in user managed assets "
                                       "directory {}",
@@ -301,27 +300,38 @@ std::optional<std::string> QRVClientConnection::stageSharedContentForIdentifier(
   }
   return guarded<std::optional<std::string>>(*this, error, std::nullopt, [&]() -> std::optional<std::string> {
     QRVUserIdentityRef systemUser = services_->userIdentityCache->defaultUserIdentity();
-    QRVContainerCache& cache = *services_->containerCache;
     QRVError step;
-    // The right to the group was checked above and the caller's own
-    // container is its own, so the cache is asked directly, without the
-    // look-up rights of create-or-lookup.
+    // Both containers are found the way any look-up finds them, with the
+    // caller's look-up rights: being allowed to stage into a group does not
+    // make a caller entitled to find a container it could not look up.
+    // Neither may be created here. A refusal passes through as it is.
     QRVGlobalReadLock lock;
-    QRVContainerIdentityRef groupIdentity = QRVContainerIdentity::containerIdentityWithUserIdentity(
-        systemUser, identifier, QRVContainerClassSystemGroup, &step);
-    QRVMetadataRef group = groupIdentity ? cache.containerForContainerIdentity(*groupIdentity, &step) : nullptr;
+    auto lookUp = [&](const std::string& id, QRVContainerClass containerClass) -> QRVMetadataRef {
+      QRVContainerIdentityRef identity =
+          QRVContainerIdentity::containerIdentityWithUserIdentity(systemUser, id, containerClass, &step);
+      if (!identity) return nullptr;
+      return createOrLookupContainerWithContainerIdentity(identity, /*createIfNecessary=*/false, /*transient=*/false,
+                                                          /*useLocking=*/false, &step);
+    };
+    auto notFound = [&]() { return step.code() == 0 || QRVContainerCache::isNotFoundError(step); };
+    QRVMetadataRef group = lookUp(identifier, QRVContainerClassSystemGroup);
     if (!group) {
-      QRVFail(error,
-              QRV_ERROR(QRVResultCode::kNoSuchContainer, "System group container with identifier {} not found: {}",
-                        identifier, step.description()));
+      if (notFound())
+        QRVFail(error,
+                QRV_ERROR(QRVResultCode::kNoSuchContainer, "System group container with identifier {} not found: {}",
+                          identifier, step.description()));
+      else
+        QRVFail(error, step);
       return std::nullopt;
     }
-    QRVContainerIdentityRef ownIdentity =
-        QRVContainerIdentity::containerIdentityWithUserIdentity(systemUser, caller, QRVContainerClassSystemData, &step);
-    QRVMetadataRef own = ownIdentity ? cache.containerForContainerIdentity(*ownIdentity, &step) : nullptr;
+    step = QRVError();
+    QRVMetadataRef own = lookUp(caller, QRVContainerClassSystemData);
     if (!own) {
-      QRVFail(error, QRV_ERROR(QRVResultCode::kNoSuchContainer, "No Container with identity: {}",
-                               ownIdentity ? ownIdentity->description() : caller));
+      if (notFound())
+        QRVFail(error, QRV_ERROR(QRVResultCode::kNoSuchContainer, "No Container with identity: {} (class {})", caller,
+                                 QRVContainerClassSystemData));
+      else
+        QRVFail(error, step);
       return std::nullopt;
     }
     QRVFileManager& fm = *services_->fileManager;
@@ -372,7 +382,19 @@ std::optional<uint64_t> QRVClientConnection::diskUsageWithContainerIdentity(
     if (recorded && recorded->type() == QRVPlist::Type::UInteger) return recorded->uint64Value();
 
     services_->testLocks->waitOnLock(kTestLockDiskUsage);
-    uint64_t measured = services_->fileManager->fastDiskUsageForURL(metadata->url());
+    // A tree that cannot be measured whole has no size to report: a partial
+    // count (or 0) would be believed, and for a bundle recorded for good.
+    // The failure is wrapped in a code of ours so that no errno (EPERM is 1)
+    // can read as success.
+    QRVError measureError;
+    std::optional<uint64_t> usage = services_->fileManager->fastDiskUsageForURL(metadata->url(), &measureError);
+    if (!usage) {
+      QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kUnexpectedPath, measureError,
+                                          "Failed to measure disk usage of {}: {}", metadata->url(),
+                                          measureError.description()));
+      return std::nullopt;
+    }
+    const uint64_t measured = *usage;
     if (QRVContainerClassIsBundle(metadata->containerClass())) {
       QRVError recordError;
       // A failure only costs a measurement next time; the answer stands.

@@ -230,7 +230,9 @@ QRVMetadataRef QRVClientConnection::createOrLookupContainerWithContainerIdentity
     }
     QRVCrashPoint(*services_, "create.live");
     // With fast sizing, the size accounting of the new container starts now.
-    if (services_->platform.featureFlags->isEnabled("quorvad", "fast_container_sizing")) fm.fastDiskUsageForURL(live);
+    // A failure (logged) only leaves the first real measurement to do it.
+    if (services_->platform.featureFlags->isEnabled("quorvad", "fast_container_sizing"))
+      fm.fastDiskUsageForURL(live, nullptr);
 
     metadata = metadata->withURL(live)->withExisted(false)->withTransient(transient);
     if (!cache.addContainerMetadata(metadata, live, transient, true, &step)) {

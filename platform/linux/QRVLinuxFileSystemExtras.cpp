@@ -3,7 +3,6 @@
 #include <acl/libacl.h>
 #include <dirent.h>
 #include <fcntl.h>
-#include <fts.h>
 #include <linux/fs.h>
 #include <sys/acl.h>
 #include <sys/ioctl.h>
@@ -14,11 +13,11 @@
 #include <cerrno>
 #include <cstring>
 #include <map>
-#include <set>
 #include <unordered_set>
 #include <utility>
 
 #include "platform/linux/QRVLinuxTreeRemover.h"
+#include "platform/linux/QRVLinuxTreeStatistics.h"
 
 namespace {
 
@@ -390,34 +389,8 @@ int QRVLinuxFileSystemExtras::removeTree(const std::string& path, const RemovalE
 
 int QRVLinuxFileSystemExtras::directoryStatistics(const std::string& path, StatisticsMode,
                                                   DirectoryStatistics* statistics) {
-  std::string root = path;
-  char* const paths[] = {root.data(), nullptr};
-  FTS* fts = fts_open(paths, FTS_PHYSICAL | FTS_NOCHDIR | FTS_XDEV, nullptr);
-  if (!fts) return errno;
-  std::set<std::pair<dev_t, ino_t>> linked;  // files with several names are counted once
-  DirectoryStatistics result;
-  int e = 0;
-  for (;;) {
-    errno = 0;
-    FTSENT* entry = fts_read(fts);
-    if (!entry) {
-      e = errno;
-      break;
-    }
-    if (entry->fts_info == FTS_DP) continue;
-    if (entry->fts_info == FTS_ERR || entry->fts_info == FTS_NS) {
-      e = entry->fts_errno;
-      break;
-    }
-    const struct stat* st = entry->fts_statp;
-    if (entry->fts_level > 0) result.descendants++;
-    if (!S_ISDIR(st->st_mode) && st->st_nlink > 1 && !linked.insert({st->st_dev, st->st_ino}).second) continue;
-    result.totalSize += static_cast<int64_t>(st->st_blocks) * 512;
-  }
-  fts_close(fts);
-  if (e) return e;
-  *statistics = result;
-  return 0;
+  QRVLinuxTreeStatistics walk;
+  return walk.run(path, statistics);
 }
 
 int QRVLinuxFileSystemExtras::enableMaintainedDirectoryStatistics(const std::string&) { return 0; }

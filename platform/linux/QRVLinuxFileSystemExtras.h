@@ -23,8 +23,10 @@
 //   links nor the length of paths matter; it keeps at most kMaxOpenDirectories
 //   directories open and re-finds shallower ones through "..", checking that
 //   each is still the directory it left (QRVLinuxTreeRemover).
-// - Directory statistics: a walk summing st_blocks * 512 (hard-linked files
-//   once). Fast-only answers from the same walk: Linux file systems keep no
+// - Directory statistics: a descriptor-relative walk to any depth summing
+//   st_blocks * 512 as `du` does (hard-linked files once, links not followed,
+//   other file systems left out), which fails rather than answer part of the
+//   tree (QRVLinuxTreeStatistics). Fast-only answers from the same walk: Linux file systems keep no
 //   directory sizes, so there is nothing faster to ask and nothing to enable.
 #pragma once
 

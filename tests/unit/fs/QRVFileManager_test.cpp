@@ -598,24 +598,41 @@ TEST_F(FileManagerTest, DiskUsageTakesTheFastPathOnlyWhenEnabledAndFallsBack) {
   makeDirectories("c");
   fileSystem->setStatisticsOverride(Mode::kComprehensive, {1000, 2});
   fileSystem->setStatisticsOverride(Mode::kFastOnly, {2000, 2});
-  EXPECT_EQ(fm.diskUsageForURL(at("c")), 1000u);
-  EXPECT_EQ(fm.fastDiskUsageForURL(at("c")), 1000u);  // flag off
+  EXPECT_EQ(fm.diskUsageForURL(at("c"), nullptr), 1000u);
+  EXPECT_EQ(fm.fastDiskUsageForURL(at("c"), nullptr), 1000u);  // flag off
   EXPECT_EQ(fileSystem->statisticsModes(), (std::vector<Mode>{Mode::kComprehensive, Mode::kComprehensive}));
 
   flags->flags["quorvad/fast_container_sizing"] = true;
-  EXPECT_EQ(fm.fastDiskUsageForURL(at("c")), 2000u);
+  EXPECT_EQ(fm.fastDiskUsageForURL(at("c"), nullptr), 2000u);
   // No maintained statistics yet: they are turned on and asked for again.
   fileSystem->failNext(Op::kDirectoryStatistics, ENOTSUP);
-  EXPECT_EQ(fm.fastDiskUsageForURL(at("c")), 2000u);
+  EXPECT_EQ(fm.fastDiskUsageForURL(at("c"), nullptr), 2000u);
   EXPECT_EQ(fileSystem->calls(Op::kEnableMaintainedDirectoryStatistics), 1);
   // A nonsense or failed fast answer falls back to the walk.
   fileSystem->failNext(Op::kDirectoryStatistics, EIO);
-  EXPECT_EQ(fm.fastDiskUsageForURL(at("c")), 1000u);
+  EXPECT_EQ(fm.fastDiskUsageForURL(at("c"), nullptr), 1000u);
   fileSystem->setStatisticsOverride(Mode::kFastOnly, {-5, 1});
-  EXPECT_EQ(fm.fastDiskUsageForURL(at("c")), 1000u);
-  fileSystem->failNext(Op::kDirectoryStatistics, ENOENT);
-  EXPECT_EQ(fm.diskUsageForURL(at("c")), 0u);
-  EXPECT_EQ(fm.diskUsageForURL(""), 0u);
+  EXPECT_EQ(fm.fastDiskUsageForURL(at("c"), nullptr), 1000u);
+}
+
+// A tree that cannot be measured has no size: never 0, never a part.
+TEST_F(FileManagerTest, DiskUsageThatCannotBeMeasuredIsAnError) {
+  using Mode = QRVFileSystemExtras::StatisticsMode;
+  makeDirectories("c");
+  fileSystem->failNext(Op::kDirectoryStatistics, ENAMETOOLONG);
+  EXPECT_EQ(fm.diskUsageForURL(at("c"), &error), std::nullopt);
+  EXPECT_EQ(error.code(), static_cast<uint64_t>(ENAMETOOLONG));
+  EXPECT_EQ(fm.diskUsageForURL("", &error), std::nullopt);
+  EXPECT_EQ(error.code(), static_cast<uint64_t>(ENOENT));
+  fileSystem->setStatisticsOverride(Mode::kComprehensive, {-1, 2});
+  EXPECT_EQ(fm.diskUsageForURL(at("c"), &error), std::nullopt);
+  EXPECT_EQ(error.code(), static_cast<uint64_t>(EOVERFLOW));
+
+  // Fast sizing failing and its fallback failing too is a failure as well.
+  flags->flags["quorvad/fast_container_sizing"] = true;
+  fileSystem->failNext(Op::kDirectoryStatistics, EIO, 2);
+  EXPECT_EQ(fm.fastDiskUsageForURL(at("c"), &error), std::nullopt);
+  EXPECT_EQ(error.code(), static_cast<uint64_t>(EIO));
 }
 
 TEST_F(FileManagerTest, HomeDirectoriesLieUnderTheRoot) {

@@ -1,3 +1,4 @@
+#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -19,9 +20,15 @@ namespace {
 class GrantsOneGroup : public QRVNoSystemGroupQueries {
  public:
   std::vector<std::string> systemGroupIdentifiersForIdentifier(const std::string& id) override {
-    if (id == "com.example.daemon") return {"systemgroup.com.example.shared"};
+    if (id == "com.example.daemon") return {"systemgroup.com.example.shared", "systemgroup.com.example.absent"};
     return {};
   }
+};
+
+// The daemon of the shared-content tests has a system container of its own.
+class SaysHasSystemContainer : public QRVNoCodeSigningQueries {
+ public:
+  bool identifierHasSystemContainer(const std::string& id) override { return id == "com.example.daemon"; }
 };
 
 void writeFile(const std::string& path, size_t bytes) {
@@ -182,15 +189,43 @@ TEST_F(AssetDeletionTest, RemovesOnlyWhatLiesInsideTheAssetsDirectory) {
 
   EXPECT_EQ(remove("file"), 1u);
   EXPECT_FALSE(fs::exists(assets_ + "/file"));
-  // A link inside is removed itself, not what it names.
-  EXPECT_EQ(remove("inner"), 1u);
-  EXPECT_FALSE(fs::is_symlink(assets_ + "/inner"));
-  EXPECT_TRUE(fs::exists(assets_ + "/sub/deeper/file"));
   EXPECT_EQ(remove("sub/"), 1u);
   EXPECT_FALSE(fs::exists(assets_ + "/sub"));
-  // Removing what is already gone is no failure.
-  EXPECT_EQ(remove("nothing-here"), 1u);
   expectNothingOutsideTouched();
+}
+
+TEST_F(AssetDeletionTest, AMissingAssetIsAnErrorNotASuccess) {
+  // The client would believe gone an asset it only misnamed.
+  EXPECT_EQ(remove("nothing-here"), 10u);
+  EXPECT_EQ(remove("sub/nothing/here"), 10u);
+  EXPECT_EQ(remove("file/below-a-file"), 10u);
+  // A link whose target is gone names nothing either.
+  fs::create_symlink("gone", assets_ + "/dangling");
+  EXPECT_EQ(remove("dangling"), 10u);
+  EXPECT_TRUE(fs::is_symlink(assets_ + "/dangling"));
+  EXPECT_TRUE(fs::exists(assets_ + "/file"));
+}
+
+TEST_F(AssetDeletionTest, WhatIsRemovedIsTheResolvedItemInsideTheDirectory) {
+  // A nested asset, by its own path and through a link to it.
+  writeFile(assets_ + "/sub/deeper/second", 10);
+  EXPECT_EQ(remove("sub/deeper/second"), 1u);
+  EXPECT_FALSE(fs::exists(assets_ + "/sub/deeper/second"));
+  EXPECT_EQ(remove("inner"), 1u);
+  EXPECT_FALSE(fs::exists(assets_ + "/sub/deeper/file"));
+  EXPECT_TRUE(fs::is_directory(assets_ + "/sub/deeper"));
+
+  // Links that resolve out of the directory, by any route, and ".." in the
+  // path, even when it would come back inside.
+  fs::create_symlink("..", assets_ + "/sub/deeper/up");
+  fs::create_symlink("../../..", assets_ + "/sub/out");
+  fs::create_symlink(container_->url() + "/Documents", assets_ + "/docs");
+  for (const char* path : {"sub/deeper/up/../../Documents/precious", "sub/out", "sub/out/Documents/precious", "docs",
+                           "docs/precious", "sub/../file", "sub/deeper/../../file", "../" /* the container */})
+    EXPECT_EQ(remove(path), 10u) << path;
+  expectNothingOutsideTouched();
+  EXPECT_TRUE(fs::exists(assets_ + "/file"));
+  EXPECT_TRUE(fs::is_symlink(assets_ + "/sub/out"));
 }
 
 TEST_F(AssetDeletionTest, FailuresAndAnAssetsDirectorySwappedForALink) {
@@ -249,6 +284,49 @@ TEST_F(ContentsTest, DataContainersAreMeasuredEveryTimeBundlesOnce) {
   locks.setEnabled(false);
 }
 
+// An application can nest directories far past the longest path the system
+// accepts; its usage must still be measured whole, as `du` counts it.
+TEST_F(ContentsTest, DiskUsageOfADeepTreeIsMeasuredWholeAndAFailureIsNoAnswer) {
+  auto data = identity("com.example.app");
+  auto container = create(data);
+  int fd = open(container->url().c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+  ASSERT_GE(fd, 0);
+  for (int level = 0; level < 300; level++) {
+    ASSERT_EQ(mkdirat(fd, "twenty-character-dir", 0755), 0);
+    int child = openat(fd, "twenty-character-dir", O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+    close(fd);
+    ASSERT_GE(child, 0);
+    fd = child;
+  }
+  int file = openat(fd, "bottom", O_WRONLY | O_CREAT | O_CLOEXEC, 0644);
+  close(fd);
+  ASSERT_GE(file, 0);
+  std::string data1m(1 << 20, 'd');
+  ASSERT_EQ(write(file, data1m.data(), data1m.size()), static_cast<ssize_t>(data1m.size()));
+  close(file);
+
+  QRVError error;
+  auto usage = admin()->diskUsageWithContainerIdentity(data, &error);
+  ASSERT_TRUE(usage.has_value()) << error.description();
+  EXPECT_GE(*usage, (1u << 20) + 300u * 512u);
+  FILE* du = popen(("du -sB1 '" + container->url() + "' 2>/dev/null").c_str(), "r");
+  unsigned long long duBytes = 0;
+  if (du && fscanf(du, "%llu", &duBytes) == 1 && pclose(du) == 0) {
+    EXPECT_EQ(*usage, duBytes);
+  }
+
+  // A walk that fails answers a failure, and for a bundle nothing is recorded.
+  auto bundle = identity("com.example.app", QRVContainerClassAppBundle);
+  create(bundle);
+  env_.fileSystem->failNext(QRVFakeFileSystemExtras::Operation::kDirectoryStatistics, EPERM);
+  EXPECT_FALSE(admin()->diskUsageWithContainerIdentity(bundle, &error).has_value());
+  EXPECT_EQ(error.code(), 10u);  // not EPERM, which would read as success
+  EXPECT_FALSE(admin()->infoValueForKey(key("com.kelva.Verdane.StaticDiskUsage"), bundle, true, &error));
+  EXPECT_TRUE(admin()->diskUsageWithContainerIdentity(bundle, &error).has_value());
+  // The chain is beyond what the test's own clean-up can remove.
+  EXPECT_TRUE(env_.services->fileManager->removeItemAtURL(container->url() + "/twenty-character-dir", &error));
+}
+
 TEST_F(ContentsTest, NewDirectoryUUIDKeepsTheContainerReachable) {
   auto app = identity("com.example.app");
   auto old = create(app);
@@ -291,11 +369,11 @@ TEST_F(ContentsTest, SharedContentGoesOnlyToAGrantedGroupAndNeverLeavesEitherCon
   const std::string payload = own->url() + "/Library/out/payload";
   fs::create_directories(fs::path(payload).parent_path());
   writeFile(payload, 10);
+  // The daemon as a caller that may look up system groups.
+  auto daemon = [&] { return QRVContainerTest::connectionFor("com.example.daemon", {.groups = true}); };
   auto stage = [&](const std::string& groupId, const std::string& source, const std::string& dest) -> uint64_t {
     QRVError error;
-    return connectionFor("com.example.daemon")->stageSharedContentForIdentifier(groupId, source, dest, &error)
-               ? 1
-               : error.code();
+    return daemon()->stageSharedContentForIdentifier(groupId, source, dest, &error) ? 1 : error.code();
   };
   const std::string shared = "systemgroup.com.example.shared";
   // Without code signing no group is granted.
@@ -304,6 +382,7 @@ TEST_F(ContentsTest, SharedContentGoesOnlyToAGrantedGroupAndNeverLeavesEitherCon
   EXPECT_EQ(stage("", "Library/out/payload", "payload"), 11u);
 
   env_.services->systemGroups = std::make_shared<GrantsOneGroup>();
+  env_.services->codeSigning = std::make_shared<SaysHasSystemContainer>();
   EXPECT_EQ(stage("systemgroup.com.example.other", "Library/out/payload", "payload"), 55u);
   fs::create_symlink("../../..", own->url() + "/Library/up");
   EXPECT_EQ(stage(shared, "Library/up", "payload"), 10u);
@@ -312,9 +391,19 @@ TEST_F(ContentsTest, SharedContentGoesOnlyToAGrantedGroupAndNeverLeavesEitherCon
   EXPECT_EQ(stage(shared, "Library/out/payload", "../payload"), 38u);
   EXPECT_TRUE(fs::exists(payload));
 
+  // Granted the group, but not allowed to look it up: the look-up's refusal.
   QRVError error;
-  auto dest = connectionFor("com.example.daemon")
-                  ->stageSharedContentForIdentifier(shared, "Library/out/payload", "payload", &error);
+  EXPECT_FALSE(connectionFor("com.example.daemon")
+                   ->stageSharedContentForIdentifier(shared, "Library/out/payload", "payload", &error));
+  EXPECT_EQ(error.code(), 55u);
+  // A group that is granted but does not exist is not made by staging.
+  EXPECT_EQ(stage("systemgroup.com.example.absent", "Library/out/payload", "payload"), 21u);
+  EXPECT_EQ(admin()->metadataWithContainerIdentity(
+                identity("systemgroup.com.example.absent", QRVContainerClassSystemGroup), &error),
+            nullptr);
+  EXPECT_TRUE(fs::exists(payload));
+
+  auto dest = daemon()->stageSharedContentForIdentifier(shared, "Library/out/payload", "payload", &error);
   ASSERT_TRUE(dest.has_value()) << error.description();
   EXPECT_EQ(*dest, group->url() + "/payload");
   EXPECT_TRUE(fs::exists(*dest));
