@@ -21,7 +21,7 @@ std::string QRVError::description() const {
 }
 
 uint64_t QRVError::resultCode() const {
-  if (code_ != 0) return code_;
+  if (domain_ == kDomain && code_ != 0) return code_;
   QRVLogError("Internal error: a request failed without a result code ({}); answering {}",
               domain_.empty() ? std::string("no error was set") : description(),
               static_cast<uint64_t>(QRVResultCode::kException));

@@ -45,12 +45,12 @@ class QRVError {
 
   bool isPOSIX() const { return domain_ == kPOSIXDomain; }
 
-  // The code to answer a client with for this failure: the error's own
-  // code, whatever its domain (an errno that reaches a reply travels as it
-  // is, as it always has). An error that was never filled in (code 0) is a
-  // bug of the daemon: it is logged and answered as
-  // QRVResultCode::kException, the code for a failure inside an operation,
-  // because 0 must never reach a client.
+  // The code to answer a client with for this failure. Only the daemon's
+  // own codes are result codes. An error that was never filled in (code 0),
+  // or one of another domain that reached the reply unwrapped (an errno: 1,
+  // EPERM, would read as success, 28, ENOSPC, as "not deleted"), is a bug of
+  // the daemon: it is logged and answered as QRVResultCode::kException, the
+  // code for a failure inside an operation.
   uint64_t resultCode() const;
 
   // "<domain> <code>: <message> (function:line)", followed by the underlying

@@ -270,18 +270,18 @@ TEST_F(RelayDispatcherTest, FailuresWithoutAResultCodeAnswer40AndAreLogged) {
   EXPECT_EQ(resultOf(1100, 4), 40u);
   gHandlerResult = 1;
 
-  // A handler whose error was never filled in: the handlers' path from
-  // error to code never lets 0 reach the client. An errno is a code and
-  // travels as it is.
+  // A handler whose error was never filled in, or is an errno value (1,
+  // EPERM, would read as success): the handlers' path from error to code lets
+  // neither reach the client.
   table_[6].handler = [](const QRVPlist&, const std::shared_ptr<QRVReply>&, QRVClientConnection&, uint64_t* result) {
     QRVError never;
     *result = never.resultCode();
   };
   table_[7].handler = [](const QRVPlist&, const std::shared_ptr<QRVReply>&, QRVClientConnection&, uint64_t* result) {
-    *result = QRV_POSIX_ERROR_QUIET(EACCES, "open failed").resultCode();
+    *result = QRV_POSIX_ERROR_QUIET(EPERM, "open failed").resultCode();
   };
   EXPECT_EQ(resultOf(1100, 6), 40u);
-  EXPECT_EQ(resultOf(1100, 7), static_cast<uint64_t>(EACCES));
+  EXPECT_EQ(resultOf(1100, 7), 40u);
 
   // A deferred command that fails without a code used to leave the request
   // answering success.
@@ -308,6 +308,7 @@ TEST_F(RelayDispatcherTest, FailuresWithoutAResultCodeAnswer40AndAreLogged) {
   EXPECT_NE(text.find("command 2 failed without a result code; answering 40"), std::string::npos) << text;
   EXPECT_NE(text.find("a request failed without a result code (no error was set); answering 40"), std::string::npos)
       << text;
+  EXPECT_NE(text.find("POSIXErrorDomain 1: open failed"), std::string::npos) << text;
 }
 
 TEST_F(RelayDispatcherTest, ACallerWithoutANameIsNullInTheLog) {
