@@ -5,6 +5,7 @@
 #include "platform/linux/QRVLinuxFileSystem.h"
 #include "platform/linux/QRVLinuxFileSystemExtras.h"
 #include "platform/linux/QRVLinuxFirstBootMarker.h"
+#include "platform/linux/QRVLinuxInstanceLock.h"
 #include "platform/linux/QRVLinuxLockStateService.h"
 #include "platform/linux/QRVLinuxMessageService.h"
 #include "platform/linux/QRVLinuxNotificationService.h"
@@ -19,9 +20,12 @@ QRVPlatform QRVPlatform::makeLinux(const std::string& root, const LinuxOptions& 
   auto under = [&](const std::string& path) { return r == "/" ? path : r + path; };
 
   QRVPlatform p;
+  p.instanceLock = std::make_shared<QRVLinuxInstanceLock>(under("/run/quorvad/quorvad.lock"));
   QRVLinuxMessageService::Options options;
   options.socketPath = under("/run/quorvad/com.kelva.quorvad");
   options.writeStallTimeout = linuxOptions.writeStallTimeout;
+  options.readStallTimeout = linuxOptions.readStallTimeout;
+  options.maxConnections = linuxOptions.maxConnections;
   p.messages = std::make_shared<QRVLinuxMessageService>(options);
   p.trustStore = std::make_shared<QRVLinuxTrustStore>(under("/etc/quorva/clients.d"));
   QRVLinuxSandbox::Options sandboxOptions;
