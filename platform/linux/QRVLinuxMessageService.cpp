@@ -1,6 +1,7 @@
 #include "platform/linux/QRVLinuxMessageService.h"
 
 #include <fcntl.h>
+#include <malloc.h>
 #include <poll.h>
 #include <sys/epoll.h>
 #include <sys/eventfd.h>
@@ -25,6 +26,9 @@ namespace {
 constexpr uint64_t kListenerTag = 0;
 constexpr uint64_t kWakeTag = UINT64_MAX;
 constexpr size_t kReadChunk = 64 * 1024;
+// A connection keeps buffers up to this size between frames; a larger one
+// (left by a multi-megabyte request or reply) is given back after its frame.
+constexpr size_t kKeptBufferCapacity = 256 * 1024;
 
 int64_t nowMillis() {
   return std::chrono::duration_cast<std::chrono::milliseconds>(
@@ -43,6 +47,12 @@ class QRVLinuxMessageService::Connection : public QRVConnection {
   ~Connection() override {
     if (fd_ >= 0) ::close(fd_);
     if (pidfd_ >= 0) ::close(pidfd_);
+    // A peer that left in the middle of a large frame: give its buffer back
+    // to the system too (see process()).
+    if (in_.capacity() > kKeptBufferCapacity) {
+      std::vector<uint8_t>().swap(in_);
+      malloc_trim(0);
+    }
   }
 
   pid_t pid() const override { return cred_.pid; }
@@ -120,6 +130,14 @@ class QRVLinuxMessageService::Connection : public QRVConnection {
       if (message) {
         lock.unlock();
         deliver(handler, std::move(*message));
+        // The request's buffer and everything its handler built from it are
+        // free now, but the allocator keeps freed memory in its arenas (one
+        // per worker) unless told: without this a burst of large requests
+        // leaves the daemon at hundreds of megabytes for good.
+        if (largeFrameSeen_) {
+          largeFrameSeen_ = false;
+          malloc_trim(0);
+        }
         // Bytes of the next frame that came with this one waited for the
         // handler; their time starts now.
         if (in_.size() > inOffset_) frameStarted_ = nowMillis();
@@ -177,9 +195,11 @@ class QRVLinuxMessageService::Connection : public QRVConnection {
     if (in_.size() - inOffset_ < QRVWireFrame::kHeaderSize + h.length) return std::nullopt;
     auto body = QRVWireFrame::decodeBody(in_.data() + inOffset_ + QRVWireFrame::kHeaderSize, h.length);
     inOffset_ += QRVWireFrame::kHeaderSize + h.length;
+    if (h.length >= kKeptBufferCapacity) largeFrameSeen_ = true;
     if (inOffset_ == in_.size()) {
       in_.clear();
       inOffset_ = 0;
+      if (in_.capacity() > kKeptBufferCapacity) std::vector<uint8_t>().swap(in_);
     }
     if (!body) {
       *problem = "message body is not a dictionary";
@@ -249,6 +269,7 @@ class QRVLinuxMessageService::Connection : public QRVConnection {
     }
     out_.clear();
     outOffset_ = 0;
+    if (out_.capacity() > kKeptBufferCapacity) std::vector<uint8_t>().swap(out_);
     return true;
   }
 
@@ -319,6 +340,7 @@ class QRVLinuxMessageService::Connection : public QRVConnection {
   size_t inOffset_ = 0;
   bool peerEOF_ = false;
   int64_t frameStarted_ = 0;
+  bool largeFrameSeen_ = false;
 };
 
 QRVLinuxMessageService::QRVLinuxMessageService(Options options) : options_(std::move(options)) {}
