@@ -92,15 +92,17 @@ TEST(QRVTestLocksTest, LocksZeroAndOneHoldTheAllIdentifiersLock) {
 
 // Taking the all-identifiers lock the other way while the test locks hold it
 // would wait for ourselves on the state queue. The call runs on a thread of
-// its own so that a regression fails the test instead of hanging it.
+// its own so that a regression fails the test instead of hanging it (the
+// thread then keeps the wedged object, whose destructor would wait too).
 TEST(QRVTestLocksTest, TheOtherGlobalLockIsRefusedWhileOneIsHeld) {
-  QRVTestLocks locks;
+  auto shared = std::make_shared<QRVTestLocks>();
+  QRVTestLocks& locks = *shared;
   for (auto [held, other] : {std::pair{QRVTestLocks::kGlobalWriteLock, QRVTestLocks::kGlobalReadLock},
                              std::pair{QRVTestLocks::kGlobalReadLock, QRVTestLocks::kGlobalWriteLock}}) {
     SCOPED_TRACE(testing::Message() << "held " << held << ", then " << other);
     ASSERT_TRUE(locks.acquireLock(held));
     auto result = std::make_shared<std::atomic<int>>(-1);
-    std::thread([&locks, result, other = other] { *result = locks.acquireLock(other) ? 1 : 0; }).detach();
+    std::thread([shared, result, other = other] { *result = shared->acquireLock(other) ? 1 : 0; }).detach();
     ASSERT_TRUE(QRVEventually([&] { return *result != -1; })) << "acquiring the other global lock blocked";
     EXPECT_EQ(*result, 0);
     // The state queue still answers, and nothing was counted.
