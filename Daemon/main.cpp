@@ -9,6 +9,11 @@
 //   --write-stall-timeout MS
 //                     close a client that leaves its replies unread this long
 //                     (default 30000)
+//   --read-stall-timeout MS
+//                     close a client that leaves a frame unfinished this long
+//                     (default 30000)
+//   --max-connections N
+//                     refuse new connections while N are open (default 256)
 #include <signal.h>
 #include <systemd/sd-daemon.h>
 #include <unistd.h>
@@ -34,11 +39,15 @@ struct Arguments {
   int logLevel = QRVLogLevel::kNotice;
   int idleExitSeconds = 0;
   int writeStallMillis = 30'000;
+  int readStallMillis = 30'000;
+  int maxConnections = 256;
 };
 
 [[noreturn]] void usage(const char* problem) {
   if (problem) fprintf(stderr, "quorvad: %s\n", problem);
-  fprintf(stderr, "usage: quorvad [--root DIR] [--log-level N] [--idle-exit SECONDS] [--write-stall-timeout MS]\n");
+  fprintf(stderr,
+          "usage: quorvad [--root DIR] [--log-level N] [--idle-exit SECONDS] [--write-stall-timeout MS]\n"
+          "               [--read-stall-timeout MS] [--max-connections N]\n");
   exit(2);
 }
 
@@ -59,6 +68,11 @@ Arguments parseArguments(int argc, char** argv) {
       a.idleExitSeconds = atoi(value().c_str());
     } else if (arg == "--write-stall-timeout") {
       a.writeStallMillis = atoi(value().c_str());
+    } else if (arg == "--read-stall-timeout") {
+      a.readStallMillis = atoi(value().c_str());
+    } else if (arg == "--max-connections") {
+      a.maxConnections = atoi(value().c_str());
+      if (a.maxConnections < 1) usage("--max-connections needs a positive number");
     } else if (arg == "--help" || arg == "-h") {
       usage(nullptr);
     } else {
@@ -80,9 +94,13 @@ int main(int argc, char** argv) {
 
   QRVPlatform::LinuxOptions linuxOptions;
   linuxOptions.writeStallTimeout = std::chrono::milliseconds(std::max(100, args.writeStallMillis));
+  linuxOptions.readStallTimeout = std::chrono::milliseconds(std::max(100, args.readStallMillis));
+  linuxOptions.maxConnections = static_cast<size_t>(args.maxConnections);
   auto services = QRVServices::make(args.root, QRVPlatform::makeLinux(args.root, linuxOptions));
   QRVDaemon daemon(services, {args.logLevel});
-  daemon.start();
+  // Before the log file is open, lines go to stderr (the journal under
+  // systemd), which is where a second daemon's complaint belongs.
+  if (daemon.start() == QRVDaemon::StartResult::kRootInUse) return 1;
   // Tell systemd we are ready once start-up has run.
   daemon.listenerQueue()->async([] { sd_notify(0, "READY=1"); });
 

@@ -12,6 +12,7 @@
 #include "platform/QRVFileSystem.h"
 #include "platform/QRVFileSystemExtras.h"
 #include "platform/QRVFirstBootMarker.h"
+#include "platform/QRVInstanceLock.h"
 #include "platform/QRVLockStateService.h"
 #include "platform/QRVMessageService.h"
 #include "platform/QRVNotificationService.h"
@@ -21,6 +22,8 @@
 #include "platform/QRVTrustStore.h"
 
 struct QRVPlatform {
+  // Claimed before anything else: one daemon per root.
+  std::shared_ptr<QRVInstanceLock> instanceLock;
   std::shared_ptr<QRVMessageService> messages;
   std::shared_ptr<QRVTrustStore> trustStore;
   std::shared_ptr<QRVSandbox> sandbox;
@@ -39,6 +42,10 @@ struct QRVPlatform {
   struct LinuxOptions {
     // How long a client may leave its replies unread before it is cut off.
     std::chrono::milliseconds writeStallTimeout{30'000};
+    // How long a client may take to finish a frame it has begun.
+    std::chrono::milliseconds readStallTimeout{30'000};
+    // Open client connections beyond which new ones are refused.
+    size_t maxConnections = 256;
     // The slice under which applications run, one "app-<identifier>.scope"
     // each; an absolute path, taken under the daemon's root.
     std::string applicationSlice = "/sys/fs/cgroup/quorva-apps.slice";

@@ -12,7 +12,13 @@ QRVDaemon::QRVDaemon(std::shared_ptr<QRVServices> services, Options options)
   mainQueue_ = QRVSerialQueue::create("com.kelva.quorvad.main");
 }
 
-bool QRVDaemon::start() {
+QRVDaemon::StartResult QRVDaemon::start() {
+  QRVError claimError;
+  if (!services_->platform.instanceLock->acquire(&claimError)) {
+    QRVLogError("quorvad cannot start: {}", claimError.message());
+    return StartResult::kRootInUse;
+  }
+
   QRVMessageService& messages = *services_->platform.messages;
   // Closed by the last step of start-up: the daemon is not idle while it
   // starts.
@@ -30,7 +36,7 @@ bool QRVDaemon::start() {
       },
       &error);
   if (!listening) QRVLogError("unable to start relay service!");
-  return listening;
+  return listening ? StartResult::kServing : StartResult::kNotListening;
 }
 
 void QRVDaemon::quorvad_init() {
@@ -43,6 +49,11 @@ void QRVDaemon::quorvad_init() {
   // The death-row and lock-state queues belong to the services, which every
   // connection reaches; they exist from the services' creation.
   if (!services_->deathRowQueue || !services_->lockStateQueue) QRVTerminate("Can't create dispatch queues.");
+
+  // Without the subscription a persona added while the daemon runs would be
+  // unknown until a restart; subscribing before set-up means no change made
+  // during start-up is missed either.
+  services_->userIdentityCache->registerForPersonaListUpdates();
 
   sharedConnection_ = QRVClientConnection::makeSharedClientConnection(services_);
 

@@ -30,9 +30,19 @@ class QRVDaemon {
 
   QRVDaemon(std::shared_ptr<QRVServices> services, Options options);
 
-  // Schedules start-up and opens the listener. Returns false when the
-  // listener could not be created (the daemon then runs without serving).
-  bool start();
+  enum class StartResult {
+    kServing,
+    // The listener could not be created; the daemon runs without serving.
+    kNotListening,
+    // Another daemon holds the root: nothing was started, nothing touched.
+    kRootInUse,
+  };
+
+  // Claims the root, then schedules start-up and opens the listener. The
+  // claim comes first so that a second daemon on a root neither creates
+  // anything nor takes connections (not even on a socket handed over by
+  // systemd) from the one already serving it.
+  StartResult start();
 
   // The steps of start-up and the callbacks it installs.
   void quorvad_init();

@@ -57,15 +57,31 @@ void QRVTestLocks::_stateQueue_changeCount(uint64_t lock, int64_t delta) {
   lockCount_[lock] = to;
 }
 
+uint64_t QRVTestLocks::_stateQueue_conflictingLock(uint64_t lock) const {
+  if (lock == kGlobalReadLock && lockCount_[kGlobalWriteLock] > 0) return kGlobalWriteLock;
+  if (lock == kGlobalWriteLock && lockCount_[kGlobalReadLock] > 0) return kGlobalReadLock;
+  return kLockCount;
+}
+
 bool QRVTestLocks::acquireLock(uint64_t lock) {
   if (lock >= kLockCount) {
     QRVLogError("No test lock {}", lock);
     return false;
   }
+  uint64_t conflict = kLockCount;
   stateQueue_->sync([&] {
+    // Locks 0 and 1 are the same all-identifiers lock taken two ways, and
+    // we would be waiting for ourselves: the state queue would block for
+    // good, and every later request with it.
+    conflict = _stateQueue_conflictingLock(lock);
+    if (conflict != kLockCount) return;
     _stateQueue_changeCount(lock, +1);
     QRVLogNotice("Acquired test lock: {}; count: {}", lock, lockCount_[lock]);
   });
+  if (conflict != kLockCount) {
+    QRVLogError("Refusing test lock {}: test lock {} already holds the all-identifiers lock", lock, conflict);
+    return false;
+  }
   return true;
 }
 
@@ -131,7 +147,12 @@ bool QRVTestLocks::setLockFromCommand(uint64_t lock, bool enable, QRVError* erro
       heldByCommand_.set(lock);
     }
     setEnabled(true);
-    acquireLock(lock);
+    if (!acquireLock(lock)) {
+      QRVMutexLock guard(&commandMutex_);
+      heldByCommand_.reset(lock);
+      return QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidInput,
+                                      "Test lock {} conflicts with the all-identifiers lock already held", lock));
+    }
     return true;
   }
   bool noneLeft;

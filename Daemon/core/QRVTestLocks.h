@@ -42,7 +42,9 @@ class QRVTestLocks {
   bool enabled() const { return enabled_.load(); }
 
   // `lock` must be below kLockCount; other numbers are refused (logged,
-  // false). Releasing more often than acquiring ends the process.
+  // false). So is lock 0 while lock 1 is held, or 1 while 0 is: both are
+  // the all-identifiers lock, which the state queue would wait on forever.
+  // Releasing more often than acquiring ends the process.
   bool acquireLock(uint64_t lock);
   bool releaseLock(uint64_t lock);
   void releaseAllLocks();
@@ -56,7 +58,8 @@ class QRVTestLocks {
   // it; disabling a held one unmarks it (0 and 1 together, as they are one
   // lock underneath), releases it, and disables the feature when nothing is
   // marked any more. Lock 6 with `enable` false disables the feature and
-  // releases everything. Any other number of 6 or more is error 38.
+  // releases everything. Any other number of 6 or more is error 38, and so
+  // is enabling 0 while 1 is held or 1 while 0 is.
   bool setLockFromCommand(uint64_t lock, bool enable, QRVError* error);
 
   int64_t TEST_lockCount(uint64_t lock);
@@ -73,6 +76,9 @@ class QRVTestLocks {
   void _stateQueue_changeCount(uint64_t lock, int64_t delta);
   void _stateQueue_acquire(uint64_t lock);
   void _stateQueue_release(uint64_t lock);
+  // The other of locks 0 and 1 when it is held and `lock` is its partner;
+  // kLockCount otherwise.
+  uint64_t _stateQueue_conflictingLock(uint64_t lock) const;
 
   const std::shared_ptr<QRVSerialQueue> stateQueue_;
   std::array<std::shared_ptr<BlockingPoint>, kLockCount> points_;  // null for 0 and 1

@@ -2,6 +2,7 @@
 // state that a test sets and inspects; none restates the real logic.
 #pragma once
 
+#include <cerrno>
 #include <map>
 #include <mutex>
 #include <string>
@@ -11,6 +12,7 @@
 #include "platform/QRVApplicationTermination.h"
 #include "platform/QRVFeatureFlags.h"
 #include "platform/QRVFirstBootMarker.h"
+#include "platform/QRVInstanceLock.h"
 #include "platform/QRVLockStateService.h"
 #include "platform/QRVNotificationService.h"
 #include "platform/QRVPersonaService.h"
@@ -100,6 +102,22 @@ class QRVFakeFirstBootMarker : public QRVFirstBootMarker {
 
  private:
   std::string name_ = "quorvad.fb_check";
+};
+
+// A claim that is either free or held by "another daemon".
+class QRVFakeInstanceLock : public QRVInstanceLock {
+ public:
+  bool heldElsewhere = false;
+  bool held = false;
+  const std::string& path() const override { return path_; }
+  bool acquire(QRVError* error) override {
+    if (heldElsewhere) return QRVFail(error, QRV_POSIX_ERROR_QUIET(EWOULDBLOCK, "held by another daemon"));
+    held = true;
+    return true;
+  }
+
+ private:
+  std::string path_ = "quorvad.lock";
 };
 
 class QRVFakeSystemInfo : public QRVSystemInfo {

@@ -1,6 +1,7 @@
 #include "platform/linux/QRVLinuxMessageService.h"
 
 #include <fcntl.h>
+#include <malloc.h>
 #include <poll.h>
 #include <sys/epoll.h>
 #include <sys/eventfd.h>
@@ -11,6 +12,7 @@
 #include <systemd/sd-daemon.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstring>
 #include <filesystem>
@@ -24,6 +26,9 @@ namespace {
 constexpr uint64_t kListenerTag = 0;
 constexpr uint64_t kWakeTag = UINT64_MAX;
 constexpr size_t kReadChunk = 64 * 1024;
+// A connection keeps buffers up to this size between frames; a larger one
+// (left by a multi-megabyte request or reply) is given back after its frame.
+constexpr size_t kKeptBufferCapacity = 256 * 1024;
 
 int64_t nowMillis() {
   return std::chrono::duration_cast<std::chrono::milliseconds>(
@@ -42,6 +47,12 @@ class QRVLinuxMessageService::Connection : public QRVConnection {
   ~Connection() override {
     if (fd_ >= 0) ::close(fd_);
     if (pidfd_ >= 0) ::close(pidfd_);
+    // A peer that left in the middle of a large frame: give its buffer back
+    // to the system too (see process()).
+    if (in_.capacity() > kKeptBufferCapacity) {
+      std::vector<uint8_t>().swap(in_);
+      malloc_trim(0);
+    }
   }
 
   pid_t pid() const override { return cred_.pid; }
@@ -119,6 +130,17 @@ class QRVLinuxMessageService::Connection : public QRVConnection {
       if (message) {
         lock.unlock();
         deliver(handler, std::move(*message));
+        // The request's buffer and everything its handler built from it are
+        // free now, but the allocator keeps freed memory in its arenas (one
+        // per worker) unless told: without this a burst of large requests
+        // leaves the daemon at hundreds of megabytes for good.
+        if (largeFrameSeen_) {
+          largeFrameSeen_ = false;
+          malloc_trim(0);
+        }
+        // Bytes of the next frame that came with this one waited for the
+        // handler; their time starts now.
+        if (in_.size() > inOffset_) frameStarted_ = nowMillis();
         lock.lock();
         if (closed_) break;
         continue;
@@ -136,15 +158,25 @@ class QRVLinuxMessageService::Connection : public QRVConnection {
       }
       if (wouldBlock) break;
     }
+    partialFrameSince_ = in_.size() > inOffset_ ? frameStarted_ : 0;
     releaseWorkerLocked();
     if (!closed_) rearmLocked();
   }
 
-  // True when its replies have not moved for longer than `timeout`.
-  void closeIfStalled(int64_t now, int64_t timeoutMillis) {
+  // Closes the connection when its replies have not moved for longer than
+  // the write timeout, or when it left a frame unfinished for longer than
+  // the read timeout. While a worker owns the connection, or replies wait,
+  // the daemon is not reading, so an unfinished frame is not the peer's
+  // fault then.
+  void closeIfStalled(int64_t now, int64_t writeTimeoutMillis, int64_t readTimeoutMillis) {
     QRVMutexLock lock(&mutex_);
-    if (!closed_ && pendingOutput() > 0 && now - lastProgress_ > timeoutMillis)
-      closeLocked("client is not reading its replies");
+    if (closed_) return;
+    if (pendingOutput() > 0) {
+      if (now - lastProgress_ > writeTimeoutMillis) closeLocked("client is not reading its replies");
+      return;
+    }
+    if (!busy_ && partialFrameSince_ != 0 && now - partialFrameSince_ > readTimeoutMillis)
+      closeLocked(fmt::format("client left a frame unfinished for more than {} ms", readTimeoutMillis));
   }
 
  private:
@@ -163,9 +195,11 @@ class QRVLinuxMessageService::Connection : public QRVConnection {
     if (in_.size() - inOffset_ < QRVWireFrame::kHeaderSize + h.length) return std::nullopt;
     auto body = QRVWireFrame::decodeBody(in_.data() + inOffset_ + QRVWireFrame::kHeaderSize, h.length);
     inOffset_ += QRVWireFrame::kHeaderSize + h.length;
+    if (h.length >= kKeptBufferCapacity) largeFrameSeen_ = true;
     if (inOffset_ == in_.size()) {
       in_.clear();
       inOffset_ = 0;
+      if (in_.capacity() > kKeptBufferCapacity) std::vector<uint8_t>().swap(in_);
     }
     if (!body) {
       *problem = "message body is not a dictionary";
@@ -186,6 +220,8 @@ class QRVLinuxMessageService::Connection : public QRVConnection {
       in_.erase(in_.begin(), in_.begin() + static_cast<ptrdiff_t>(inOffset_));
       inOffset_ = 0;
     }
+    // The first bytes after a complete frame start the next one.
+    if (in_.empty()) frameStarted_ = nowMillis();
     size_t old = in_.size();
     in_.resize(old + kReadChunk);
     ssize_t n;
@@ -233,6 +269,7 @@ class QRVLinuxMessageService::Connection : public QRVConnection {
     }
     out_.clear();
     outOffset_ = 0;
+    if (out_.capacity() > kKeptBufferCapacity) std::vector<uint8_t>().swap(out_);
     return true;
   }
 
@@ -294,11 +331,16 @@ class QRVLinuxMessageService::Connection : public QRVConnection {
   std::vector<uint8_t> out_ GUARDED_BY(mutex_);
   size_t outOffset_ GUARDED_BY(mutex_) = 0;
   int64_t lastProgress_ GUARDED_BY(mutex_) = 0;
+  // When the frame left unfinished in in_ began (0: none), published by the
+  // owning worker for the sweep.
+  int64_t partialFrameSince_ GUARDED_BY(mutex_) = 0;
 
   // Owned by the worker that holds busy_.
   std::vector<uint8_t> in_;
   size_t inOffset_ = 0;
   bool peerEOF_ = false;
+  int64_t frameStarted_ = 0;
+  bool largeFrameSeen_ = false;
 };
 
 QRVLinuxMessageService::QRVLinuxMessageService(Options options) : options_(std::move(options)) {}
@@ -388,9 +430,13 @@ bool QRVLinuxMessageService::listen(const std::string& name, std::shared_ptr<QRV
 }
 
 void QRVLinuxMessageService::workerLoop() {
+  // Often enough that no stall outlives its timeout by much more than a
+  // quarter of it; never more than once a second is needed for the defaults.
+  const int64_t sweepInterval = std::clamp<int64_t>(
+      std::min(options_.writeStallTimeout.count(), options_.readStallTimeout.count()) / 4, 50, 1000);
   epoll_event events[16];
   while (!stopping_) {
-    int n = epoll_wait(epollFd_, events, 16, 1000);
+    int n = epoll_wait(epollFd_, events, 16, static_cast<int>(sweepInterval));
     if (stopping_) return;
     for (int i = 0; i < n; i++) {
       uint64_t tag = events[i].data.u64;
@@ -405,7 +451,7 @@ void QRVLinuxMessageService::workerLoop() {
     }
     int64_t now = nowMillis();
     int64_t last = lastSweep_.load();
-    if (now - last >= 1000 && lastSweep_.compare_exchange_strong(last, now)) sweepStalledConnections();
+    if (now - last >= sweepInterval && lastSweep_.compare_exchange_strong(last, now)) sweepStalledConnections();
   }
 }
 
@@ -426,6 +472,14 @@ void QRVLinuxMessageService::acceptPending() {
     if (getsockopt(fd, SOL_SOCKET, SO_PEERCRED, &cred, &len) != 0) {
       QRVLogError("cannot read peer credentials: {}", strerror(errno));
       ::close(fd);
+      continue;
+    }
+    // At the bound the connection is taken off the backlog and closed: the
+    // peer learns at once, instead of waiting in the backlog while its
+    // slot is held by others.
+    if (openConnections() >= options_.maxConnections) {
+      ::close(fd);
+      refuseAtBound(cred);
       continue;
     }
     // The pidfd pins the peer's identity: if the process is gone by the time
@@ -453,6 +507,18 @@ void QRVLinuxMessageService::acceptPending() {
   epoll_ctl(epollFd_, EPOLL_CTL_MOD, listenFd_, &ev);
 }
 
+void QRVLinuxMessageService::refuseAtBound(const ucred& cred) {
+  refusedSinceLog_++;
+  int64_t now = nowMillis();
+  if (lastRefusalLog_ != 0 && now - lastRefusalLog_ < 1000) return;
+  QRVLogError(
+      "refusing connection from pid {} (uid {}): the limit of {} open connections is reached ({} refused "
+      "since the last report)",
+      cred.pid, cred.uid, options_.maxConnections, refusedSinceLog_);
+  lastRefusalLog_ = now;
+  refusedSinceLog_ = 0;
+}
+
 void QRVLinuxMessageService::handleConnectionEvent(uint64_t id, uint32_t events) {
   if (std::shared_ptr<Connection> c = find(id)) c->process(events);
 }
@@ -464,7 +530,7 @@ void QRVLinuxMessageService::sweepStalledConnections() {
     for (auto& [id, c] : connections_) all.push_back(c);
   }
   int64_t now = nowMillis();
-  for (auto& c : all) c->closeIfStalled(now, options_.writeStallTimeout.count());
+  for (auto& c : all) c->closeIfStalled(now, options_.writeStallTimeout.count(), options_.readStallTimeout.count());
 }
 
 void QRVLinuxMessageService::forget(uint64_t id) {

@@ -6,9 +6,16 @@
 // thread and writes the reply, with no hand-off between threads on the
 // request path. A connection whose replies are not being read stops being
 // read from (its requests wait in the kernel) and is closed when it makes no
-// progress for `writeStallTimeout`. Any frame that breaks the protocol closes
-// only its own connection.
+// progress for `writeStallTimeout`. A client that starts a frame must finish
+// it within `readStallTimeout`, or it is closed: a peer trickling bytes would
+// otherwise hold its connection (and its buffer) for ever. A connection that
+// sits idle between frames is not timed out (clients keep one connection for
+// their whole life); what bounds those is `maxConnections`, beyond which new
+// connections are accepted and closed at once. Any frame that breaks the
+// protocol closes only its own connection.
 #pragma once
+
+#include <sys/socket.h>
 
 #include <atomic>
 #include <chrono>
@@ -28,6 +35,10 @@ class QRVLinuxMessageService : public QRVMessageService {
     std::string socketPath;
     size_t workerThreads = 4;
     std::chrono::milliseconds writeStallTimeout{30'000};
+    // How long a frame may take from its first byte to its last.
+    std::chrono::milliseconds readStallTimeout{30'000};
+    // Open connections beyond which new ones are refused.
+    size_t maxConnections = 256;
   };
 
   explicit QRVLinuxMessageService(Options options);
@@ -48,6 +59,7 @@ class QRVLinuxMessageService : public QRVMessageService {
   bool openListeningSocket(const std::string& name, QRVError* error);
   void workerLoop();
   void acceptPending();
+  void refuseAtBound(const ucred& cred);
   void handleConnectionEvent(uint64_t id, uint32_t events);
   void sweepStalledConnections();
   void forget(uint64_t id);
@@ -67,5 +79,8 @@ class QRVLinuxMessageService : public QRVMessageService {
   std::atomic<long> transactions_{0};
   std::atomic<bool> stopping_{false};
   std::atomic<int64_t> lastSweep_{0};
+  // Refusals at the connection bound are logged at most once a second.
+  int64_t lastRefusalLog_ = 0;    // listener queue only
+  uint64_t refusedSinceLog_ = 0;  // listener queue only
   std::vector<std::thread> workers_;
 };

@@ -1,3 +1,5 @@
+#include <malloc.h>
+
 #include "platform/QRVPlatform.h"
 #include "platform/linux/QRVLinuxAccounts.h"
 #include "platform/linux/QRVLinuxApplicationTermination.h"
@@ -5,6 +7,7 @@
 #include "platform/linux/QRVLinuxFileSystem.h"
 #include "platform/linux/QRVLinuxFileSystemExtras.h"
 #include "platform/linux/QRVLinuxFirstBootMarker.h"
+#include "platform/linux/QRVLinuxInstanceLock.h"
 #include "platform/linux/QRVLinuxLockStateService.h"
 #include "platform/linux/QRVLinuxMessageService.h"
 #include "platform/linux/QRVLinuxNotificationService.h"
@@ -14,14 +17,27 @@
 #include "platform/linux/QRVLinuxTrustStore.h"
 
 QRVPlatform QRVPlatform::makeLinux(const std::string& root, const LinuxOptions& linuxOptions) {
+  // Requests may carry multi-megabyte strings. By default the allocator
+  // raises its mmap threshold to the size of the largest block freed so far
+  // (and its trim threshold to twice that), after which such blocks come
+  // from the per-thread arenas, whose tops are kept however much lies free:
+  // a single burst of large requests left the daemon at over 60 MB for good.
+  // Fixed thresholds keep large blocks in their own mappings, which go back
+  // to the system when freed.
+  mallopt(M_MMAP_THRESHOLD, 256 * 1024);
+  mallopt(M_TRIM_THRESHOLD, 1024 * 1024);
+
   std::string r = root;
   while (r.size() > 1 && r.back() == '/') r.pop_back();
   auto under = [&](const std::string& path) { return r == "/" ? path : r + path; };
 
   QRVPlatform p;
+  p.instanceLock = std::make_shared<QRVLinuxInstanceLock>(under("/run/quorvad/quorvad.lock"));
   QRVLinuxMessageService::Options options;
   options.socketPath = under("/run/quorvad/com.kelva.quorvad");
   options.writeStallTimeout = linuxOptions.writeStallTimeout;
+  options.readStallTimeout = linuxOptions.readStallTimeout;
+  options.maxConnections = linuxOptions.maxConnections;
   p.messages = std::make_shared<QRVLinuxMessageService>(options);
   p.trustStore = std::make_shared<QRVLinuxTrustStore>(under("/etc/quorva/clients.d"));
   QRVLinuxSandbox::Options sandboxOptions;

@@ -53,6 +53,7 @@ struct QRVTestServices {
   std::shared_ptr<QRVFakeLockStateService> lockState = std::make_shared<QRVFakeLockStateService>();
   std::shared_ptr<QRVFakeNotificationService> notifications = std::make_shared<QRVFakeNotificationService>();
   std::shared_ptr<QRVFakeFirstBootMarker> firstBootMarker = std::make_shared<QRVFakeFirstBootMarker>();
+  std::shared_ptr<QRVFakeInstanceLock> instanceLock = std::make_shared<QRVFakeInstanceLock>();
   std::shared_ptr<QRVFakeSystemInfo> systemInfo = std::make_shared<QRVFakeSystemInfo>();
   std::shared_ptr<QRVFakeAccounts> accounts = std::make_shared<QRVFakeAccounts>();
   std::shared_ptr<QRVFakeFeatureFlags> featureFlags = std::make_shared<QRVFakeFeatureFlags>();
@@ -77,6 +78,7 @@ struct QRVTestServices {
     p.lockState = lockState;
     p.notifications = notifications;
     p.firstBootMarker = firstBootMarker;
+    p.instanceLock = instanceLock;
     p.systemInfo = systemInfo;
     p.accounts = accounts;
     p.featureFlags = featureFlags;

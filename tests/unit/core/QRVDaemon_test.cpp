@@ -113,4 +113,25 @@ TEST_F(DaemonTest, KeepAliveCoversAsynchronousJobs) {
   EXPECT_TRUE(QRVEventually([&] { return env_.messages->isIdle(); }));
 }
 
+TEST_F(DaemonTest, RootHeldByAnotherDaemonStopsStartBeforeAnythingRuns) {
+  env_.instanceLock->heldElsewhere = true;
+  QRVDaemon daemon(env_.services, QRVDaemon::Options{});
+  EXPECT_EQ(daemon.start(), QRVDaemon::StartResult::kRootInUse);
+  // Start-up was not even scheduled: it would have opened a transaction and
+  // posted the cleanup notification.
+  daemon.listenerQueue()->sync([] {});
+  EXPECT_EQ(env_.messages->transactions, 0);
+  EXPECT_TRUE(env_.notifications->posted().empty());
+  EXPECT_FALSE(env_.firstBootMarker->present);
+}
+
+TEST_F(DaemonTest, FreeRootIsClaimedBeforeServing) {
+  QRVDaemon daemon(env_.services, QRVDaemon::Options{});
+  EXPECT_EQ(daemon.start(), QRVDaemon::StartResult::kServing);
+  EXPECT_TRUE(env_.instanceLock->held);
+  // Let start-up and its cleanups finish before the daemon goes away.
+  EXPECT_TRUE(QRVEventually([&] { return env_.notifications->posted().size() >= 2; }));
+  EXPECT_TRUE(QRVEventually([&] { return env_.messages->isIdle(); }));
+}
+
 }  // namespace

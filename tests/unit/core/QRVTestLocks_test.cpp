@@ -90,6 +90,29 @@ TEST(QRVTestLocksTest, LocksZeroAndOneHoldTheAllIdentifiersLock) {
   EXPECT_EQ(globalState(), 0);
 }
 
+// Taking the all-identifiers lock the other way while the test locks hold it
+// would wait for ourselves on the state queue. The call runs on a thread of
+// its own so that a regression fails the test instead of hanging it (the
+// thread then keeps the wedged object, whose destructor would wait too).
+TEST(QRVTestLocksTest, TheOtherGlobalLockIsRefusedWhileOneIsHeld) {
+  auto shared = std::make_shared<QRVTestLocks>();
+  QRVTestLocks& locks = *shared;
+  for (auto [held, other] : {std::pair{QRVTestLocks::kGlobalWriteLock, QRVTestLocks::kGlobalReadLock},
+                             std::pair{QRVTestLocks::kGlobalReadLock, QRVTestLocks::kGlobalWriteLock}}) {
+    SCOPED_TRACE(testing::Message() << "held " << held << ", then " << other);
+    ASSERT_TRUE(locks.acquireLock(held));
+    auto result = std::make_shared<std::atomic<int>>(-1);
+    std::thread([shared, result, other = other] { *result = shared->acquireLock(other) ? 1 : 0; }).detach();
+    ASSERT_TRUE(QRVEventually([&] { return *result != -1; })) << "acquiring the other global lock blocked";
+    EXPECT_EQ(*result, 0);
+    // The state queue still answers, and nothing was counted.
+    EXPECT_EQ(locks.TEST_lockCount(other), 0);
+    EXPECT_EQ(locks.TEST_lockCount(held), 1);
+    EXPECT_TRUE(locks.releaseLock(held));
+    EXPECT_EQ(globalState(), 0);
+  }
+}
+
 TEST(QRVTestLocksTest, DisablingOrDestroyingReleasesEverything) {
   {
     QRVTestLocks locks;
@@ -171,6 +194,23 @@ TEST_F(SetTestLockCommandTest, EachLockIsHeldOnceAndTheLastDisableOrLockSixTurns
   // The marks went with it: enabling again takes the lock again.
   EXPECT_EQ(send(3, true), 1u);
   EXPECT_EQ(locks().TEST_lockCount(3), 1);
+
+  EXPECT_EQ(send(6, false), 1u);
+
+  // Enabling one global lock while the other is held is refused, and the
+  // command keeps answering afterwards.
+  EXPECT_EQ(send(1, true), 1u);
+  EXPECT_EQ(send(0, true), 38u);
+  EXPECT_EQ(globalState(), -1);
+  EXPECT_EQ(send(2, true), 1u);
+  EXPECT_EQ(send(1, false), 1u);
+  EXPECT_EQ(globalState(), 0);
+  EXPECT_EQ(send(0, true), 1u);  // the refusal left no mark behind
+  EXPECT_EQ(send(1, true), 38u);
+  EXPECT_EQ(globalState(), 1);
+  EXPECT_EQ(send(6, false), 1u);
+  EXPECT_EQ(globalState(), 0);
+  EXPECT_EQ(send(3, true), 1u);
 
   // Not an internal build: the command answers success and changes nothing.
   env_.services->globalConfiguration->setIsInternalImage(false);
