@@ -98,10 +98,11 @@ class QRVFileManager {
   bool itemDoesNotExistAtURL(const std::string& url);
   // True when `url` itself (not a link to one) is a directory.
   bool directoryExistsAtURL(const std::string& url);
-  // Gives the directory `url` to uid:gid with `mode`, through a descriptor
+  // Give the directory `url` to uid:gid, or `mode`, through a descriptor
   // opened without following links, so that a link put in its place in the
   // meantime is refused (ELOOP/ENOTDIR) instead of followed.
-  bool setOwnerAndModeOfDirectoryAtURL(const std::string& url, uid_t uid, gid_t gid, mode_t mode, QRVError* error);
+  bool setOwnerOfDirectoryAtURL(const std::string& url, uid_t uid, gid_t gid, QRVError* error);
+  bool setModeOfDirectoryAtURL(const std::string& url, mode_t mode, QRVError* error);
 
   // ---- Listing and traversal ----
 

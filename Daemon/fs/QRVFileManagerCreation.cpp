@@ -154,19 +154,24 @@ std::optional<std::string> QRVFileManager::createTemporaryDirectoryInDirectoryUR
 
 // ---- Ownership ----
 
-bool QRVFileManager::setOwnerAndModeOfDirectoryAtURL(const std::string& url, uid_t uid, gid_t gid, mode_t mode,
-                                                     QRVError* error) {
+bool QRVFileManager::setOwnerOfDirectoryAtURL(const std::string& url, uid_t uid, gid_t gid, QRVError* error) {
   int fd = -1;
   if (int e = _openDirectoryNoFollow(AT_FDCWD, url, &fd))
     return QRVFail(error, QRV_POSIX_ERROR(e, "open of {} failed: {}", url, errnoText(e)));
-  bool ok = true;
-  if (int e = files_->changeOwnerOfFD(fd, uid, gid)) {
-    ok = QRVFail(error, QRV_POSIX_ERROR(e, "Failed to chown({},{}) {}: {}", uid, gid, url, errnoText(e)));
-  } else if (int modeError = files_->changeModeOfFD(fd, mode)) {
-    ok = QRVFail(error, QRV_POSIX_ERROR(modeError, "Failed to chmod({:o}) {}: {}", mode, url, errnoText(modeError)));
-  }
+  int e = files_->changeOwnerOfFD(fd, uid, gid);
   _close(fd);
-  return ok;
+  if (e) return QRVFail(error, QRV_POSIX_ERROR(e, "Failed to chown({},{}) {}: {}", uid, gid, url, errnoText(e)));
+  return true;
+}
+
+bool QRVFileManager::setModeOfDirectoryAtURL(const std::string& url, mode_t mode, QRVError* error) {
+  int fd = -1;
+  if (int e = _openDirectoryNoFollow(AT_FDCWD, url, &fd))
+    return QRVFail(error, QRV_POSIX_ERROR(e, "open of {} failed: {}", url, errnoText(e)));
+  int e = files_->changeModeOfFD(fd, mode);
+  _close(fd);
+  if (e) return QRVFail(error, QRV_POSIX_ERROR(e, "Failed to chmod({:o}) {}: {}", mode, url, errnoText(e)));
+  return true;
 }
 
 // Directories and anything executable get 0755, everything else 0644. Links

@@ -201,9 +201,15 @@ std::optional<std::string> QRVClientConnection::userManagedAssetsPathWithContain
     const uid_t uid = metadata->userIdentity()->posixUIDForContainerClass(c);
     const gid_t gid = metadata->userIdentity()->posixGIDForContainerClass(c);
     QRVError failure;
-    if (!fm.setOwnerAndModeOfDirectoryAtURL(*dir, uid, gid, 0755, &step))
+    if (!fm.setOwnerOfDirectoryAtURL(*dir, uid, gid, &step)) {
       failure = QRV_ERROR_UNDERLYING(QRVResultCode::kSubdirectoryNotCreated, step,
-                                     "Failed to set up user managed assets dir at {}", *dir);
+                                     "Failed to chown user managed assets dir at {}: {}", *dir,
+                                     strerror(static_cast<int>(step.code())));
+    } else if (!fm.setModeOfDirectoryAtURL(*dir, 0755, &step)) {
+      failure = QRV_ERROR_UNDERLYING(QRVResultCode::kSubdirectoryNotCreated, step,
+                                     "Failed to chmod user managed assets dir at {}: {}", *dir,
+                                     strerror(static_cast<int>(step.code())));
+    }
     QRVMetadataRef updated;
     if (failure.code() == 0) {
       updated = metadata->withUserManagedAssetsDirName(QRVLastPathComponent(*dir));

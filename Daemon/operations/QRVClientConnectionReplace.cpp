@@ -258,7 +258,7 @@ bool QRVClientConnection::_recoverFromReplaceOperationsWithError(QRVError* error
       const std::string& oldURL = journal->stringForKey(kOldURLKey);
       const std::string& staging = journal->stringForKey(kStagingURLKey);
       const std::string& dest = journal->stringForKey(kDestURLKey);
-      QRVLogDebug("Doing a replace of {} with info: {}", oldURL, journalURL);
+      QRVLogDebug("Doing a replace of {} with info: {}", journalURL, journal->description());
       // The old directory in place: the swap never started. The new one at
       // the destination: it finished, and the parked directory is left for
       // the next cleanup. Neither: the old directory is parked; put it back.

@@ -7,8 +7,10 @@
 #include <chrono>
 #include <filesystem>
 #include <fstream>
+#include <sstream>
 #include <thread>
 
+#include "base/QRVLog.h"
 #include "model/QRVContainerCache.h"
 #include "operations/QRVClientConnection.h"
 #include "support/QRVContainerTest.h"
@@ -239,6 +241,33 @@ TEST_F(AssetDeletionTest, FailuresAndAnAssetsDirectorySwappedForALink) {
   fs::create_symlink("Documents", assets_);
   EXPECT_EQ(remove("precious"), 10u);
   EXPECT_TRUE(fs::exists(container_->url() + "/Documents/precious"));
+}
+
+TEST_F(ContentsTest, AnAssetsDirectoryThatCannotBeSetUpSaysWhichStepFailedAndLeavesNothing) {
+  using Op = QRVFaultInjectionFileSystem::Operation;
+  const std::string logPath = env_.root.path() + "/assets.log";
+  ASSERT_TRUE(QRVLog::open("test", logPath, QRVLogLevel::kNotice, 2, 1 << 20));
+  auto app = identity("com.example.app");
+  auto container = create(app);
+  ASSERT_NE(container, nullptr);
+  for (Op op : {Op::kChangeOwner, Op::kChangeMode}) {
+    env_.posixFileSystem->failNext(op, EPERM, "com.kelva.UserManagedAssets.");
+    EXPECT_FALSE(assets(app, false, true));
+    EXPECT_EQ(error_.code(), 6u);
+    // The half-made directory is gone, and nothing names it.
+    for (const auto& entry : fs::directory_iterator(container->url()))
+      EXPECT_EQ(entry.path().filename().string().rfind("com.kelva.UserManagedAssets.", 0), std::string::npos)
+          << entry.path();
+  }
+  QRVLog::close();
+  std::stringstream log;
+  log << std::ifstream(logPath).rdbuf();
+  for (const char* step :
+       {"Failed to chown user managed assets dir at ", "Failed to chmod user managed assets dir at "})
+    EXPECT_NE(log.str().find(step), std::string::npos) << step;
+  EXPECT_NE(log.str().find(": Operation not permitted"), std::string::npos) << log.str();
+  // Without faults the directory is made.
+  EXPECT_TRUE(assets(app, false, true)) << error_.description();
 }
 
 TEST_F(ContentsTest, DataContainersAreMeasuredEveryTimeBundlesOnce) {

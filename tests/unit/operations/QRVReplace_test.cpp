@@ -7,6 +7,7 @@
 #include <fstream>
 #include <future>
 
+#include "base/QRVLog.h"
 #include "core/QRVDeleteHandlers.h"
 #include "fs/QRVDictionaryAdditions.h"
 #include "model/QRVContainerCache.h"
@@ -161,9 +162,16 @@ TEST_F(RecoveryTest, EachOfTheFourStatesEndsWithOneContainerInPlace) {
 TEST_F(RecoveryTest, BootSetUpRunsTheRecoveryAndNoReplaceDirectoryIsNothingToDo) {
   marked(staging_, "old");
   writeJournal();
+  const std::string logPath = env_.root.path() + "/recovery.log";
+  ASSERT_TRUE(QRVLog::open("test", logPath, QRVLogLevel::kDebug, 2, 1 << 20));
   admin()->quorvaSetup();
+  QRVLog::close();
   EXPECT_EQ(QRVReadText(oldURL_ + "/mark"), "old");
   EXPECT_EQ(QRVEntriesIn(replaceDir()), 0u);
+  // The log shows what the journal said, not only where it was.
+  const std::string log = QRVReadText(logPath);
+  EXPECT_NE(log.find("Doing a replace of " + replaceDir() + "/j.plist with info: "), std::string::npos) << log;
+  EXPECT_NE(log.find(staging_, log.find("with info: ")), std::string::npos) << log;
 
   fs::remove_all(replaceDir());
   QRVError error;
