@@ -1,18 +1,19 @@
 // Daemon services on a temporary root with fake platform services.
 #pragma once
 
+#include <unistd.h>
+
 #include <atomic>
 #include <cstdlib>
 #include <filesystem>
+#include <functional>
 #include <memory>
 #include <string>
 
-#include <unistd.h>
-
 #include "core/QRVServices.h"
 #include "platform/fake/QRVFakeFileSystemExtras.h"
-#include "platform/fake/QRVFaultInjectionFileSystem.h"
 #include "platform/fake/QRVFakePlatform.h"
+#include "platform/fake/QRVFaultInjectionFileSystem.h"
 #include "platform/linux/QRVLinuxFileSystem.h"
 #include "platform/linux/QRVLinuxFileSystemExtras.h"
 
@@ -33,12 +34,16 @@ class QRVTemporaryDirectory {
 };
 
 // A message service that serves nothing: for tests that drive the daemon's
-// objects directly.
+// objects directly. `onListen`, when set, sees the listener's queue and
+// handler, so a test can deliver connections the way the service would.
 class QRVNullMessageService : public QRVMessageService {
  public:
-  bool listen(const std::string&, std::shared_ptr<QRVSerialQueue>, ConnectionHandler, QRVError*) override {
+  bool listen(const std::string&, std::shared_ptr<QRVSerialQueue> queue, ConnectionHandler handler,
+              QRVError*) override {
+    if (onListen) onListen(std::move(queue), std::move(handler));
     return true;
   }
+  std::function<void(std::shared_ptr<QRVSerialQueue>, ConnectionHandler)> onListen;
   void beginTransaction() override { transactions++; }
   void endTransaction() override { transactions--; }
   bool isIdle() const override { return transactions == 0; }

@@ -2,11 +2,13 @@
 
 #include <gtest/gtest.h>
 
+#include <atomic>
 #include <chrono>
 #include <thread>
 
 #include "base/QRVLog.h"
 #include "support/QRVEventually.h"
+#include "support/QRVTestConnection.h"
 #include "support/QRVTestServices.h"
 
 namespace {
@@ -130,6 +132,25 @@ TEST_F(DaemonTest, FreeRootIsClaimedBeforeServing) {
   EXPECT_EQ(daemon.start(), QRVDaemon::StartResult::kServing);
   EXPECT_TRUE(env_.instanceLock->held);
   // Let start-up and its cleanups finish before the daemon goes away.
+  EXPECT_TRUE(QRVEventually([&] { return env_.notifications->posted().size() >= 2; }));
+  EXPECT_TRUE(QRVEventually([&] { return env_.messages->isIdle(); }));
+}
+
+TEST_F(DaemonTest, AConnectionArrivingDuringStartUpIsHandledAfterIt) {
+  // A client that connects the moment the listener opens: the service hands
+  // it to the listener queue, behind start-up.
+  std::atomic<bool> handled{false}, startedFirst{false};
+  env_.messages->onListen = [&](std::shared_ptr<QRVSerialQueue> queue, QRVMessageService::ConnectionHandler handler) {
+    queue->async([&, handler] {
+      startedFirst = env_.firstBootMarker->present;  // start-up's first-boot work marks the boot
+      handler(std::make_shared<QRVTestConnection>(42));
+      handled = true;
+    });
+  };
+  QRVDaemon daemon(env_.services, QRVDaemon::Options{});
+  ASSERT_EQ(daemon.start(), QRVDaemon::StartResult::kServing);
+  ASSERT_TRUE(QRVEventually([&] { return handled.load(); }));
+  EXPECT_TRUE(startedFirst);
   EXPECT_TRUE(QRVEventually([&] { return env_.notifications->posted().size() >= 2; }));
   EXPECT_TRUE(QRVEventually([&] { return env_.messages->isIdle(); }));
 }
