@@ -142,7 +142,8 @@ TEST_F(DaemonTest, AConnectionArrivingDuringStartUpIsHandledAfterIt) {
   std::atomic<bool> handled{false}, startedFirst{false};
   env_.messages->onListen = [&](std::shared_ptr<QRVSerialQueue> queue, QRVMessageService::ConnectionHandler handler) {
     queue->async([&, handler] {
-      startedFirst = env_.firstBootMarker->present;  // start-up's first-boot work marks the boot
+      // Start-up's last synchronous step subscribes to lock-state changes.
+      startedFirst = static_cast<bool>(env_.lockState->onChange);
       handler(std::make_shared<QRVTestConnection>(42));
       handled = true;
     });
