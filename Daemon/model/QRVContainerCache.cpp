@@ -14,8 +14,8 @@ namespace {
 
 const char* transientSuffix(bool transient) { return transient ? "(transient)" : ""; }
 
-std::string shortDescription(const QRVUserIdentityRef& u) { return u ? u->shortDescription() : "(null)"; }
-std::string identifierOf(const QRVUserIdentityRef& u) { return u ? u->identifier() : "(null)"; }
+// A user identity in a log line is written out in full.
+std::string describe(const QRVUserIdentityRef& u) { return u ? u->description() : "(null)"; }
 
 const char* classDirectory(QRVContainerClass c) {
   const char* directory = QRVContainerClassRelativeDirectory(c);
@@ -96,7 +96,7 @@ QRVContainerCache::ClassMap* QRVContainerCache::_lock_getCacheForUserIdentity(co
   const std::string key = cacheKey(userIdentity, contentClass);
   if (key.empty()) {
     QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidObject, "Cache: cannot index class {} for user identity {}",
-                             contentClass, shortDescription(userIdentity)));
+                             contentClass, describe(userIdentity)));
     return nullptr;
   }
   auto& maps = transient ? transientContainerCache_ : liveContainerCache_;
@@ -182,12 +182,12 @@ QRVMetadataRef QRVContainerCache::_lock_containerForContainerIdentity(const QRVC
   if (!map) {
     QRVFail(error,
             QRV_ERROR_UNDERLYING(QRVResultCode::kCacheRebuildFailed, buildError, "Cache: [{}]-{}{}: Failed to rebuild",
-                                 identifierOf(userIdentity), classDirectory(contentClass), suffix));
+                                 describe(userIdentity), classDirectory(contentClass), suffix));
     return nullptr;
   }
   auto it = map->find(identifier);
   if (it == map->end()) {
-    QRVFail(error, QRV_ERROR_QUIET(QRVResultCode::kNoSuchContainer, "Cache: {}{}: Container Not Found with ID: {}", key,
+    QRVFail(error, QRV_ERROR_DEBUG(QRVResultCode::kNoSuchContainer, "Cache: {}{}: Container Not Found with ID: {}", key,
                                    suffix, identifier));
     return nullptr;
   }
@@ -234,7 +234,7 @@ std::optional<std::vector<QRVMetadataRef>> QRVContainerCache::allContainersForUs
   if (!map) {
     QRVFail(error,
             QRV_ERROR_UNDERLYING(QRVResultCode::kCacheRebuildFailed, buildError, "Cache: [{}]-{}{}: Failed to rebuild",
-                                 identifierOf(userIdentity), classDirectory(contentClass), suffix));
+                                 describe(userIdentity), classDirectory(contentClass), suffix));
     return std::nullopt;
   }
   const std::string key = cacheKey(userIdentity, contentClass);
@@ -263,7 +263,7 @@ bool QRVContainerCache::addContainerMetadata(const QRVMetadataRef& metadata, con
   if (!map)
     return QRVFail(
         error, QRV_ERROR_UNDERLYING(QRVResultCode::kCacheAddFailed, buildError, "Cache: [{}]-{}{}: Failed to rebuild",
-                                    identifierOf(userIdentity), classDirectory(contentClass), suffix));
+                                    describe(userIdentity), classDirectory(contentClass), suffix));
   QRVMetadataRef stored = metadata;
   if (stored->url() != url) stored = stored->withURL(url);
   if (stored->transient() != transient) stored = stored->withTransient(transient);
@@ -286,7 +286,7 @@ bool QRVContainerCache::removeContainerForUserIdentity(const QRVUserIdentityRef&
   if (key.empty())
     return QRVFail(
         error, QRV_ERROR(QRVResultCode::kCacheRemoveFailed, "Cache: cannot remove {} of class {} for user identity {}",
-                         identifier, contentClass, shortDescription(userIdentity)));
+                         identifier, contentClass, describe(userIdentity)));
   Locker lock(*this);
   ClassMap* map = _lock_existingCacheForUserIdentity(userIdentity, contentClass, transient);
   // A map not built yet holds nothing to forget; it is built from disk later.
@@ -326,7 +326,7 @@ bool QRVContainerCache::shouldRegisterSandboxMappingWithUserIdentity(const QRVUs
   QRVLogInfo(
       "Deciding to register userIdentity: {}, identifier: {} ({}), containerClass: {} with sandbox: {} because "
       "isMulti: {}",
-      shortDescription(userIdentity), identifier, application, containerClass, decision ? 1 : 0, isMulti ? 1 : 0);
+      describe(userIdentity), identifier, application, containerClass, decision ? 1 : 0, isMulti ? 1 : 0);
   return decision;
 }
 

@@ -133,7 +133,7 @@ std::string QRVMetadata::description() const {
   return fmt::format(
       "<QRVMetadata: {}; userIdentity = {}, uuid = {}, containerClass = {}, identifier = {}, info = {}, url = {}, "
       "userManagedAssetsDirName = {}>",
-      static_cast<const void*>(this), userIdentity_ ? userIdentity_->shortDescription() : "(null)", uuid_.string(),
+      static_cast<const void*>(this), userIdentity_ ? userIdentity_->description() : "(null)", uuid_.string(),
       containerClass_, identifier_, info_.isNone() ? "(null)" : info_.description(), url_.empty() ? "(null)" : url_,
       userManagedAssetsDirName_.empty() ? "(null)" : userManagedAssetsDirName_);
 }
@@ -290,10 +290,9 @@ QRVMetadataRef QRVMetadata::readAndValidateMetadataAtFileUrl(const std::string& 
         return nullptr;
       }
       if (!owner->isEqualToUserIdentity(*userIdentity)) {
-        QRVFail(error,
-                QRV_ERROR(QRVResultCode::kInvalidFileContent,
-                          "Incorrect User Identity: {}, expecting: {} for {} at {}: {}", owner->shortDescription(),
-                          userIdentity->shortDescription(), identifier, directory, identityError.code()));
+        QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidFileContent,
+                                 "Incorrect User Identity: {}, expecting: {} for {} at {}: {}", owner->description(),
+                                 userIdentity->description(), identifier, directory, identityError.code()));
         return nullptr;
       }
     } else {

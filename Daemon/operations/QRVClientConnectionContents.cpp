@@ -63,8 +63,8 @@ QRVMetadataRef QRVClientConnection::_existingContainer(const QRVContainerIdentit
   if (metadata && containerIdentity->uuid() && metadata->uuid() != *containerIdentity->uuid()) metadata = nullptr;
   if (metadata) return metadata;
   if (lookupError.code() == 0 || QRVContainerCache::isNotFoundError(lookupError))
-    QRVFail(error, QRV_ERROR_QUIET(QRVResultCode::kNoSuchContainer, "No Container with identity: {}",
-                                   containerIdentity->description()));
+    QRVFail(error, QRV_ERROR(QRVResultCode::kNoSuchContainer, "No Container with identity: {}",
+                             containerIdentity->description()));
   else
     QRVFail(error, lookupError);
   return nullptr;
@@ -96,8 +96,8 @@ std::optional<QRVPlist> QRVClientConnection::infoValueForKey(const QRVPlist& key
     if (!metadata) return std::nullopt;
     const QRVPlist* value = metadata->info().get(key.stringValue());
     if (!value) {
-      QRVFail(error, QRV_ERROR_QUIET(QRVResultCode::kInfoValueNotFound, "Didn't find info value for key: {}",
-                                     key.stringValue()));
+      QRVFail(error,
+              QRV_ERROR(QRVResultCode::kInfoValueNotFound, "Didn't find info value for key: {}", key.stringValue()));
       return std::nullopt;
     }
     return *value;

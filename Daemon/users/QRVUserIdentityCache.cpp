@@ -147,8 +147,8 @@ bool QRVUserIdentityCache::_lock_resync_fromUserPersonaAttributes(const std::vec
       personal = identityFromPersona(p, false);
       unspecific = identityFromPersona(p, true);
       if (!personal || !unspecific) continue;
-      QRVLogInfo("Found personal persona {}: created personal {}, unspecific {}", p.personaID,
-                 personal->shortDescription(), unspecific->shortDescription());
+      QRVLogInfo("Found personal persona {}: created personal {}, unspecific {}", p.personaID, personal->description(),
+                 unspecific->description());
       identity = personal;
     } else {
       if (p.uniqueString.empty()) {
@@ -193,7 +193,7 @@ QRVUserIdentityRef QRVUserIdentityCache::userIdentityForCurrentContextWithUID(ui
   if (!personasSupported_) {
     lock.unlock();
     result = userIdentityForPersonalPersonaWithUID(uid, gid);
-    QRVLogDebug("({}/{}) Personas not supported, using: {}", uid, gid, result ? result->shortDescription() : "(null)");
+    QRVLogDebug("({}/{}) Personas not supported, using: {}", uid, gid, result ? result->description() : "(null)");
     return result;
   }
   QRVUserIdentityRef known;
@@ -203,16 +203,16 @@ QRVUserIdentityRef QRVUserIdentityCache::userIdentityForCurrentContextWithUID(ui
   }
   if (known && known->personaType() == QRVPersonaTypePersonal) {
     result = known->withUID(uid, gid);
-    QRVLogDebug("({}/{}) Explicit personal persona, using: {}", uid, gid, result->shortDescription());
+    QRVLogDebug("({}/{}) Explicit personal persona, using: {}", uid, gid, result->description());
   } else if (known && known->isEnterprise() && !known->personaUniqueString().empty()) {
     result = known->withUID(uid, gid);
     QRVLogDebug("({}/{}) Looked up user identity for [{}]: {}", uid, gid, known->personaUniqueString(),
-                result ? result->shortDescription() : "(null)");
+                result ? result->description() : "(null)");
   } else {
     result = userIdentityForUnspecificPersona_->withUID(uid, gid);
     QRVLogDebug("({}/{}) No persona (<{}>) or no unique string [{}], using: {}", uid, gid,
                 persona ? std::to_string(*persona) : "0x0", known ? known->personaUniqueString() : "(null)",
-                result ? result->shortDescription() : "(null)");
+                result ? result->description() : "(null)");
   }
   return result;
 }

@@ -76,6 +76,10 @@ inline bool QRVFail(QRVError* out, QRVError e) {
 #define QRV_ERROR(code, ...)                                                            \
   QRVError::make(QRVError::kDomain, (code), __func__, __LINE__, QRVLogLevel::kError, \
                  fmt::format(__VA_ARGS__))
+// An error that is an expected outcome: traced at debug level, not logged
+// as an error.
+#define QRV_ERROR_DEBUG(code, ...) \
+  QRVError::make(QRVError::kDomain, (code), __func__, __LINE__, QRVLogLevel::kDebug, fmt::format(__VA_ARGS__))
 // An error that is an expected outcome and therefore not logged.
 #define QRV_ERROR_QUIET(code, ...) \
   QRVError::make(QRVError::kDomain, (code), __func__, __LINE__, -1, fmt::format(__VA_ARGS__))

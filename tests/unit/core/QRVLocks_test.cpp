@@ -5,10 +5,14 @@
 #include <array>
 #include <atomic>
 #include <chrono>
+#include <filesystem>
+#include <fstream>
 #include <functional>
 #include <random>
+#include <sstream>
 #include <thread>
 
+#include "base/QRVLog.h"
 #include "support/QRVEventually.h"
 
 namespace {
@@ -174,6 +178,28 @@ TEST_F(LocksTest, AnArrayIsTakenAscendingOnceAndHeldUntilItsLastHolderGoes) {
   unlock_identifier("B");
   lock_identifier_for_reading(std::vector<std::string>{});  // an empty list takes nothing
   EXPECT_EQ(TEST_lock_table_snapshot().recordCount, 0u);
+}
+
+TEST_F(LocksTest, AnArrayIsReleasedInTheReverseOrderOfTaking) {
+  // Only the log tells the order of releases apart.
+  const std::string logPath = ::testing::TempDir() + "locks-order.log";
+  std::filesystem::remove(logPath);
+  ASSERT_TRUE(QRVLog::open("test", logPath, QRVLogLevel::kDebug, 1, 1 << 20));
+  lock_identifier_for_writing(std::vector<std::string>{"B", "A", "B"});
+  unlock_identifier(std::vector<std::string>{"B", "A", "B"});
+  QRVLog::close();
+  std::stringstream log;
+  log << std::ifstream(logPath).rdbuf();
+  const std::string text = log.str();
+  const size_t b = text.find("Unlocked identifier B");
+  const size_t a = text.find("Unlocked identifier A");
+  ASSERT_NE(b, std::string::npos) << text;
+  ASSERT_NE(a, std::string::npos) << text;
+  EXPECT_LT(b, a) << text;
+  EXPECT_EQ(text.find("Unlocked identifier B", b + 1), std::string::npos) << "B released twice:\n" << text;
+  EXPECT_LT(text.find("Got lock on identifier A"), text.find("Got lock on identifier B")) << text;
+  EXPECT_EQ(TEST_lock_table_snapshot().recordCount, 0u);
+  std::filesystem::remove(logPath);
 }
 
 TEST_F(LocksTest, GuardsReleaseOnScopeExitOnUnlockAndAfterAMove) {

@@ -59,6 +59,8 @@ class ContentsTest : public QRVContainerTest {
 };
 
 TEST_F(ContentsTest, InfoValuesAreSetReadAndRemovedAndSurviveAFreshCache) {
+  const std::string logPath = env_.root.path() + "/info.log";
+  ASSERT_TRUE(QRVLog::open("test", logPath, QRVLogLevel::kNotice, 2, 1 << 20));
   auto app = identity("com.example.app");
   QRVError error;
   EXPECT_FALSE(admin()->setInfoValue(QRVPlist::string("v"), key("k"), app, true, &error));
@@ -83,6 +85,15 @@ TEST_F(ContentsTest, InfoValuesAreSetReadAndRemovedAndSurviveAFreshCache) {
   EXPECT_EQ(error.code(), 38u);
   EXPECT_FALSE(admin()->setInfoValue(QRVPlist::string("v"), QRVPlist(), app, true, &error));
   EXPECT_EQ(error.code(), 38u);
+
+  // A missing container or value is the caller's mistake, and the log says
+  // which; a plain look-up that finds nothing stays out of the error log.
+  QRVLog::close();
+  std::stringstream log;
+  log << std::ifstream(logPath).rdbuf();
+  EXPECT_NE(log.str().find("No Container with identity: <QRVContainerIdentity"), std::string::npos) << log.str();
+  EXPECT_NE(log.str().find("Didn't find info value for key: k"), std::string::npos) << log.str();
+  EXPECT_EQ(log.str().find("Container Not Found with ID"), std::string::npos) << log.str();
 }
 
 TEST_F(ContentsTest, ConcurrentWritersOfDifferentKeysKeepBothValues) {
