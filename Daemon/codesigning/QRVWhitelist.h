@@ -20,9 +20,10 @@
 
 class QRVWhitelist : public QRVWellKnownNames {
  public:
-  // The built-in system group container that boot set-up gives a fresh
-  // directory UUID after a build upgrade, and that command 17 hands to any
-  // caller whose code signing lists it.
+  // The one system group container every process may reach: the system
+  // group path request hands it to any caller, whether or not the caller's
+  // code signing lists it, and boot set-up gives it a fresh directory UUID
+  // after a build upgrade.
   static constexpr const char* kSharedSystemGroupIdentifier = "systemgroup.com.kelva.quorva.shared";
 
   // The four collections, in their property-list shapes:
