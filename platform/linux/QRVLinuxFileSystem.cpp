@@ -9,6 +9,8 @@
 
 #include <cerrno>
 
+#include "platform/linux/QRVDirectoryReader.h"
+
 namespace {
 
 int result(int r) { return r == 0 ? 0 : errno; }
@@ -100,30 +102,11 @@ int QRVLinuxFileSystem::realPath(const std::string& path, std::string* resolved)
 }
 
 int QRVLinuxFileSystem::readDirectory(int fd, std::vector<DirectoryEntry>* entries) {
-  // A description of its own ("." of the directory, which is no link), so
-  // that the caller's read position is neither used nor moved.
-  int own = ::openat(fd, ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC);
-  if (own < 0) return errno;
-  DIR* dir = ::fdopendir(own);
-  if (!dir) {
-    int e = errno;
-    ::close(own);
-    return e;
-  }
   std::vector<DirectoryEntry> read;
-  int e = 0;
-  for (;;) {
-    errno = 0;
-    dirent* entry = ::readdir(dir);
-    if (!entry) {
-      e = errno;
-      break;
-    }
-    if (entry->d_name[0] == '.' && (entry->d_name[1] == '\0' || (entry->d_name[1] == '.' && entry->d_name[2] == '\0')))
-      continue;
-    read.push_back({entry->d_name, entry->d_type});
-  }
-  ::closedir(dir);
+  int e = QRVForEachDirectoryEntry(fd, [&](const dirent& entry) {
+    read.push_back({entry.d_name, entry.d_type});
+    return 0;
+  });
   if (e) return e;
   *entries = std::move(read);
   return 0;

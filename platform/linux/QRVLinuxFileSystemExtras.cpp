@@ -16,6 +16,7 @@
 #include <unordered_set>
 #include <utility>
 
+#include "platform/linux/QRVDirectoryReader.h"
 #include "platform/linux/QRVLinuxTreeRemover.h"
 #include "platform/linux/QRVLinuxTreeStatistics.h"
 
@@ -221,26 +222,10 @@ int copyEntry(int fromDirectory, const char* fromName, int toDirectory, const ch
       if (mkdirat(toDirectory, toName, 0700) != 0) return errno;
       ScopedFD out(openat(toDirectory, toName, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
       if (!out) return errno;
-      int listFD = dup(in.get());
-      DIR* dir = listFD >= 0 ? fdopendir(listFD) : nullptr;
-      if (!dir) {
-        int e = errno;
-        if (listFD >= 0) close(listFD);
+      const int from = in.get(), to = out.get();
+      if (int e = QRVForEachDirectoryEntry(
+              from, [&](const dirent& entry) { return copyEntry(from, entry.d_name, to, entry.d_name); }))
         return e;
-      }
-      int e = 0;
-      for (;;) {
-        errno = 0;
-        dirent* entry = readdir(dir);
-        if (!entry) {
-          e = errno;
-          break;
-        }
-        if (!strcmp(entry->d_name, ".") || !strcmp(entry->d_name, "..")) continue;
-        if ((e = copyEntry(in.get(), entry->d_name, out.get(), entry->d_name))) break;
-      }
-      closedir(dir);
-      if (e) return e;
       // After the contents, so that their creation does not change the times.
       return copyMetadata(in.get(), out.get(), st);
     }

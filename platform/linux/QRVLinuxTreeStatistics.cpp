@@ -8,35 +8,18 @@
 #include <algorithm>
 #include <cerrno>
 
+#include "platform/linux/QRVDirectoryReader.h"
 #include "platform/linux/QRVLinuxFileSystemExtras.h"
 
 namespace {
 
-// The names in the open directory `fd`, read through a second descriptor so
-// that `fd` stays usable for openat and fstatat.
+// The names in the open directory `fd`; `fd` stays usable for openat and
+// fstatat.
 int readNames(int fd, std::vector<std::string>* names) {
-  int copy = dup(fd);
-  if (copy < 0) return errno;
-  DIR* dir = fdopendir(copy);
-  if (!dir) {
-    int e = errno;
-    close(copy);
-    return e;
-  }
-  int e = 0;
-  for (;;) {
-    errno = 0;
-    dirent* entry = readdir(dir);
-    if (!entry) {
-      e = errno;
-      break;
-    }
-    const char* name = entry->d_name;
-    if (name[0] == '.' && (name[1] == 0 || (name[1] == '.' && name[2] == 0))) continue;
-    names->emplace_back(name);
-  }
-  closedir(dir);
-  return e;
+  return QRVForEachDirectoryEntry(fd, [&](const dirent& entry) {
+    names->emplace_back(entry.d_name);
+    return 0;
+  });
 }
 
 constexpr int kDirectoryFlags = O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC | O_NONBLOCK;
