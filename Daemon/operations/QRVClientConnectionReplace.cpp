@@ -425,16 +425,24 @@ bool QRVClientConnection::replaceContainerIdentity(const QRVContainerIdentityRef
       QRVLogError("Failed to invalidate code signing info for {}", oldMetadata->identifier());
     QRVCrashPoint(*services_, "replace.old-parked");
 
-    // The kept UUID goes into the new container's metadata before it moves,
-    // so that whenever it is at the destination its metadata is right.
-    QRVMetadataRef placed = newMetadata->withUUID(keptUUID)->withURL(dest)->withTransient(transient);
-    if (keptUUID != newMetadata->uuid() && !placed->withURL(newURL)->writeMetadataToDisk(fm, config, &step)) {
+    // Puts the parked old container back and makes the cache know it again;
+    // the journal is then moot. When the move back fails the journal stays,
+    // so the next start finishes the job, and the answer is 35.
+    auto unparkOld = [&]() -> bool {
       QRVError backError;
       if (!fm.moveItemAtURL(staging, oldURL, &backError))
         return QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kFileUnreadableOrRollbackFailed, backError,
                                                    "Failed to recover replace move: {} to {}", staging, oldURL));
       cache.addContainerMetadata(oldMetadata, oldURL, transient, true, nullptr);
       discardJournal();
+      return true;
+    };
+
+    // The kept UUID goes into the new container's metadata before it moves,
+    // so that whenever it is at the destination its metadata is right.
+    QRVMetadataRef placed = newMetadata->withUUID(keptUUID)->withURL(dest)->withTransient(transient);
+    if (keptUUID != newMetadata->uuid() && !placed->withURL(newURL)->writeMetadataToDisk(fm, config, &step)) {
+      if (!unparkOld()) return false;
       return QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kCacheAddFailed, step,
                                                  "Failed to add to cache: {}, url: {}, transient: {}",
                                                  newIdentity->description(), dest, transient ? 1 : 0));
@@ -443,16 +451,9 @@ bool QRVClientConnection::replaceContainerIdentity(const QRVContainerIdentityRef
     if (!fm.moveItemAtURL(newURL, dest, &step)) {
       QRVError replaceError = QRV_ERROR_UNDERLYING(QRVResultCode::kNewNotMovedIntoPlace, step,
                                                    "Failed to replace: {} with: {} at: {}", oldURL, newURL, dest);
-      QRVError backError;
-      if (!fm.moveItemAtURL(staging, oldURL, &backError))
-        return QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kFileUnreadableOrRollbackFailed, backError,
-                                                   "Failed to recover replace move: {} to {}", staging, oldURL));
-      // The old container is back where it was: the journal is moot, and
-      // the cache learns of it again.
-      cache.addContainerMetadata(oldMetadata, oldURL, transient, true, nullptr);
+      if (!unparkOld()) return false;
       // The new container keeps its own identity where it is.
       if (keptUUID != newMetadata->uuid()) newMetadata->writeMetadataToDisk(fm, config, nullptr);
-      discardJournal();
       return QRVFail(error, replaceError);
     }
     QRVCrashPoint(*services_, "replace.new-placed");
