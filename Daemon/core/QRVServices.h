@@ -6,6 +6,7 @@
 #include <memory>
 
 #include "base/QRVSerialQueue.h"
+#include "codesigning/QRVCodeSigningMapping.h"
 #include "core/QRVTestLocks.h"
 #include "fs/QRVFileManager.h"
 #include "model/QRVContainerCache.h"
@@ -30,9 +31,12 @@ struct QRVServices {
   std::shared_ptr<QRVSerialQueue> lockStateQueue;
   // Held and blocking points driven by the testability command.
   std::shared_ptr<QRVTestLocks> testLocks;
+  // The entitlements of installed and registered identifiers; it also
+  // answers the code-signing, system-group and plug-in-parent seams below.
+  std::shared_ptr<QRVCodeSigningMapping> codeSigningMapping;
 
-  // Components that arrive later, seen through the questions the container
-  // operations ask of them; until then these answer neutrally.
+  // The questions the container operations ask of other components. make()
+  // connects the real ones; tests may install their own.
   std::shared_ptr<QRVCodeSigningQueries> codeSigning;
   std::shared_ptr<QRVDataProtectionQueries> dataProtection;
   std::shared_ptr<QRVWellKnownNames> wellKnownNames;
