@@ -15,6 +15,9 @@
 #include "platform/QRVPlatform.h"
 #include "users/QRVUserIdentityCache.h"
 
+class QRVCodeSigningMapping;
+class QRVGroupManager;
+
 struct QRVServices {
   QRVPlatform platform;
   std::shared_ptr<QRVFileManager> fileManager;
@@ -39,6 +42,10 @@ struct QRVServices {
   std::shared_ptr<QRVPluginParentResolver> pluginParents;
   // Which system group containers an identifier may stage shared content into.
   std::shared_ptr<QRVSystemGroupQueries> systemGroups;
+  // What each identifier is entitled to: the code-signing database.
+  std::shared_ptr<QRVCodeSigningMapping> codeSigningMapping;
+  // Group containers: which an owner claims, and the sweep of unclaimed ones.
+  std::shared_ptr<QRVGroupManager> groupManager;
 
   // Runs `job` on `queue` inside a keep-alive transaction, so the daemon is
   // not considered idle until it has finished.
