@@ -1,5 +1,7 @@
 #include "core/QRVServices.h"
 
+#include "codesigning/QRVGroupManager.h"
+
 std::shared_ptr<QRVServices> QRVServices::make(const std::string& root, QRVPlatform platform) {
   auto s = std::make_shared<QRVServices>();
   s->platform = std::move(platform);
@@ -36,6 +38,7 @@ std::shared_ptr<QRVServices> QRVServices::make(const std::string& root, QRVPlatf
   s->wellKnownNames = std::make_shared<QRVNoWellKnownNames>();
   s->containerCache = std::make_shared<QRVContainerCache>(s->fileManager, s->globalConfiguration, s->userIdentityCache,
                                                           s->platform.sandbox, s->pluginParents, s->wellKnownNames);
+  s->groupManager = std::make_shared<QRVGroupManager>(s);
   return s;
 }
 

@@ -16,6 +16,8 @@
 #include "platform/QRVPlatform.h"
 #include "users/QRVUserIdentityCache.h"
 
+class QRVGroupManager;
+
 struct QRVServices {
   QRVPlatform platform;
   std::shared_ptr<QRVFileManager> fileManager;
@@ -43,6 +45,8 @@ struct QRVServices {
   std::shared_ptr<QRVPluginParentResolver> pluginParents;
   // Which system group containers an identifier may stage shared content into.
   std::shared_ptr<QRVSystemGroupQueries> systemGroups;
+  // Group containers: which an owner claims, and the sweep of unclaimed ones.
+  std::shared_ptr<QRVGroupManager> groupManager;
 
   // Runs `job` on `queue` inside a keep-alive transaction, so the daemon is
   // not considered idle until it has finished.
