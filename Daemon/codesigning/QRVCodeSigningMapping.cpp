@@ -7,14 +7,17 @@
 
 #include "base/QRVLog.h"
 #include "base/QRVResultCode.h"
+#include "codesigning/QRVGroupManager.h"
 #include "codesigning/QRVSQLiteDB.h"
 #include "core/QRVCommandQueue.h"
 #include "core/QRVCommandStageForDelete.h"
 #include "core/QRVExceptionReporter.h"
 #include "core/QRVServices.h"
+#include "migration/QRVMigrationStatus.h"
 #include "model/QRVContainerCache.h"
 #include "model/QRVGlobalConfiguration.h"
 #include "model/QRVPerUserConfiguration.h"
+#include "operations/QRVClientConnection.h"
 #include "users/QRVUserIdentityCache.h"
 
 namespace {
@@ -22,6 +25,7 @@ namespace {
 constexpr const char* kLegacyMappingFileName = "qrv_code_signing_info.plist";
 constexpr const char* kCachedCodeSigningInfoKey = "com.kelva.Verdane.CachedCodeSigningInfo";
 constexpr const char* kCachedEntitlementsKey = "Entitlements";
+constexpr const char* kGroupContainerIDsKey = "com.kelva.Verdane.GroupContainerIDs";
 
 bool isNotFound(const QRVError& error) {
   return error.domain() == QRVError::kDomain && error.code() == QRVResultCode::kDatabaseNotFound;
@@ -945,10 +949,127 @@ void QRVCodeSigningMapping::_onQueue_migrateDataFromLegacyEntitlementsFileToCode
   QRVLogNotice("Legacy entitlement migration completed");
 }
 
+// Older releases kept each data container's application groups in its
+// metadata. They are carried into the database as a placeholder entry, which
+// keeps the groups claimed (and hidden from external requesters) until the
+// installer hands over the real information; an identifier that already has
+// an entry keeps it. The value is then cleared from the container.
+void QRVCodeSigningMapping::_migrateAppGroupIdsFromDataContainers() {
+  std::shared_ptr<QRVServices> services = _services();
+  if (!services) return;
+  std::unique_ptr<QRVMigrationStatus> status = QRVMigrationStatus::initForSystemMigration(*services);
+  if (!status || status->hasMigrationOccurredForType(QRVMigrationStatus::kGroupIdMigration)) return;
+  QRVLogNotice("Performing group ID migration");
+  QRVUserIdentityRef user = services->userIdentityCache->userIdentityForPersonalPersonaWithUID(501, 501);
+  std::shared_ptr<QRVClientConnection> connection = QRVClientConnection::makeSharedClientConnection(services);
+  const QRVPlist key = QRVPlist::string(kGroupContainerIDsKey);
+  for (QRVContainerClass dataClass :
+       {QRVContainerClassAppData, QRVContainerClassPluginData, QRVContainerClassVPNPluginData}) {
+    QRVError error;
+    auto containers = services->containerCache->allContainersForUserIdentity(user, dataClass, false, &error);
+    if (!containers) {
+      QRVLogError("Failed to fetch list of containers for userId: 501, class {} : {}", static_cast<long>(dataClass),
+                  error.description());
+      continue;
+    }
+    for (const QRVMetadataRef& metadata : *containers) {
+      const QRVPlist* ids = metadata->info().isDictionary() ? metadata->info().get(kGroupContainerIDsKey) : nullptr;
+      if (!ids) continue;
+      const std::string identifier = metadata->identifier();
+      QRVPlist groups = QRVPlist::dictionary();
+      groups.set(kQRVApplicationGroupsEntitlement, *ids);
+      queue_->sync([&] {
+        QRVSQLiteDB* db = _onQueue_db();
+        if (!db) return;
+        QRVError readError;
+        if (db->codeSigningEntryWithIdentifier(identifier, &readError) || !isNotFound(readError)) return;
+        QRVPlist wrapped = QRVPlist::dictionary();
+        wrapped.set(kQRVCodeSigningEntitlementsKey, groups);
+        QRVCodeSigningEntry entry(wrapped, dataClass);
+        entry.setPlaceholder(true);
+        QRVError addError;
+        if (!db->addCodeSigningEntry(&entry, identifier, &addError))
+          QRVLogError("Failed to migrate code signing entry for {} : {}", identifier, addError.description());
+      });
+      QRVError clearError;
+      if (!connection->removeInfoValueForKey(key, metadata->containerIdentity(), /*useLocking=*/true, &clearError))
+        QRVLogError("Failed to clear group id metadata for {} : {}", identifier, clearError.resultCode());
+    }
+  }
+  status->setMigrationCompleteForType(QRVMigrationStatus::kGroupIdMigration);
+}
+
+// Older releases cached each bundle's code-signing information in the bundle
+// container's metadata. The database takes it over unless it already has an
+// entry, and the cached copy is removed either way.
+void QRVCodeSigningMapping::_migrateCachedCodeSigningInfoFromBundleContainersToMapping() {
+  std::shared_ptr<QRVServices> services = _services();
+  if (!services) return;
+  std::unique_ptr<QRVMigrationStatus> status = QRVMigrationStatus::initForSystemMigration(*services);
+  if (!status || status->hasMigrationOccurredForType(QRVMigrationStatus::kCodeSigningMigration)) return;
+  std::shared_ptr<QRVClientConnection> connection = QRVClientConnection::makeSharedClientConnection(services);
+  const QRVPlist key = QRVPlist::string(kCachedCodeSigningInfoKey);
+  bool complete = true;
+  for (QRVContainerClass bundleClass :
+       {QRVContainerClassAppBundle, QRVContainerClassPluginBundle, QRVContainerClassVPNPluginBundle}) {
+    QRVError error;
+    auto containers = services->containerCache->allContainersForUserIdentity(
+        services->userIdentityCache->defaultUserIdentity(), bundleClass, false, &error);
+    if (!containers) {
+      QRVLogError("Failed to fetch list of bundle containers of class {} : {}", static_cast<long>(bundleClass),
+                  error.description());
+      complete = false;
+      continue;
+    }
+    for (const QRVMetadataRef& metadata : *containers) {
+      const QRVPlist* cached =
+          metadata->info().isDictionary() ? metadata->info().get(kCachedCodeSigningInfoKey) : nullptr;
+      if (!cached) continue;
+      const std::string identifier = metadata->identifier();
+      bool stored = false;
+      queue_->sync([&] {
+        QRVSQLiteDB* db = _onQueue_db();
+        if (!db) return;
+        QRVError readError;
+        if (db->codeSigningEntryWithIdentifier(identifier, &readError) || !isNotFound(readError)) {
+          QRVLogNotice("Deleting cached code signing info for {} because we already have it in mapping", identifier);
+          stored = true;
+          return;
+        }
+        if (!cached->isDictionary()) return;
+        QRVLogNotice("Migrating code signing info for {}", identifier);
+        QRVPlist copy = *cached;
+        if (const QRVPlist* e = cached->get(kCachedEntitlementsKey)) copy.set(kQRVCodeSigningEntitlementsKey, *e);
+        QRVCodeSigningEntry entry(copy, QRVContainerClassAppData);
+        QRVError addError;
+        stored = db->addCodeSigningEntry(&entry, identifier, &addError);
+        if (!stored)
+          QRVLogError("Failed to migrate code signing entry for {} : {}", identifier, addError.description());
+      });
+      // Removed only once the database holds the information.
+      if (!stored) {
+        complete = false;
+        continue;
+      }
+      QRVError clearError;
+      if (!connection->removeInfoValueForKey(key, metadata->containerIdentity(), /*useLocking=*/true, &clearError))
+        QRVLogError("Failed to clear cached code signing info for {} : {}", identifier, clearError.resultCode());
+    }
+  }
+  if (complete) status->setMigrationCompleteForType(QRVMigrationStatus::kCodeSigningMigration);
+}
+
 void QRVCodeSigningMapping::performAllCodeSigningMigrationAndReconciliationWithCommandQueue(
     QRVCommandQueue& commandQueue) {
   std::shared_ptr<QRVServices> services = _services();
   if (!services) return;
+  // On a multi-user host other users' claims are not all in view, so
+  // nothing that decides by claims alone runs there.
+  const bool multiUser = services->platform.personas && services->platform.personas->multiUserFlags() != 0;
+  if (!multiUser) _migrateAppGroupIdsFromDataContainers();
   queue_->sync([&] { _onQueue_migrateDataFromLegacyEntitlementsFileToCodeSigningFile(); });
+  _migrateCachedCodeSigningInfoFromBundleContainersToMapping();
+  if (!multiUser && services->groupManager)
+    services->groupManager->reconcileGroupContainersOfType(QRVGroupTypeApplication, commandQueue);
   _reconcileSystemContainersWithCommandQueue(commandQueue);
 }

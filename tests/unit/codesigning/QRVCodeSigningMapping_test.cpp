@@ -17,6 +17,7 @@
 #include "codesigning/QRVSQLiteSchema.h"
 #include "core/QRVCommandQueue.h"
 #include "core/QRVCommandStageForDelete.h"
+#include "migration/QRVMigrationStatus.h"
 #include "support/QRVContainerTest.h"
 
 namespace fs = std::filesystem;
@@ -58,13 +59,15 @@ QRVPlist option(const char* key, QRVPlist value) {
   return o;
 }
 
-// "identifier/class/user" of every container the queue will stage.
-Strings staged(QRVCommandQueue& queue) {
+// "identifier/class/user" of every container the queue will stage. The
+// mapping's own deletions take the identifier locks when they run; the
+// boot-time sweep's do not.
+Strings staged(QRVCommandQueue& queue, bool withLocking = true) {
   Strings out;
   for (const auto& command : queue.TEST_pendingCommands()) {
     auto stage = std::dynamic_pointer_cast<QRVCommandStageForDelete>(command);
     if (!stage) continue;
-    EXPECT_TRUE(stage->useLocking());
+    EXPECT_EQ(stage->useLocking(), withLocking);
     for (const auto& id : stage->containerIdentities())
       out.push_back(id->identifier() + "/" + std::to_string(id->containerClass()) + "/" +
                     id->userIdentity()->identifier());
@@ -467,6 +470,47 @@ TEST_F(QRVCodeSigningMappingTest, BootMigratesTheLegacyFileAndRemovesUnclaimedSy
   mapping().performAllCodeSigningMigrationAndReconciliationWithCommandQueue(queue_);
   EXPECT_THAT(staged(queue_), ElementsAre("com.example.unclaimed/12/" +
                                           env_.services->userIdentityCache->defaultUserIdentity()->identifier()));
+}
+
+TEST_F(QRVCodeSigningMappingTest, BootCarriesOlderMetadataIntoTheDatabaseOnceAndSweepsGroups) {
+  prepareUsers();
+  QRVError error;
+  // Group identifiers an older release kept in a data container, and the
+  // code-signing information it cached in a bundle container.
+  auto data = identity("com.example.olddata", QRVContainerClassAppData, personal());
+  create(data);
+  ASSERT_TRUE(admin()->setInfoValue(stringArray({"group.legacy"}),
+                                    QRVPlist::string("com.kelva.Verdane.GroupContainerIDs"), data, true, &error))
+      << error.description();
+  auto bundle = identity("com.example.cached", QRVContainerClassAppBundle);
+  create(bundle);
+  QRVPlist cached = QRVPlist::dictionary();
+  cached.set("Entitlements", entitlements({"group.cached"}));
+  ASSERT_TRUE(
+      admin()->setInfoValue(cached, QRVPlist::string("com.kelva.Verdane.CachedCodeSigningInfo"), bundle, true, &error));
+  for (const char* group : {"group.legacy", "group.cached", "group.orphan"})
+    create(identity(group, QRVContainerClassAppGroup, personal()));
+
+  mapping().performAllCodeSigningMigrationAndReconciliationWithCommandQueue(queue_);
+  EXPECT_THAT(staged(queue_, /*withLocking=*/false), ElementsAre("group.orphan/7/" + personal()->identifier()));
+  auto legacy = mapping().codeSigningEntryForIdentifier("com.example.olddata", nullptr);
+  ASSERT_TRUE(legacy);
+  EXPECT_TRUE(legacy->isPlaceholder());
+  EXPECT_THAT(mapping().appGroupIdentifiersForIdentifier("com.example.olddata"), ElementsAre("group.legacy"));
+  EXPECT_THAT(mapping().appGroupIdentifiersForIdentifier("com.example.cached"), ElementsAre("group.cached"));
+  EXPECT_FALSE(admin()->infoValueForKey(QRVPlist::string("com.kelva.Verdane.GroupContainerIDs"), data, true, nullptr));
+  EXPECT_FALSE(
+      admin()->infoValueForKey(QRVPlist::string("com.kelva.Verdane.CachedCodeSigningInfo"), bundle, true, nullptr));
+  auto status = QRVMigrationStatus::initForSystemMigration(*env_.services);
+  ASSERT_TRUE(status);
+  EXPECT_TRUE(status->hasMigrationOccurredForType(QRVMigrationStatus::kGroupIdMigration));
+  EXPECT_TRUE(status->hasMigrationOccurredForType(QRVMigrationStatus::kCodeSigningMigration));
+
+  // A multi-user host sweeps no application groups.
+  env_.personas->flags = 1;
+  QRVCommandQueue second;
+  mapping().performAllCodeSigningMigrationAndReconciliationWithCommandQueue(second);
+  EXPECT_EQ(second.pendingCount(), 0u);
 }
 
 }  // namespace
