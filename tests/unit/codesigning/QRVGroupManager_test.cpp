@@ -191,13 +191,14 @@ TEST_F(GroupManagerTest, AGroupThatCannotBeCreatedIsLeftOutAndTheOthersAreHanded
   create(identity("group.unrelated", QRVContainerClassAppGroup));
 
   const std::string log = startLog();
-  env_.posixFileSystem->failNext(QRVFaultInjectionFileSystem::Operation::kMakeDirectory, EIO);
+  env_.posixFileSystem->failNext(QRVFaultInjectionFileSystem::Operation::kMakeDirectory, EIO, "/Staging/");
   QRVError error;
   auto caller = connectionFor("com.example.mail");
   auto some = groupsOf(*caller, "com.example.mail", QRVContainerClassAppGroup, &error);
   ASSERT_TRUE(some) << error.description();
   EXPECT_EQ(some->size(), 1u);
-  EXPECT_NE(readLog(log).find("Failed to create or lookup group container: group."), std::string::npos);
+  const std::string text = readLog(log);
+  EXPECT_NE(text.find("Failed to create or lookup group container: group."), std::string::npos) << text;
 
   // Nothing of the failure lasts: the next request creates the missing one.
   auto all = groupsOf(*caller, "com.example.mail", QRVContainerClassAppGroup, &error);
