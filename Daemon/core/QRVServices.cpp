@@ -1,5 +1,7 @@
 #include "core/QRVServices.h"
 
+#include "codesigning/QRVBuiltInWellKnownNames.h"
+
 std::shared_ptr<QRVServices> QRVServices::make(const std::string& root, QRVPlatform platform) {
   auto s = std::make_shared<QRVServices>();
   s->platform = std::move(platform);
@@ -24,11 +26,11 @@ std::shared_ptr<QRVServices> QRVServices::make(const std::string& root, QRVPlatf
     return self->globalConfiguration->pathUnderRoot(path);
   };
   s->userIdentityCache = std::make_shared<QRVUserIdentityCache>(s->platform.personas, std::move(cacheOptions));
-  // The code-signing mapping, the data-protection manager and the well-known
-  // table are not connected yet: the seams that know nothing stand in.
+  // The code-signing mapping and the data-protection manager are not
+  // connected yet: the seams that know nothing stand in.
   s->codeSigning = std::make_shared<QRVNoCodeSigningQueries>();
   s->dataProtection = std::make_shared<QRVNoDataProtectionQueries>();
-  s->wellKnownNames = std::make_shared<QRVNoWellKnownNames>();
+  s->wellKnownNames = std::make_shared<QRVBuiltInWellKnownNames>(s->globalConfiguration);
   s->pluginParents = std::make_shared<QRVNoPluginParentResolver>();
   s->systemGroups = std::make_shared<QRVNoSystemGroupQueries>();
   s->containerCache = std::make_shared<QRVContainerCache>(s->fileManager, s->globalConfiguration, s->userIdentityCache,
