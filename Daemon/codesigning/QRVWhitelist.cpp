@@ -74,34 +74,27 @@ QRVWhitelist makeBuiltInWhitelist(bool isInternalImage) {
   const QRVPlist any;  // none: no restriction at this level
   QRVPlist clients = QRVPlist::dictionary();
   clients.set("com.kelva.verdaned", any);
-  clients.set("com.kelva.backupd",
-              QRVPlist::dictionary().set("2", any).set("7", any).set("12", any).set("13", any));
+  clients.set("com.kelva.backupd", QRVPlist::dictionary().set("2", any).set("7", any).set("12", any).set("13", any));
   clients.set("com.kelva.boxlauncher", QRVPlist::dictionary().set("1", any).set("2", any).set("3", any).set("7", any));
-  clients.set("com.kelva.diagnosticd",
-              QRVPlist::dictionary()
-                  .set("12", QRVPlist::array(strings({"com.kelva.crashreporterd"})))
-                  .set("13", QRVPlist::array(strings({"systemgroup.com.kelva.diagnostics"}))));
+  clients.set("com.kelva.diagnosticd", QRVPlist::dictionary()
+                                           .set("12", QRVPlist::array(strings({"com.kelva.crashreporterd"})))
+                                           .set("13", QRVPlist::array(strings({"systemgroup.com.kelva.diagnostics"}))));
   clients.set("com.kelva.crashreporterd",
               QRVPlist::dictionary()
                   .set("12", QRVPlist::array(strings({"com.kelva.diagnosticd"})))
                   .set("13", QRVPlist::array(strings({"systemgroup.com.kelva.diagnostics"}))));
-  clients.set("com.kelva.settingsd",
-              QRVPlist::dictionary()
-                  .set("2", any)
-                  .set("13", QRVPlist::array(strings({"systemgroup.com.kelva.settings.shared"}))));
+  clients.set("com.kelva.settingsd", QRVPlist::dictionary().set("2", any).set(
+                                         "13", QRVPlist::array(strings({"systemgroup.com.kelva.settings.shared"}))));
   clients.set("com.kelva.mdmd", QRVPlist::dictionary().set("13", QRVPlist::array(strings({
-                                                                      "systemgroup.com.kelva.configurationprofiles",
-                                                                      "systemgroup.com.kelva.settings.shared",
-                                                                  }))));
+                                                                     "systemgroup.com.kelva.configurationprofiles",
+                                                                     "systemgroup.com.kelva.settings.shared",
+                                                                 }))));
   clients.set("com.kelva.storaged", QRVPlist::dictionary().set("2", any).set("4", any).set("7", any));
   clients.set("com.kelva.mediaindexd",
-              QRVPlist::dictionary()
-                  .set("2", any)
-                  .set("13", QRVPlist::array(strings({"systemgroup.com.kelva.mediaindex.thumbnails"}))));
-  clients.set("com.kelva.vpnagentd",
-              QRVPlist::dictionary()
-                  .set("6", any)
-                  .set("13", QRVPlist::array(strings({"systemgroup.com.kelva.networkextension"}))));
+              QRVPlist::dictionary().set("2", any).set(
+                  "13", QRVPlist::array(strings({"systemgroup.com.kelva.mediaindex.thumbnails"}))));
+  clients.set("com.kelva.vpnagentd", QRVPlist::dictionary().set("6", any).set(
+                                         "13", QRVPlist::array(strings({"systemgroup.com.kelva.networkextension"}))));
   return QRVWhitelist(systemContainers, systemGroups, everybody, clients);
 }
 
@@ -159,7 +152,7 @@ QRVWhitelist::Node QRVWhitelist::_convertArraysToSetsInNestedDictionary(const QR
 }
 
 std::map<std::string, std::string, std::less<>> QRVWhitelist::_directoryNames(const QRVPlist& mapping,
-                                                                               const char* what) {
+                                                                              const char* what) {
   std::map<std::string, std::string, std::less<>> names;
   for (const auto& [identifier, value] : mapping.dictionaryValue()) {
     if (!value.isString() || !isPlainComponent(value.stringValue())) {

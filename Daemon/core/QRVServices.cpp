@@ -1,5 +1,6 @@
 #include "core/QRVServices.h"
 
+#include "codesigning/QRVBuiltInWellKnownNames.h"
 #include "codesigning/QRVGroupManager.h"
 
 std::shared_ptr<QRVServices> QRVServices::make(const std::string& root, QRVPlatform platform) {
@@ -32,10 +33,10 @@ std::shared_ptr<QRVServices> QRVServices::make(const std::string& root, QRVPlatf
   s->codeSigning = s->codeSigningMapping;
   s->systemGroups = s->codeSigningMapping;
   s->pluginParents = s->codeSigningMapping;
-  // The data-protection manager and the well-known table are not connected
-  // yet: the seams that know nothing stand in.
+  // The data-protection manager is not connected yet: the seam that knows
+  // nothing stands in.
   s->dataProtection = std::make_shared<QRVNoDataProtectionQueries>();
-  s->wellKnownNames = std::make_shared<QRVNoWellKnownNames>();
+  s->wellKnownNames = std::make_shared<QRVBuiltInWellKnownNames>(s->globalConfiguration);
   s->containerCache = std::make_shared<QRVContainerCache>(s->fileManager, s->globalConfiguration, s->userIdentityCache,
                                                           s->platform.sandbox, s->pluginParents, s->wellKnownNames);
   s->groupManager = std::make_shared<QRVGroupManager>(s);

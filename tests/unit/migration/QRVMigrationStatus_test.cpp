@@ -25,7 +25,9 @@ class MigrationStatusTest : public testing::Test {
   QRVServices& services() { return *env_.services; }
   std::string library() { return env_.root.path() + "/private/var/root/Library/Quorva"; }
   std::string systemFile() { return library() + "/qrv_migration_status.plist"; }
-  std::string userFile() { return env_.root.path() + "/private/var/mobile/Library/Quorva/qrv_user_migration_status.plist"; }
+  std::string userFile() {
+    return env_.root.path() + "/private/var/mobile/Library/Quorva/qrv_user_migration_status.plist";
+  }
 
   void writePlist(const std::string& path, const QRVPlist& plist) {
     std::filesystem::create_directories(std::filesystem::path(path).parent_path());
@@ -198,9 +200,9 @@ TEST_F(MigrationStatusTest, ABuildThatCannotBeReadCountsAsAnUpgrade) {
   EXPECT_THAT(testing::internal::GetCapturedStderr(),
               HasSubstr("Could not get current build string; assuming this is an upgrade"));
   ASSERT_TRUE(status->setMigrationCompleteForType(QRVMigrationStatus::kGroupIdMigration));
-  EXPECT_EQ(status->migrationInfo().get(QRVMigrationStatus::kGroupIdMigration)->stringForKey(
-                "QRVMigrationVersionNumber"),
-            "Unknown");
+  EXPECT_EQ(
+      status->migrationInfo().get(QRVMigrationStatus::kGroupIdMigration)->stringForKey("QRVMigrationVersionNumber"),
+      "Unknown");
 
   // Saved without a build, the record cannot be compared on the next boot.
   ASSERT_TRUE(status->writeCurrentBuildInfoToDisk());
