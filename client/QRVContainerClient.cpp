@@ -52,6 +52,20 @@ void setAssetsOwner(QRVPlist& request, const std::string& identifier, const std:
   if (persona) request.set("PersonaUniqueString", QRVPlist::string(*persona));
 }
 
+void setGroupOwner(QRVPlist& request, const QRVGroupOwnerRef& g) {
+  if (g.owner) request.set("Identifier", QRVPlist::string(*g.owner));
+  request.set("ContainerClass", QRVPlist::uinteger(g.groupClass));
+  if (g.persona) request.set("PersonaUniqueString", QRVPlist::string(*g.persona));
+}
+
+std::map<std::string, std::string> stringMapFrom(const QRVPlist* value) {
+  std::map<std::string, std::string> out;
+  if (!value || !value->isDictionary()) return out;
+  for (const auto& [key, v] : value->dictionaryValue())
+    if (v.isString()) out[key] = v.stringValue();
+  return out;
+}
+
 }  // namespace
 
 bool QRVContainerResult::ok() const { return code == QRVResultCode::kSuccess; }
@@ -79,6 +93,10 @@ QRVContainerResult QRVContainerResult::fromReply(QRVPlist reply) {
     if (auto u = uuidFrom(&v)) r.uuids.push_back(*u);
   for (const QRVPlist& v : reply.arrayForKey("ReplyPersonaUniqueStringsArray"))
     if (auto s = stringFrom(&v)) r.personas.push_back(*s);
+  r.groupPaths = stringMapFrom(reply.get("ReplyGroupContainerDict"));
+  r.groupTokens = stringMapFrom(reply.get("SandboxTokenDict"));
+  for (const QRVPlist& v : reply.arrayForKey("ReplyGroupIdentifiersArray"))
+    if (auto s = stringFrom(&v)) r.groupIdentifiers.push_back(*s);
   r.reply = std::move(reply);
   return r;
 }
@@ -208,6 +226,57 @@ QRVPlist setTestLock(uint64_t lock, bool enable) {
   return request;
 }
 
+QRVPlist createOrLookupGroupContainers(const QRVGroupOwnerRef& g) {
+  QRVPlist request = withCommand(C::createOrLookupGroupContainers);
+  setGroupOwner(request, g);
+  return request;
+}
+
+QRVPlist groupContainerIdentifiersForOwner(const QRVGroupOwnerRef& g) {
+  QRVPlist request = withCommand(C::groupContainerIdentifiersForOwner);
+  setGroupOwner(request, g);
+  return request;
+}
+
+QRVPlist lookupSystemContainer(const std::string& identifier) {
+  // System containers are class 12, the only class the command accepts.
+  QRVContainerRef container;
+  container.identifier = identifier;
+  container.containerClass = 12;
+  return containerRequest(C::lookupSystemContainer, container);
+}
+
+QRVPlist groupContainersForOwner(const QRVGroupOwnerRef& g) {
+  QRVPlist request = withCommand(C::groupContainersForOwner);
+  setGroupOwner(request, g);
+  return request;
+}
+
+QRVPlist systemGroupContainerPath(const std::string& groupIdentifier) {
+  QRVPlist request = withCommand(C::systemGroupContainerPath);
+  request.set("GroupIdentifier", QRVPlist::string(groupIdentifier));
+  return request;
+}
+
+QRVPlist processCodeSigningInfo(const std::string& identifier, const std::optional<QRVPlist>& info,
+                                const std::optional<QRVPlist>& options) {
+  QRVPlist request = withCommand(C::processCodeSigningInfo);
+  request.set("Identifier", QRVPlist::string(identifier));
+  if (info) request.set("CodeSigningInfo", *info);
+  if (options) request.set("OptionsDictionary", *options);
+  return request;
+}
+
+QRVPlist codeSigningInfoForIdentifier(const std::string& identifier) {
+  QRVPlist request = withCommand(C::codeSigningInfoForIdentifier);
+  request.set("Identifier", QRVPlist::string(identifier));
+  return request;
+}
+
+QRVPlist invalidateCodeSigningInfoForAppsWithoutBundleContainer() {
+  return withCommand(C::invalidateCodeSigningInfoForAppsWithoutBundleContainer);
+}
+
 }  // namespace QRVContainerRequests
 
 QRVContainerClient::Result QRVContainerClient::call(const QRVPlist& request, QRVClientError* error) {
@@ -268,3 +337,28 @@ Result QRVContainerClient::deleteUserManagedAsset(const std::string& identifier,
   return call(R::deleteUserManagedAsset(identifier, persona, sourcePath), e);
 }
 Result QRVContainerClient::setTestLock(uint64_t lock, bool enable, E* e) { return call(R::setTestLock(lock, enable), e); }
+Result QRVContainerClient::createOrLookupGroupContainers(const QRVGroupOwnerRef& g, E* e) {
+  return call(R::createOrLookupGroupContainers(g), e);
+}
+Result QRVContainerClient::groupContainerIdentifiersForOwner(const QRVGroupOwnerRef& g, E* e) {
+  return call(R::groupContainerIdentifiersForOwner(g), e);
+}
+Result QRVContainerClient::lookupSystemContainer(const std::string& identifier, E* e) {
+  return call(R::lookupSystemContainer(identifier), e);
+}
+Result QRVContainerClient::groupContainersForOwner(const QRVGroupOwnerRef& g, E* e) {
+  return call(R::groupContainersForOwner(g), e);
+}
+Result QRVContainerClient::systemGroupContainerPath(const std::string& groupIdentifier, E* e) {
+  return call(R::systemGroupContainerPath(groupIdentifier), e);
+}
+Result QRVContainerClient::processCodeSigningInfo(const std::string& identifier, const std::optional<QRVPlist>& info,
+                                                  const std::optional<QRVPlist>& options, E* e) {
+  return call(R::processCodeSigningInfo(identifier, info, options), e);
+}
+Result QRVContainerClient::codeSigningInfoForIdentifier(const std::string& identifier, E* e) {
+  return call(R::codeSigningInfoForIdentifier(identifier), e);
+}
+Result QRVContainerClient::invalidateCodeSigningInfoForAppsWithoutBundleContainer(E* e) {
+  return call(R::invalidateCodeSigningInfoForAppsWithoutBundleContainer(), e);
+}

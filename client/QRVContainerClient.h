@@ -17,6 +17,7 @@
 #include <array>
 #include <chrono>
 #include <cstdint>
+#include <map>
 #include <optional>
 #include <string>
 #include <vector>
@@ -54,9 +55,22 @@ struct QRVContainerResult {
   std::vector<std::string> identifiers;
   std::vector<QRVUUIDBytes> uuids;
   std::vector<std::string> personas;
+  // Group commands: group identifier -> path, and -> sandbox token; the
+  // group identifiers an owner claims.
+  std::map<std::string, std::string> groupPaths;
+  std::map<std::string, std::string> groupTokens;
+  std::vector<std::string> groupIdentifiers;
 
   bool ok() const;
   static QRVContainerResult fromReply(QRVPlist reply);
+};
+
+// The owner and class of a group request. No owner means the caller's own
+// identifier; the class is 7 (application groups) or 13 (system groups).
+struct QRVGroupOwnerRef {
+  std::optional<std::string> owner;
+  uint64_t groupClass = 7;
+  std::optional<std::string> persona;
 };
 
 // One container of a stage-for-delete request.
@@ -91,6 +105,16 @@ QRVPlist userManagedAssetsPath(const std::string& identifier, const std::optiona
 QRVPlist deleteUserManagedAsset(const std::string& identifier, const std::optional<std::string>& persona,
                                 const std::string& sourcePath);
 QRVPlist setTestLock(uint64_t lock, bool enable);
+QRVPlist createOrLookupGroupContainers(const QRVGroupOwnerRef& g);
+QRVPlist groupContainerIdentifiersForOwner(const QRVGroupOwnerRef& g);
+QRVPlist lookupSystemContainer(const std::string& identifier);
+QRVPlist groupContainersForOwner(const QRVGroupOwnerRef& g);
+QRVPlist systemGroupContainerPath(const std::string& groupIdentifier);
+// No `info` removes the identifier's information.
+QRVPlist processCodeSigningInfo(const std::string& identifier, const std::optional<QRVPlist>& info,
+                                const std::optional<QRVPlist>& options);
+QRVPlist codeSigningInfoForIdentifier(const std::string& identifier);
+QRVPlist invalidateCodeSigningInfoForAppsWithoutBundleContainer();
 }  // namespace QRVContainerRequests
 
 class QRVContainerClient {
@@ -129,6 +153,20 @@ class QRVContainerClient {
   Result deleteUserManagedAsset(const std::string& identifier, const std::optional<std::string>& persona,
                                 const std::string& sourcePath, QRVClientError* e);
   Result setTestLock(uint64_t lock, bool enable, QRVClientError* e);
+  // Group and system containers: paths in groupPaths (and tokens in
+  // groupTokens for createOrLookupGroupContainers), identifiers in
+  // groupIdentifiers, single paths in path.
+  Result createOrLookupGroupContainers(const QRVGroupOwnerRef& g, QRVClientError* e);
+  Result groupContainerIdentifiersForOwner(const QRVGroupOwnerRef& g, QRVClientError* e);
+  Result lookupSystemContainer(const std::string& identifier, QRVClientError* e);
+  Result groupContainersForOwner(const QRVGroupOwnerRef& g, QRVClientError* e);
+  Result systemGroupContainerPath(const std::string& groupIdentifier, QRVClientError* e);
+  // Code-signing information, as the installer hands it over; the stored
+  // dictionary comes back in infoDictionary.
+  Result processCodeSigningInfo(const std::string& identifier, const std::optional<QRVPlist>& info,
+                                const std::optional<QRVPlist>& options, QRVClientError* e);
+  Result codeSigningInfoForIdentifier(const std::string& identifier, QRVClientError* e);
+  Result invalidateCodeSigningInfoForAppsWithoutBundleContainer(QRVClientError* e);
 
  private:
   QRVClient client_;

@@ -160,7 +160,8 @@ struct Typed {
   bool haveId = false, haveClass = false, haveNewId = false, haveNewClass = false;
   bool create = false, transient = false, info = false, relative = false;
   std::optional<bool> enable;
-  std::optional<std::string> key, path, dest;
+  std::optional<std::string> key, path, dest, group;
+  std::optional<QRVPlist> signing, signingOptions;
   std::optional<QRVPlist> value;
   std::optional<uint64_t> lock, crashes;
 };
@@ -198,9 +199,9 @@ bool parseTyped(Words& words, Options& options, std::string_view allowed, Typed*
   };
   static constexpr std::string_view kFlags[] = {"--create", "--transient", "--info", "--relative", "--enable",
                                                 "--disable"};
-  static constexpr std::string_view kValued[] = {"--id", "--class", "--persona", "--uuid", "--new-id", "--new-class",
-                                                 "--new-persona", "--new-uuid", "--key", "--value", "--path",
-                                                 "--dest", "--lock", "--crashes"};
+  static constexpr std::string_view kValued[] = {
+      "--id",    "--class", "--persona", "--uuid", "--new-id",  "--new-class", "--new-persona", "--new-uuid", "--key",
+      "--value", "--path",  "--dest",    "--lock", "--crashes", "--group",     "--signing",     "--options"};
   while (!words.empty()) {
     if (takeCommonOption(words, options, error)) {
       if (!error->empty()) return false;
@@ -240,6 +241,12 @@ bool parseTyped(Words& words, Options& options, std::string_view allowed, Typed*
       if (name == "--key") t->key = v;
       if (name == "--path") t->path = v;
       if (name == "--dest") t->dest = v;
+      if (name == "--group") t->group = v;
+      if (name == "--signing" || name == "--options") {
+        // A property list: "@FILE" or inline XML, as KEY:plist= words take.
+        auto parsed = QRVRequestArguments::parseArgument("Value:plist=" + v, error);
+        if ((good = parsed.has_value())) (name == "--signing" ? t->signing : t->signingOptions) = parsed->second;
+      }
       if (name == "--lock" && (good = parseNumber(name, v, &n, error))) t->lock = n;
       if (name == "--crashes" && (good = parseNumber(name, v, &n, error))) t->crashes = n;
       if (name == "--value") {
@@ -351,6 +358,42 @@ QRV_TYPED(buildSetTestLock, "--lock --enable --disable", {
   return R::setTestLock(*t.lock, *t.enable);
 })
 
+QRVGroupOwnerRef groupOwner(const Typed& t) {
+  return {.owner = t.haveId ? std::optional<std::string>(t.container.identifier) : std::nullopt,
+          .groupClass = t.container.containerClass,
+          .persona = t.container.persona};
+}
+QRV_TYPED(buildGroupLookup, "--id --class --persona", {
+  if (!require(t.haveClass, "--class", error)) return std::nullopt;
+  return R::createOrLookupGroupContainers(groupOwner(t));
+})
+QRV_TYPED(buildGroupPaths, "--id --class --persona", {
+  if (!require(t.haveClass, "--class", error)) return std::nullopt;
+  return R::groupContainersForOwner(groupOwner(t));
+})
+QRV_TYPED(buildGroupIds, "--id --class", {
+  if (!require(t.haveClass, "--class", error)) return std::nullopt;
+  return R::groupContainerIdentifiersForOwner(groupOwner(t));
+})
+QRV_TYPED(buildSystemLookup, "--id", {
+  if (!require(t.haveId, "--id", error)) return std::nullopt;
+  return R::lookupSystemContainer(t.container.identifier);
+})
+QRV_TYPED(buildSystemGroupPath, "--group", {
+  if (!require(t.group.has_value(), "--group", error)) return std::nullopt;
+  return R::systemGroupContainerPath(*t.group);
+})
+QRV_TYPED(buildCodeSigningSet, "--id --signing --options", {
+  if (!require(t.haveId, "--id", error)) return std::nullopt;
+  return R::processCodeSigningInfo(t.container.identifier, t.signing, t.signingOptions);
+})
+QRV_TYPED(buildCodeSigningGet, "--id", {
+  if (!require(t.haveId, "--id", error)) return std::nullopt;
+  return R::codeSigningInfoForIdentifier(t.container.identifier);
+})
+QRV_TYPED(buildCodeSigningInvalidateOrphans, "",
+          { return R::invalidateCodeSigningInfoForAppsWithoutBundleContainer(); })
+
 #undef QRV_TYPED
 
 struct Subcommand {
@@ -391,12 +434,15 @@ Example:
 )",
      buildRaw},
     {"lookup", "lookup --id ID --class N [--persona S] [--create] [--transient]",
-     "Looks up the container of ID in class N, creating it with --create.\nPrints its path, UUID and whether it existed.\n",
+     "Looks up the container of ID in class N, creating it with --create.\nPrints its path, UUID and whether it "
+     "existed.\n",
      buildLookup},
     {"list", "list --class N [--transient]", "Lists the containers of class N (identifiers, UUIDs, personas).\n",
      buildList},
     {"metadata", "metadata --id ID --class N --uuid UUID [--persona S] [--info]",
-     "UUID is 8-4-4-4-12 hex digits or the 32 digits --json prints.\nPrints a container's path and whether it is transient; --info adds its info dictionary.\n", buildMetadata},
+     "UUID is 8-4-4-4-12 hex digits or the 32 digits --json prints.\nPrints a container's path and whether it is "
+     "transient; --info adds its info dictionary.\n",
+     buildMetadata},
     {"info-get", "info-get --id ID --class N --uuid UUID --key K [--persona S]",
      "Prints the value stored under K in a container's info.\n", buildInfoGet},
     {"info-set", "info-set --id ID --class N --uuid UUID --key K --value V [--persona S]",
@@ -409,12 +455,12 @@ Example:
     {"replace",
      "replace --id ID --class N [--uuid U] --new-id ID --new-class N [--new-uuid U] [--persona S] [--new-persona S]",
      "Replaces a container with another one.\n", buildReplace},
-    {"disk-usage", "disk-usage --id ID --class N --uuid UUID [--persona S]",
-     "Prints the bytes a container uses.\n", buildDiskUsage},
+    {"disk-usage", "disk-usage --id ID --class N --uuid UUID [--persona S]", "Prints the bytes a container uses.\n",
+     buildDiskUsage},
     {"assets-path", "assets-path --id ID [--persona S] [--relative] [--create]",
      "Prints the user-managed assets directory of ID's application data container.\n", buildAssetsPath},
-    {"assets-delete", "assets-delete --id ID --path P [--persona S]",
-     "Deletes the user-managed asset P of ID.\n", buildAssetsDelete},
+    {"assets-delete", "assets-delete --id ID --path P [--persona S]", "Deletes the user-managed asset P of ID.\n",
+     buildAssetsDelete},
     {"stage-delete", "stage-delete --id ID --class N --uuid UUID [--persona S]",
      "Stages a container for deletion (see empty-death-row).\n", buildStageDelete},
     {"recreate", "recreate --id ID --class N --uuid UUID [--persona S]",
@@ -427,10 +473,32 @@ Example:
      "Stages SOURCE as shared content of ID under DEST; prints where it went.\n", buildStageShared},
     {"retry-test", "retry-test [--crashes N]", "Runs the retry test with N crashes (internal builds only).\n",
      buildRetryTest},
-    {"empty-death-row", "empty-death-row",
-     "Deletes the containers staged for deletion; answers when that is done.\n", buildEmptyDeathRow},
+    {"empty-death-row", "empty-death-row", "Deletes the containers staged for deletion; answers when that is done.\n",
+     buildEmptyDeathRow},
     {"set-test-lock", "set-test-lock --lock N (--enable | --disable)",
      "Holds or releases test lock N (internal builds only).\n", buildSetTestLock},
+    {"group-lookup", "group-lookup --class N [--id OWNER] [--persona S]",
+     "Creates or looks up the group containers OWNER claims (default: the caller\n"
+     "itself); N is 7 for application groups, 13 for system groups. Prints each\n"
+     "group's path and sandbox token.\n",
+     buildGroupLookup},
+    {"group-paths", "group-paths --class N [--id OWNER] [--persona S]", "As group-lookup, without sandbox tokens.\n",
+     buildGroupPaths},
+    {"group-ids", "group-ids --class N [--id OWNER]",
+     "Prints the group identifiers OWNER claims (default: the caller itself).\n", buildGroupIds},
+    {"system-lookup", "system-lookup --id ID",
+     "Prints the path of ID's system container; a well-known one is created if\nnecessary.\n", buildSystemLookup},
+    {"system-group-path", "system-group-path --group G",
+     "Prints the path of the system group container G, which the caller's code\nsigning must list.\n",
+     buildSystemGroupPath},
+    {"codesign-set", "codesign-set --id ID [--signing PLIST] [--options PLIST]",
+     "Hands over ID's code-signing information as the installer does; without\n"
+     "--signing, ID's information is removed. PLIST is @FILE or inline XML.\n",
+     buildCodeSigningSet},
+    {"codesign-get", "codesign-get --id ID", "Prints ID's stored code-signing information.\n", buildCodeSigningGet},
+    {"codesign-invalidate-orphans", "codesign-invalidate-orphans",
+     "Invalidates the code-signing information of applications whose bundle\ncontainer is gone.\n",
+     buildCodeSigningInvalidateOrphans},
 };
 
 const Subcommand* findSubcommand(std::string_view name) {

@@ -263,7 +263,12 @@ std::vector<std::string> gRelativePaths = {
 
 const char* const kIdentifiers[] = {"com.example.a",      "com.example.b",      "com.kelva.fuzz.allowed",
                                     "com.example.wiper",  "com.example.looker", "com.example.tester",
-                                    "com.example.noents", "group.example"};
+                                    "com.example.noents", "group.example",      "systemgroup.com.kelva.quorva.shared",
+                                    "systemgroup.example"};
+// Group identifiers the code-signing information of the fuzzer's identifiers
+// claims, so that groups gain and lose claimants from one request to the next.
+const char* const kGroups[] = {"group.example", "group.other", "systemgroup.example",
+                               "systemgroup.com.kelva.quorva.shared", "notsystem.example"};
 const char* const kPersonas[] = {"PERSONAL", "WORK", "", "NOBODY"};
 const char* const kInfoKeys[] = {"com.kelva.Verdane.StaticDiskUsage", "com.kelva.Verdane.ContentProtectionClass", "k",
                                  ""};
@@ -325,7 +330,29 @@ QRVPlist anyValue(FuzzedDataProvider& in, int depth = 0) {
 }
 
 // Values of the type a key is read as, most of the time.
-enum class Kind { Identifier, Class, UUID, UUIDOrString, Persona, Bool, InfoKey, Path, Number, Any };
+enum class Kind {
+  Identifier,
+  Class,
+  UUID,
+  UUIDOrString,
+  Persona,
+  Bool,
+  InfoKey,
+  Path,
+  Number,
+  Group,
+  CodeSigningInfo,
+  CodeSigningOptions,
+  Any
+};
+
+QRVPlist someGroups(FuzzedDataProvider& in) {
+  QRVPlist groups = QRVPlist::array();
+  for (int n = in.ConsumeIntegralInRange(0, 3); n > 0; n--)
+    groups.append(in.ConsumeIntegralInRange(0, 7) == 0 ? anyValue(in, 2)
+                                                       : QRVPlist::string(in.PickValueInArray(kGroups)));
+  return groups;
+}
 
 QRVPlist valueOf(Kind kind, FuzzedDataProvider& in) {
   if (in.ConsumeIntegralInRange(0, 7) == 0) return anyValue(in);
@@ -354,6 +381,28 @@ QRVPlist valueOf(Kind kind, FuzzedDataProvider& in) {
       return QRVPlist::string(gRelativePaths[in.ConsumeIntegralInRange<size_t>(0, gRelativePaths.size() - 1)]);
     case Kind::Number:
       return QRVPlist::uinteger(anyNumber(in));
+    case Kind::Group:
+      return QRVPlist::string(in.ConsumeBool() ? std::string(in.PickValueInArray(kGroups)) : anyString(in));
+    case Kind::CodeSigningInfo: {
+      // Entitlements as the installer hands them over, now and then with a
+      // value of the wrong type in place of a list.
+      QRVPlist entitlements = QRVPlist::dictionary();
+      if (in.ConsumeBool()) entitlements.set("com.kelva.security.application-groups", someGroups(in));
+      if (in.ConsumeBool()) entitlements.set("com.kelva.security.system-groups", someGroups(in));
+      if (in.ConsumeBool()) entitlements.set("com.kelva.security.system-container", QRVPlist::boolean(true));
+      if (in.ConsumeIntegralInRange(0, 7) == 0) entitlements.set(anyString(in), anyValue(in, 2));
+      return QRVPlist::dictionary().set("com.kelva.Quorva.Entitlements", std::move(entitlements));
+    }
+    case Kind::CodeSigningOptions: {
+      QRVPlist options = QRVPlist::dictionary();
+      if (in.ConsumeBool())
+        options.set("com.kelva.Quorva.DataContainerClass", QRVPlist::uinteger(in.PickValueInArray({2, 4, 6, 9})));
+      if (in.ConsumeBool())
+        options.set("com.kelva.Quorva.ParentBundleID", QRVPlist::string(in.PickValueInArray(kIdentifiers)));
+      if (in.ConsumeBool()) options.set("com.kelva.Quorva.PlaceholderEntitlements", QRVPlist::boolean(true));
+      if (in.ConsumeBool()) options.set("com.kelva.Quorva.AdvanceCopy", QRVPlist::boolean(true));
+      return options;
+    }
     case Kind::Any:
       return anyValue(in);
   }
@@ -388,6 +437,9 @@ const Key kKeys[] = {
     {"NumRetryCrashes", Kind::Number},
     {"TestLock", Kind::Number},
     {"Enable", Kind::Bool},
+    {"GroupIdentifier", Kind::Group},
+    {"CodeSigningInfo", Kind::CodeSigningInfo},
+    {"OptionsDictionary", Kind::CodeSigningOptions},
 };
 // The stage-for-delete lists, read in step with each other.
 const Key kLists[] = {{"ContainerClassesArray", Kind::Class},
@@ -523,6 +575,19 @@ void sendRequest(FuzzedDataProvider& in) {
   if (command == 0)
     check(mayLookUp(pid, reply.stringForKey("ReplyIdentifier")), "caller got another identifier's container",
           reply.stringForKey("ReplyIdentifier"));
+  // Another owner's groups need a right to look that owner up.
+  if ((command == 13 || command == 16) && request.get("Identifier"))
+    check(mayLookUp(pid, request.stringForKey("Identifier")), "caller got another owner's groups",
+          request.stringForKey("Identifier"));
+  for (const auto& [group, groupPath] : reply.dictionaryForKey("ReplyGroupContainerDict")) {
+    check(groupPath.isString() && isInsideRoot(groupPath.stringValue()), "group path outside the root", group);
+    if (groupPath.isString()) remember(gPaths, groupPath.stringValue());
+  }
+  for (const auto& [group, groupToken] : reply.dictionaryForKey("SandboxTokenDict")) {
+    const std::string& text = groupToken.stringValue();
+    if (size_t semicolon = text.find(';'); semicolon != std::string::npos)
+      check(isInsideRoot(text.substr(semicolon + 1)), "group sandbox token outside the root", text);
+  }
   // Paths handed back name places inside the root, or are relative.
   const std::string& path = reply.stringForKey("ReplyPath");
   if (!path.empty() && (path[0] == '/' || command != 28)) check(isInsideRoot(path), "path outside the root", path);

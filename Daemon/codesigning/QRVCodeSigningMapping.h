@@ -30,9 +30,11 @@
 #pragma once
 
 #include <cstdint>
+#include <functional>
 #include <map>
 #include <memory>
 #include <optional>
+#include <set>
 #include <string>
 #include <vector>
 
@@ -41,6 +43,7 @@
 #include "base/QRVSerialQueue.h"
 #include "codesigning/QRVCodeSigningEntry.h"
 #include "model/QRVContainerCacheSeams.h"
+#include "model/QRVContainerIdentity.h"
 #include "operations/QRVContainerOperationSeams.h"
 
 class QRVCommandQueue;
@@ -137,9 +140,59 @@ class QRVCodeSigningMapping : public QRVCodeSigningQueries,
   void performAllCodeSigningMigrationAndReconciliationWithCommandQueue(QRVCommandQueue& commandQueue);
 
  private:
+  // A group list as read from entitlements: none when the entitlement is
+  // absent or unusable, otherwise de-duplicated and sorted.
+  using GroupList = std::optional<std::vector<std::string>>;
+  // The options of processCodeSigningInfo once their types are checked.
+  struct Options {
+    uint64_t dataContainerClass = 0;
+    std::optional<std::string> parentIdentifier;
+    bool registeredByCaller = false;
+    bool placeholder = false;
+    bool advanceCopy = false;
+  };
+  static Options _parseOptions(const QRVPlist& options, const std::string& identifier);
+
+  std::shared_ptr<QRVServices> _services() const { return services_.lock(); }
+
   // Everything named _onQueue_ runs on queue_ only. The database, opened
   // on first use; null (logged) when it cannot be opened.
   QRVSQLiteDB* _onQueue_db();
+  void _onQueue_migrateFromMappingFileToDBIfNecessary(QRVSQLiteDB& db);
+  // The stored entry; null with 67 when none is stored or the database is
+  // unavailable, another code when it cannot be read.
+  std::shared_ptr<const QRVCodeSigningEntry> _onQueue_entry(const std::string& identifier, QRVError* error);
+  std::optional<std::string> _onQueue_parent(const std::string& childIdentifier);
+  std::optional<std::vector<std::string>> _onQueue_children(const std::string& parent);
+  // Whether making `childIdentifier` a child of `parentIdentifier` would
+  // close a loop of parents.
+  bool _onQueue_wouldFormCycle(const std::string& childIdentifier, const std::string& parentIdentifier);
+
+  uint64_t _onQueue_processCodeSigningInfo(const QRVPlist& codeSigningInfo, const std::string& identifier,
+                                           const Options& options, const std::optional<QRVPlist>& oldEntitlements,
+                                           QRVCommandQueue& commandQueue);
+  void _onQueue_handleChangeFromOldGroupContainerIds(const GroupList& oldIds, const GroupList& newIds,
+                                                     QRVGroupType type, QRVCommandQueue& commandQueue);
+  void _onQueue_removeReferenceForGroupIdentifiers(const std::vector<std::string>& groupIdentifiers, QRVGroupType type,
+                                                   QRVCommandQueue& commandQueue);
+  std::optional<QRVGroupReferenceCounts> _onQueue_copyReferenceCountSetOfType(QRVGroupType type);
+  // Writes (or, for an entry without a dictionary, deletes) each entry under
+  // the identifier at the same position; the first failure is returned
+  // after the rest have been tried.
+  std::optional<QRVError> _onQueue_setCodeSigningDictionaryValues(const std::vector<QRVCodeSigningEntry>& entries,
+                                                                  const std::vector<std::string>& identifiers);
+  // The identifiers whose entitlements claim a system container; none when
+  // the database cannot be walked.
+  std::optional<std::set<std::string>> _onQueue_identifiersWithSystemContainer();
+  void _onQueue_migrateDataFromLegacyEntitlementsFileToCodeSigningFile();
+
+  // Outside the queue: they look containers up.
+  std::optional<QRVPlist> _entitlementsFromBundleContainer(const std::string& identifier);
+  void _reconcileSystemContainersWithCommandQueue(QRVCommandQueue& commandQueue);
+  void _migrateAppGroupIdsFromDataContainers();
+  void _migrateCachedCodeSigningInfoFromBundleContainersToMapping();
+  void _queueStageForDelete(QRVContainerIdentityRef identity, std::function<void(uint64_t)> onError,
+                            QRVCommandQueue& commandQueue);
 
   std::weak_ptr<QRVServices> services_;
   std::shared_ptr<QRVSerialQueue> queue_;

@@ -40,6 +40,24 @@ std::string describeException(std::exception_ptr exception) {
 
 sqlite3* QRVSQLiteDB::openDBWithURL(const std::filesystem::path& url) { return QRVSQLiteSchema::openDBWithURL(url); }
 
+sqlite3* QRVSQLiteDB::tryOpenDBWithURL(const std::filesystem::path& url, QRVError* error) {
+  return QRVSQLiteSchema::tryOpenDBWithURL(url, error);
+}
+
+std::unique_ptr<QRVSQLiteDB> QRVSQLiteDB::tryInitWithParentDirectoryURL(const std::filesystem::path& directory,
+                                                                        QRVError* error,
+                                                                        ExceptionReporter exceptionReporter) {
+  if (directory.empty()) {
+    QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidInput, "database directory cannot be empty"));
+    return nullptr;
+  }
+  std::filesystem::path url = directory / "containers";
+  url.replace_extension("sqlite3");
+  sqlite3* db = tryOpenDBWithURL(url, error);
+  if (!db) return nullptr;
+  return std::unique_ptr<QRVSQLiteDB>(new QRVSQLiteDB(db, std::move(url), std::move(exceptionReporter)));
+}
+
 std::unique_ptr<QRVSQLiteDB> QRVSQLiteDB::initWithParentDirectoryURL(const std::filesystem::path& directory,
                                                                      ExceptionReporter exceptionReporter) {
   if (directory.empty()) return nullptr;

@@ -59,11 +59,20 @@ class QRVSQLiteDB {
   // (unreadable, corrupt, held by another process) terminates the daemon,
   // because every entitlement decision depends on it.
   static sqlite3* openDBWithURL(const std::filesystem::path& url);
+  // The same without terminating: null with error 66 ("opening ... failed"
+  // or "table create for ... failed", both logged) when the file cannot be
+  // opened or set up.
+  static sqlite3* tryOpenDBWithURL(const std::filesystem::path& url, QRVError* error);
 
   // Opens "<directory>/containers.sqlite3". Returns null when no file name
   // can be built (an empty directory).
   static std::unique_ptr<QRVSQLiteDB> initWithParentDirectoryURL(
       const std::filesystem::path& directory, ExceptionReporter exceptionReporter = nullptr);
+  // The same for callers that can go on without the database: null with
+  // error 38 for an empty directory or the opening's error 66.
+  static std::unique_ptr<QRVSQLiteDB> tryInitWithParentDirectoryURL(const std::filesystem::path& directory,
+                                                                    QRVError* error,
+                                                                    ExceptionReporter exceptionReporter = nullptr);
 
   ~QRVSQLiteDB();
   QRVSQLiteDB(const QRVSQLiteDB&) = delete;

@@ -8,6 +8,8 @@
 
 #include <filesystem>
 
+#include "base/QRVError.h"
+
 struct sqlite3;
 
 namespace QRVSQLiteSchema {
@@ -16,6 +18,16 @@ namespace QRVSQLiteSchema {
 // script. Never returns null: a database that cannot be opened or set up
 // terminates the daemon (see QRVSQLiteDB::openDBWithURL).
 sqlite3* openDBWithURL(const std::filesystem::path& url);
+
+// Which step of opening failed.
+enum class OpenFailure { kNone, kOpen, kSchema };
+
+// The same, for callers that can go on without the database: null when the
+// file cannot be opened or the schema script fails (a corrupt file, one held
+// by another connection in exclusive locking mode), with error 66, the step
+// that failed and SQLite's result code. Nothing stays open on failure.
+sqlite3* tryOpenDBWithURL(const std::filesystem::path& url, QRVError* error, OpenFailure* failure = nullptr,
+                          int* sqliteResult = nullptr);
 
 // Note on the pragmas: journal_mode = WAL writes the header of a new file
 // before auto_vacuum = FULL runs, and SQLite only honours auto_vacuum on a

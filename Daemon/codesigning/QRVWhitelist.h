@@ -52,4 +52,27 @@ class QRVWhitelist : public QRVWellKnownNames {
   std::optional<std::string> wellknownContainerForId(const std::string& identifier, uint64_t containerClass);
   bool isLookupWhitelistedFromCodeSignIdentifier(const std::string& codeSignIdentifier, uint64_t containerClass,
                                                  const std::string& containerIdentifier) override;
+
+ private:
+  // A value of the code-sign mapping once its arrays are sets: none
+  // (anything), a set of identifiers, a dictionary of further values, or
+  // anything else (which matches nothing).
+  struct Node {
+    enum class Kind { kNone, kSet, kDictionary, kOther };
+    Kind kind = Kind::kOther;
+    std::set<std::string, std::less<>> set;
+    std::map<std::string, Node, std::less<>> dictionary;
+  };
+  static Node _convertArraysToSetsInNestedDictionary(const QRVPlist& value, int depth);
+  // Identifier -> directory name; a row whose name is not one plain path
+  // component is dropped (logged), so no name can lead out of its class
+  // directory.
+  static std::map<std::string, std::string, std::less<>> _directoryNames(const QRVPlist& mapping, const char* what);
+  static std::vector<std::string> _keys(const std::map<std::string, std::string, std::less<>>& mapping);
+
+  std::map<std::string, std::string, std::less<>> systemWhitelist_;
+  std::map<std::string, std::string, std::less<>> systemGroupWhitelist_;
+  // One set per class 0 to 13; a class without an entry has none.
+  std::vector<std::optional<std::set<std::string, std::less<>>>> whitelistedContainers_;
+  Node whitelistedCodeSignIdentifiers_;
 };

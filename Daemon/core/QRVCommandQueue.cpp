@@ -62,3 +62,8 @@ size_t QRVCommandQueue::pendingCount() {
   QRVMutexLock lock(&mutex_);
   return commands_.size();
 }
+
+std::vector<std::shared_ptr<QRVCommand>> QRVCommandQueue::TEST_pendingCommands() {
+  QRVMutexLock lock(&mutex_);
+  return std::vector<std::shared_ptr<QRVCommand>>(commands_.begin(), commands_.end());
+}

@@ -14,6 +14,7 @@
 #include <cstdint>
 #include <deque>
 #include <memory>
+#include <vector>
 
 #include "base/QRVMutex.h"
 #include "base/QRVSerialQueue.h"
@@ -44,6 +45,8 @@ class QRVCommandQueue {
   bool executeAllUntilExhaustedOrError(uint64_t* result);
 
   size_t pendingCount();
+  // The commands waiting, oldest first, for tests to inspect.
+  std::vector<std::shared_ptr<QRVCommand>> TEST_pendingCommands();
 
  private:
   std::shared_ptr<QRVSerialQueue> queue_;

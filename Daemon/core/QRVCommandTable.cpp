@@ -1,9 +1,11 @@
 #include "core/QRVCommandTable.h"
 
+#include "core/QRVCodeSigningHandlers.h"
 #include "core/QRVCommandHandlers.h"
 #include "core/QRVContainerHandlers.h"
 #include "core/QRVContentsHandlers.h"
 #include "core/QRVDeleteHandlers.h"
+#include "core/QRVGroupHandlers.h"
 
 namespace {
 
@@ -27,14 +29,14 @@ const QRVCommandTable kTable = {{
     {10, QRVHandleDeleteContainer,          kEntitlementAllowed,                R, _, _},  // deleteContainer
     {11, QRVHandleWipeContainerContent,     kEntitlementWipeContainer,          R, _, _},  // wipeContainerContent
     {12, QRVHandleDeleteContainerContent,   kEntitlementDeleteContainerContent, R, _, _},  // deleteContainerContent
-    {13, nullptr,                           kEntitlementAllowed,                R, A, L},  // createOrLookupGroupContainers
-    {14, nullptr,                           kEntitlementAllowed,                R, _, L},  // groupContainerIdentifiersForOwner
-    {15, nullptr,                           kEntitlementAllowed,                R, A, L},  // lookupSystemContainer
-    {16, nullptr,                           kEntitlementAllowed,                R, A, L},  // groupContainersForOwner
-    {17, nullptr,                           kEntitlementAllowed,                R, A, L},  // systemGroupContainerPath
-    {18, nullptr,                           kEntitlementAllowed,                R, _, _},  // processCodeSigningInfo
-    {19, nullptr,                           kEntitlementAllowed,                R, _, _},  // codeSigningInfoForIdentifier
-    {20, nullptr,                           kEntitlementAllowed,                R, _, _},  // invalidateCodeSigningInfoForAppsWithoutBundleContainer
+    {13, QRVHandleCreateOrLookupGroupContainers, kEntitlementAllowed,                R, A, L},  // createOrLookupGroupContainers
+    {14, QRVHandleGroupContainerIdentifiersForOwner, kEntitlementAllowed,                R, _, L},  // groupContainerIdentifiersForOwner
+    {15, QRVHandleLookupSystemContainer, kEntitlementAllowed,                R, A, L},  // lookupSystemContainer
+    {16, QRVHandleGroupContainersForOwner, kEntitlementAllowed,                R, A, L},  // groupContainersForOwner
+    {17, QRVHandleSystemGroupContainerPath, kEntitlementAllowed,                R, A, L},  // systemGroupContainerPath
+    {18, QRVHandleProcessCodeSigningInfo, kEntitlementAllowed,                R, _, _},  // processCodeSigningInfo
+    {19, QRVHandleCodeSigningInfoForIdentifier, kEntitlementAllowed,                R, _, _},  // codeSigningInfoForIdentifier
+    {20, QRVHandleInvalidateCodeSigningInfoForAppsWithoutBundleContainer, kEntitlementAllowed,                R, _, _},  // invalidateCodeSigningInfoForAppsWithoutBundleContainer
     {21, nullptr,                           kEntitlementAllowed,                _, _, _},  // setDataProtection
     {22, QRVHandleRecreateDefaultStructure, kEntitlementAllowed,                R, _, _},  // recreateDefaultStructureAgain
     {23, QRVHandleDiskUsage,                kEntitlementAllowed,                R, _, L},  // diskUsage

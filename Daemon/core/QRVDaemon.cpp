@@ -3,6 +3,7 @@
 #include <cstring>
 
 #include "base/QRVLog.h"
+#include "base/QRVResultCode.h"
 #include "core/QRVExceptionReporter.h"
 #include "platform/QRVNotificationService.h"
 
@@ -10,6 +11,16 @@ QRVDaemon::QRVDaemon(std::shared_ptr<QRVServices> services, Options options)
     : services_(std::move(services)), options_(options), dispatcher_(services_), upcallServer_(services_) {
   listenerQueue_ = QRVSerialQueue::create("com.kelva.quorvad.listener");
   mainQueue_ = QRVSerialQueue::create("com.kelva.quorvad.main");
+  // Every entitled caller's entitlements are offered to the mapping, which
+  // keeps them for identifiers that no installed code signature describes.
+  // A caller without a signing identifier has nothing to register under.
+  std::weak_ptr<QRVCodeSigningMapping> mapping = services_->codeSigningMapping;
+  dispatcher_.setRegisteredEntitlementsProcessor(
+      [mapping](const QRVPlist& entitlements, const std::string& identifier, QRVCommandQueue& queue) -> uint64_t {
+        std::shared_ptr<QRVCodeSigningMapping> m = mapping.lock();
+        if (!m || identifier.empty()) return QRVResultCode::kSuccess;
+        return m->processCallerRegisteredEntitlements(entitlements, identifier, queue);
+      });
 }
 
 QRVDaemon::StartResult QRVDaemon::start() {

@@ -1,5 +1,8 @@
 #include "core/QRVServices.h"
 
+#include "codesigning/QRVBuiltInWellKnownNames.h"
+#include "codesigning/QRVGroupManager.h"
+
 std::shared_ptr<QRVServices> QRVServices::make(const std::string& root, QRVPlatform platform) {
   auto s = std::make_shared<QRVServices>();
   s->platform = std::move(platform);
@@ -24,15 +27,19 @@ std::shared_ptr<QRVServices> QRVServices::make(const std::string& root, QRVPlatf
     return self->globalConfiguration->pathUnderRoot(path);
   };
   s->userIdentityCache = std::make_shared<QRVUserIdentityCache>(s->platform.personas, std::move(cacheOptions));
-  // The code-signing mapping, the data-protection manager and the well-known
-  // table are not connected yet: the seams that know nothing stand in.
-  s->codeSigning = std::make_shared<QRVNoCodeSigningQueries>();
+  // Before the container cache, which asks the mapping for plug-in parents.
+  // The mapping holds the services weakly: they own it.
+  s->codeSigningMapping = std::make_shared<QRVCodeSigningMapping>(std::weak_ptr<QRVServices>(s));
+  s->codeSigning = s->codeSigningMapping;
+  s->systemGroups = s->codeSigningMapping;
+  s->pluginParents = s->codeSigningMapping;
+  // The data-protection manager is not connected yet: the seam that knows
+  // nothing stands in.
   s->dataProtection = std::make_shared<QRVNoDataProtectionQueries>();
-  s->wellKnownNames = std::make_shared<QRVNoWellKnownNames>();
-  s->pluginParents = std::make_shared<QRVNoPluginParentResolver>();
-  s->systemGroups = std::make_shared<QRVNoSystemGroupQueries>();
+  s->wellKnownNames = std::make_shared<QRVBuiltInWellKnownNames>(s->globalConfiguration);
   s->containerCache = std::make_shared<QRVContainerCache>(s->fileManager, s->globalConfiguration, s->userIdentityCache,
                                                           s->platform.sandbox, s->pluginParents, s->wellKnownNames);
+  s->groupManager = std::make_shared<QRVGroupManager>(s);
   return s;
 }
 

@@ -6,6 +6,7 @@
 #include <memory>
 
 #include "base/QRVSerialQueue.h"
+#include "codesigning/QRVCodeSigningMapping.h"
 #include "core/QRVTestLocks.h"
 #include "fs/QRVFileManager.h"
 #include "model/QRVContainerCache.h"
@@ -14,6 +15,8 @@
 #include "operations/QRVContainerOperationSeams.h"
 #include "platform/QRVPlatform.h"
 #include "users/QRVUserIdentityCache.h"
+
+class QRVGroupManager;
 
 struct QRVServices {
   QRVPlatform platform;
@@ -30,15 +33,20 @@ struct QRVServices {
   std::shared_ptr<QRVSerialQueue> lockStateQueue;
   // Held and blocking points driven by the testability command.
   std::shared_ptr<QRVTestLocks> testLocks;
+  // The entitlements of installed and registered identifiers; it also
+  // answers the code-signing, system-group and plug-in-parent seams below.
+  std::shared_ptr<QRVCodeSigningMapping> codeSigningMapping;
 
-  // Components that arrive later, seen through the questions the container
-  // operations ask of them; until then these answer neutrally.
+  // The questions the container operations ask of other components. make()
+  // connects the real ones; tests may install their own.
   std::shared_ptr<QRVCodeSigningQueries> codeSigning;
   std::shared_ptr<QRVDataProtectionQueries> dataProtection;
   std::shared_ptr<QRVWellKnownNames> wellKnownNames;
   std::shared_ptr<QRVPluginParentResolver> pluginParents;
   // Which system group containers an identifier may stage shared content into.
   std::shared_ptr<QRVSystemGroupQueries> systemGroups;
+  // Group containers: which an owner claims, and the sweep of unclaimed ones.
+  std::shared_ptr<QRVGroupManager> groupManager;
 
   // Runs `job` on `queue` inside a keep-alive transaction, so the daemon is
   // not considered idle until it has finished.

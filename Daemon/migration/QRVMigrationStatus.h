@@ -49,6 +49,19 @@ class QRVMigrationStatus {
  private:
   QRVMigrationStatus(QRVServices& services, std::string path);
 
+  // The system-version dictionary now, with "ReleaseType" added from the
+  // release file's variant; none when the platform has no dictionary.
+  QRVPlist currentBuildInfo();
+  // False (logged) when the file exists but cannot be read or is not a
+  // dictionary; a missing file reads as an empty dictionary.
+  bool _readMigrationStatusFromDisk();
+  bool _writeMigrationStatusToDisk();
+  // Folds the marker files of older releases into the status file; they are
+  // removed only once the status file holding them has been written.
+  void _migrateFromManyMarkerFilesToOne();
+  void _readStatusFromMarkerFileWithName(const std::string& name, const std::string& type);
+  void _removeMarkerFileWithName(const std::string& name);
+
   QRVServices& services_;
   const std::string path_;
   QRVPlist migrationInfo_;

@@ -77,6 +77,22 @@ class QRVClientConnection {
   bool recreateDefaultStructureWithContainerIdentity(const QRVContainerIdentityRef& containerIdentity,
                                                      QRVError* error);
 
+  // ---- Group containers ----
+
+  // The group containers `ownerIdentifier` claims (application groups for
+  // class 7, system groups for class 13), keyed by group identifier, each
+  // created when missing. The caller must be the owner, may look up other
+  // identifiers, be unrestricted, hold a lookup entitlement for the class and
+  // owner, or be whitelisted for it (55 otherwise). Allows the caller group
+  // look-ups for the rest of the request. A group that cannot be created or
+  // looked up is logged and left out; the call still succeeds. An owner that
+  // claims nothing gets an empty map. Locking: a first pass under the global
+  // read lock only looks up; if a group is missing, a second pass under the
+  // global write lock reads the claims again and creates. Codes: 11, 40, 55.
+  std::optional<std::map<std::string, QRVMetadataRef>> groupContainersForOwnerIdentifier(
+      const std::optional<std::string>& ownerIdentifier, const QRVUserIdentityRef& userIdentity,
+      QRVContainerClass groupContainerClass, QRVError* error);
+
   // Whether the caller's lookup entitlement lists `identifier` for the class.
   bool isEntitledForLookupWithClass(QRVContainerClass containerClass, const std::string& identifier);
 

@@ -1,0 +1,115 @@
+// Application groups through the running daemon: the installer hands over
+// the code signing of two applications that share a group, each application
+// (its own process, known to the daemon by its executable) asks for its
+// groups, and the group lives exactly as long as one of them claims it.
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cstdio>
+#include <filesystem>
+
+#include "client/QRVContainerClient.h"
+#include "integration/QRVRunAs.h"
+#include "support/QRVDaemonTest.h"
+
+namespace fs = std::filesystem;
+
+namespace {
+
+constexpr uid_t kInstallerUID = 2301;
+constexpr uid_t kMobileUID = 501;
+constexpr const char* kGroup = "group.example.shared";
+
+class GroupsIntegrationTest : public QRVDaemonTest {
+ protected:
+  void SetUp() override {
+    if (geteuid() != 0) GTEST_SKIP() << "needs root: clients run under other uids";
+    // The two applications are copies of the command-line client: the trust
+    // store tells them apart by executable, as it would two installed apps.
+    for (const char* app : {"mail", "notes"}) {
+      std::string copy = daemon_.root() + "/apps/" + app;
+      fs::create_directories(fs::path(copy).parent_path());
+      fs::copy_file(QUORVACTL_BINARY, copy, fs::copy_options::overwrite_existing);
+      chmod(copy.c_str(), 0755);
+      daemon_.trustEntry(app, QRVPlist::dictionary()
+                                  .set("SigningIdentifier", QRVPlist::string(std::string("com.example.") + app))
+                                  .set("Executable", QRVPlist::string(copy))
+                                  .set("Entitlements", QRVPlist::dictionary()));
+    }
+    startDaemon({{kInstallerUID, "com.example.installer", QRVEntitlements({"allowed"})}});
+  }
+
+  // The installer's command 18 for `identifier`, from its own process, through
+  // the client library: the code, or 0 when no answer came.
+  uint64_t install(const std::string& identifier, std::optional<QRVPlist> info) {
+    std::string root = daemon_.root();
+    auto answer = QRVRunAs(kInstallerUID, kInstallerUID, [&] {
+      QRVClientError error;
+      auto client = QRVClient::connect(root, &error);
+      if (!client) return std::string("0");
+      QRVContainerClient containers(std::move(*client));
+      auto result = containers.processCodeSigningInfo(identifier, info, std::nullopt, &error);
+      return std::to_string(result ? result->code : 0);
+    });
+    return answer ? std::stoull(*answer) : 0;
+  }
+
+  // What the application `app`, running as the mobile user, is told its
+  // shared group's path is; "" when it got none.
+  std::string groupPathSeenBy(const std::string& app) {
+    std::string line =
+        daemon_.root() + "/apps/" + app + " --root " + daemon_.root() + " --json group-lookup --class 7 2>/dev/null";
+    auto out = QRVRunAs(kMobileUID, kMobileUID, [&] {
+      std::string text;
+      FILE* pipe = popen(line.c_str(), "r");
+      if (!pipe) return text;
+      char buffer[4096];
+      for (size_t n; (n = fread(buffer, 1, sizeof buffer, pipe)) > 0;) text.append(buffer, n);
+      pclose(pipe);
+      return text;
+    });
+    if (!out) return {};
+    const std::string key = std::string("\"") + kGroup + "\": \"";
+    size_t at = out->find(key);
+    if (at == std::string::npos || out->find("\"ReplyError\": 1") == std::string::npos) return {};
+    at += key.size();
+    return out->substr(at, out->find('"', at) - at);
+  }
+
+  std::string deathRow() const { return daemon_.root() + "/private/var/root/Library/Caches/com.kelva.quorvad/Dead"; }
+};
+
+QRVPlist claimingTheGroup() {
+  QRVPlist entitlements =
+      QRVPlist::dictionary().set("com.kelva.security.application-groups", QRVPlist::array({QRVPlist::string(kGroup)}));
+  return QRVPlist::dictionary().set("com.kelva.Quorva.Entitlements", std::move(entitlements));
+}
+
+}  // namespace
+
+TEST_F(GroupsIntegrationTest, TwoApplicationsShareTheirGroupUntilTheLastIsRemoved) {
+  ASSERT_EQ(install("com.example.mail", claimingTheGroup()), 1u);
+  ASSERT_EQ(install("com.example.notes", claimingTheGroup()), 1u);
+
+  const std::string mailPath = groupPathSeenBy("mail");
+  ASSERT_FALSE(mailPath.empty()) << daemon_.readLog();
+  EXPECT_TRUE(fs::is_directory(mailPath));
+  EXPECT_EQ(mailPath.rfind(daemon_.root() + "/private/var/mobile/Containers/", 0), 0u) << mailPath;
+  EXPECT_EQ(groupPathSeenBy("notes"), mailPath);
+
+  // Mail goes; notes still claims the group, which stays where it was.
+  ASSERT_EQ(install("com.example.mail", std::nullopt), 1u);
+  EXPECT_TRUE(fs::is_directory(mailPath));
+  EXPECT_EQ(groupPathSeenBy("notes"), mailPath);
+  EXPECT_EQ(groupPathSeenBy("mail"), "");  // nothing claimed any more
+
+  // Notes goes too: the group has no claimant and is taken out of service
+  // before the installer's reply.
+  ASSERT_EQ(install("com.example.notes", std::nullopt), 1u);
+  EXPECT_FALSE(fs::exists(mailPath));
+  const std::string onDeathRow = deathRow() + "/" + fs::path(mailPath).filename().string();
+  // Staging for deletion only moves it; death row is emptied on request.
+  EXPECT_TRUE(fs::is_directory(onDeathRow)) << daemon_.readLog();
+}
