@@ -19,4 +19,14 @@ class QRVTrustStore {
                                                                     QRVError* error) = 0;
   // The process's entitlements dictionary, or none when it has none.
   virtual std::optional<QRVPlist> entitlementsForAuditToken(const QRVAuditToken& token) = 0;
+  // For a live process that no trust-store entry matches: the absolute path
+  // of its executable as the kernel resolved it when the program started (no
+  // links, no "." or ".." components), so that the daemon can recognise
+  // programs that run from its bundle containers. None when the process is
+  // gone or the token no longer describes it, when an entry matches it, or
+  // when the path no longer names the file being run (deleted or replaced
+  // since). By default no executable is known.
+  virtual std::optional<std::string> executablePathForUnlistedAuditToken(const QRVAuditToken& token) {
+    return std::nullopt;
+  }
 };

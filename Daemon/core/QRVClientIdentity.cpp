@@ -2,6 +2,8 @@
 
 #include "base/QRVLog.h"
 #include "base/QRVMutex.h"
+#include "codesigning/QRVCodeSigningMapping.h"
+#include "core/QRVBundleExecutable.h"
 
 namespace {
 
@@ -32,7 +34,22 @@ std::shared_ptr<const QRVClientIdentity> QRVClientIdentity::clientIdentityWithRe
   QRVError error;
   std::optional<std::string> signingIdentifier =
       services.platform.trustStore->signingIdentifierForAuditToken(token, &error);
-  const bool isInstaller = signingIdentifier && *signingIdentifier == kInstallerIdentifier;
+  // A program that runs from a bundle container is that container's
+  // identifier, with the entitlements its code signing was installed with.
+  std::optional<QRVPlist> bundleEntitlements;
+  if (!signingIdentifier) {
+    std::optional<std::string> executable = services.platform.trustStore->executablePathForUnlistedAuditToken(token);
+    std::optional<QRVBundleExecutable::Owner> owner =
+        executable ? QRVBundleExecutable::ownerOfExecutablePath(*executable, services) : std::nullopt;
+    // The daemon's and the installer's names are never taken from a bundle.
+    if (owner && owner->identifier != kInstallerIdentifier && owner->identifier != kPrivilegedIdentifier) {
+      signingIdentifier = owner->identifier;
+      if (services.codeSigningMapping)
+        bundleEntitlements = services.codeSigningMapping->entitlementsForIdentifier(owner->identifier);
+      if (!bundleEntitlements || !bundleEntitlements->isDictionary()) bundleEntitlements = QRVPlist::dictionary();
+    }
+  }
+  const bool isInstaller = !bundleEntitlements && signingIdentifier && *signingIdentifier == kInstallerIdentifier;
 
   std::shared_ptr<const QRVClientIdentity> identity;
   bool cached = false;
@@ -44,7 +61,8 @@ std::shared_ptr<const QRVClientIdentity> QRVClientIdentity::clientIdentityWithRe
     }
   }
   if (!cached) {
-    std::optional<QRVPlist> entitlements = services.platform.trustStore->entitlementsForAuditToken(token);
+    std::optional<QRVPlist> entitlements =
+        bundleEntitlements ? bundleEntitlements : services.platform.trustStore->entitlementsForAuditToken(token);
     if (!entitlements || !entitlements->isDictionary()) {
       QRVLogError("Missing or malformed entitlements for pid {}", connection.pid());
       entitlements = QRVPlist::dictionary();
@@ -69,7 +87,7 @@ std::shared_ptr<const QRVClientIdentity> QRVClientIdentity::clientIdentityWithRe
 
 std::shared_ptr<const QRVClientIdentity> QRVClientIdentity::privilegedClientIdentityWithUserIdentity(
     QRVUserIdentityRef userIdentity) {
-  return std::make_shared<const QRVClientIdentity>("com.kelva.quorvad.internal", 0, 0, 0, std::move(userIdentity),
+  return std::make_shared<const QRVClientIdentity>(kPrivilegedIdentifier, 0, 0, 0, std::move(userIdentity),
                                                    QRVPlist::dictionary(), false, QRVAuditToken{});
 }
 

@@ -20,6 +20,8 @@ class QRVClientIdentity {
   // The signing identifier of the platform installer, whose identity is
   // kept between its (many, bursty) requests while its process lives.
   static constexpr const char* kInstallerIdentifier = "com.kelva.verdaned";
+  // The daemon acting for itself.
+  static constexpr const char* kPrivilegedIdentifier = "com.kelva.quorvad.internal";
 
   QRVClientIdentity(std::string bundleIdentifier, uid_t uid, gid_t gid, pid_t pid, QRVUserIdentityRef userIdentity,
                     QRVPlist entitlements, bool sandboxed, QRVAuditToken auditToken);

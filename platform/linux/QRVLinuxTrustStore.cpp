@@ -115,3 +115,18 @@ std::optional<QRVPlist> QRVLinuxTrustStore::entitlementsForAuditToken(const QRVA
   if (const Entry* e = match(token)) return e->entitlements;
   return std::nullopt;
 }
+
+std::optional<std::string> QRVLinuxTrustStore::executablePathForUnlistedAuditToken(const QRVAuditToken& token) {
+  {
+    QRVMutexLock lock(&mutex_);
+    if (match(token)) return std::nullopt;
+  }
+  std::optional<uint64_t> start = QRVProcInfo::startTime(token.pid());
+  if (!start || *start != token.startTime()) return std::nullopt;
+  std::optional<std::string> path = QRVProcInfo::executablePath(token.pid());
+  // The pid may have been reused while the link was read: the path counts
+  // only if the process that was asked about is still the one running.
+  start = QRVProcInfo::startTime(token.pid());
+  if (!start || *start != token.startTime()) return std::nullopt;
+  return path;
+}

@@ -23,6 +23,7 @@ class QRVLinuxTrustStore : public QRVTrustStore {
   std::optional<std::string> signingIdentifierForAuditToken(const QRVAuditToken& token,
                                                             QRVError* error) override;
   std::optional<QRVPlist> entitlementsForAuditToken(const QRVAuditToken& token) override;
+  std::optional<std::string> executablePathForUnlistedAuditToken(const QRVAuditToken& token) override;
 
  private:
   struct Entry {

@@ -1,6 +1,7 @@
 #include "platform/linux/QRVProcInfo.h"
 
 #include <sys/stat.h>
+#include <unistd.h>
 
 #include <cstdlib>
 #include <fstream>
@@ -42,6 +43,22 @@ std::optional<FileId> executable(pid_t pid) {
   struct stat st;
   if (stat(procPath(pid, "exe").c_str(), &st) != 0) return std::nullopt;
   return FileId{st.st_dev, st.st_ino};
+}
+
+std::optional<std::string> executablePath(pid_t pid) {
+  std::string link = procPath(pid, "exe");
+  std::string target(4096, '\0');
+  ssize_t length = readlink(link.c_str(), target.data(), target.size());
+  if (length <= 0 || static_cast<size_t>(length) >= target.size()) return std::nullopt;
+  target.resize(static_cast<size_t>(length));
+  if (target.front() != '/') return std::nullopt;
+  // The link names the file as it was reached at exec time; a file removed
+  // or renamed over since then must not be taken for what now lies there.
+  struct stat named;
+  std::optional<FileId> running = executable(pid);
+  if (!running || lstat(target.c_str(), &named) != 0 || !S_ISREG(named.st_mode)) return std::nullopt;
+  if (!(FileId{named.st_dev, named.st_ino} == *running)) return std::nullopt;
+  return target;
 }
 
 bool isSandboxed(pid_t pid) {

@@ -21,6 +21,10 @@ struct FileId {
   bool operator==(const FileId&) const = default;
 };
 std::optional<FileId> executable(pid_t pid);
+// The path of the process's executable (the target of /proc/<pid>/exe),
+// only while that path still names the very file being run: none for an
+// executable that was deleted, or replaced by another file at the same path.
+std::optional<std::string> executablePath(pid_t pid);
 
 // Runs with no_new_privs and a seccomp filter: how a sandboxed process shows.
 bool isSandboxed(pid_t pid);

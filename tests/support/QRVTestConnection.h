@@ -10,8 +10,10 @@
 
 class QRVTestConnection : public QRVConnection {
  public:
-  explicit QRVTestConnection(pid_t pid, uid_t uid = 501, gid_t gid = 501)
-      : pid_(pid), uid_(uid), gid_(gid), token_(QRVAuditToken::make(uid, gid, pid, 1)) {}
+  // `startTime` as in a real audit token, for tests whose peer is a live
+  // process.
+  explicit QRVTestConnection(pid_t pid, uid_t uid = 501, gid_t gid = 501, uint64_t startTime = 1)
+      : pid_(pid), uid_(uid), gid_(gid), token_(QRVAuditToken::make(uid, gid, pid, startTime)) {}
 
   pid_t pid() const override { return pid_; }
   uid_t euid() const override { return uid_; }

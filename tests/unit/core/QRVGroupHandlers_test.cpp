@@ -15,6 +15,7 @@
 #include "codesigning/QRVWhitelist.h"
 #include "core/QRVCommandTable.h"
 #include "core/QRVRelayDispatcher.h"
+#include "fs/QRVDictionaryAdditions.h"
 #include "support/QRVRequests.h"
 #include "support/QRVTestConnection.h"
 #include "support/QRVTestServices.h"
@@ -142,8 +143,11 @@ TEST_F(GroupHandlersTest, SystemGroupPathsOnlyForListedGroupsAndTheSharedOne) {
   EXPECT_EQ(code(send(kDaemon, path("systemgroup.other"))), 55u);
   // Listed but not well known: looked up, never made here.
   EXPECT_EQ(code(send(kDaemon, path("systemgroup.example"))), 21u);
-  // The shared group is nobody's to refuse; here it does not exist yet.
-  EXPECT_EQ(code(send(kMail, path(QRVWhitelist::kSharedSystemGroupIdentifier))), 21u);
+  // The shared group is nobody's to refuse, and being well known it is made
+  // on the first request, in a directory named after it.
+  QRVPlist shared = send(kMail, path(QRVWhitelist::kSharedSystemGroupIdentifier));
+  EXPECT_EQ(code(shared), 1u);
+  EXPECT_EQ(QRVLastPathComponent(shared.stringForKey("ReplyPath")), QRVWhitelist::kSharedSystemGroupIdentifier);
   const std::string text = readLog(log);
   EXPECT_NE(text.find("com.example.daemon is not entitled for system group identifier: systemgroup.other.  Only "
                       "entitled for: "),
