@@ -462,37 +462,77 @@ void QRVCodeSigningMapping::_onQueue_removeReferenceForGroupIdentifiers(
       });
 }
 
+QRVCodeSigningMapping::GroupList QRVCodeSigningMapping::_claimedGroups(const std::string& identifier,
+                                                                       const QRVCodeSigningEntry* entry,
+                                                                       QRVGroupType type) {
+  std::optional<QRVPlist> entitlements = entitlementsFromEntry(entry);
+  if (!entitlements) return std::nullopt;
+  const char* key = type == QRVGroupTypeApplication ? kQRVApplicationGroupsEntitlement : kQRVSystemGroupsEntitlement;
+  const QRVPlist* value = entitlements->get(key);
+  // Counted as the claims are read, so that whatever counts as a claim also
+  // keeps its group alive: one string is a list of one, and an identifier
+  // that lists a group twice still claims it once.
+  GroupList groups = type == QRVGroupTypeApplication ? copyGroupEntitlement(identifier, entitlements, key)
+                                                     : copySystemGroupEntitlement(identifier, entitlements);
+  if (type == QRVGroupTypeSystem && !groups) value = entitlements->get(kQRVSystemGroupContainersEntitlement);
+  if (!groups) {
+    if (value)
+      QRVLogError("identifier: {} has non-array type of group container IDs: {}", identifier, describeValue(value));
+    return std::nullopt;
+  }
+  QRVLogDebug("Entitlements for identifier {} references container IDs: {}", identifier, describeList(groups));
+  return groups;
+}
+
 std::optional<QRVGroupReferenceCounts> QRVCodeSigningMapping::_onQueue_copyReferenceCountSetOfType(QRVGroupType type) {
+  std::optional<QRVGroupReferenceCounts>& kept = referenceCounts_[type == QRVGroupTypeApplication ? 0 : 1];
+  if (kept) return kept;
   QRVSQLiteDB* db = _onQueue_db();
   if (!db) return std::nullopt;
   QRVGroupReferenceCounts counts;
   std::optional<QRVError> error = db->enumerateIdentifiersAndCodeSigningInfoUsingBlock(
       [&](const std::string& identifier, const std::shared_ptr<const QRVCodeSigningEntry>& entry) {
-        std::optional<QRVPlist> entitlements = entitlementsFromEntry(entry.get());
-        if (!entitlements) return;
-        const char* key =
-            type == QRVGroupTypeApplication ? kQRVApplicationGroupsEntitlement : kQRVSystemGroupsEntitlement;
-        const QRVPlist* value = entitlements->get(key);
-        // Counted as the claims are read, so that whatever counts as a
-        // claim also keeps its group alive: one string is a list of one, and
-        // an identifier that lists a group twice still claims it once.
-        GroupList groups = type == QRVGroupTypeApplication ? copyGroupEntitlement(identifier, entitlements, key)
-                                                           : copySystemGroupEntitlement(identifier, entitlements);
-        if (type == QRVGroupTypeSystem && !groups) value = entitlements->get(kQRVSystemGroupContainersEntitlement);
-        if (!groups) {
-          if (value)
-            QRVLogError("identifier: {} has non-array type of group container IDs: {}", identifier,
-                        describeValue(value));
-          return;
-        }
-        QRVLogDebug("Entitlements for identifier {} references container IDs: {}", identifier, describeList(groups));
-        for (const std::string& group : *groups) counts[group]++;
+        if (GroupList groups = _claimedGroups(identifier, entry.get(), type))
+          for (const std::string& group : *groups) counts[group]++;
       });
   if (error) {
     QRVLogError("Failed to enumerate code signing info: {}", error->description());
     return std::nullopt;
   }
-  return counts;
+  kept = std::move(counts);
+  return kept;
+}
+
+void QRVCodeSigningMapping::_onQueue_countWrite(const std::string& identifier, const QRVCodeSigningEntry* before,
+                                                const QRVCodeSigningEntry* after) {
+  for (QRVGroupType type : {QRVGroupTypeApplication, QRVGroupTypeSystem}) {
+    std::optional<QRVGroupReferenceCounts>& kept = referenceCounts_[type == QRVGroupTypeApplication ? 0 : 1];
+    if (!kept) continue;
+    if (GroupList groups = _claimedGroups(identifier, before, type)) {
+      for (const std::string& group : *groups) {
+        auto it = kept->find(group);
+        if (it == kept->end() || it->second <= 0) {
+          // The kept counts and the database disagree: trust the database.
+          QRVLogError("Reference count for {} was already 0 when {} dropped it; counting again", group, identifier);
+          kept.reset();
+          break;
+        }
+        if (--it->second == 0) kept->erase(it);
+      }
+    }
+    if (!kept) continue;
+    if (GroupList groups = _claimedGroups(identifier, after, type))
+      for (const std::string& group : *groups) (*kept)[group]++;
+  }
+}
+
+void QRVCodeSigningMapping::_onQueue_forgetReferenceCounts() {
+  referenceCounts_[0].reset();
+  referenceCounts_[1].reset();
+}
+
+void QRVCodeSigningMapping::TEST_forgetReferenceCounts() {
+  queue_->sync([&] { _onQueue_forgetReferenceCounts(); });
 }
 
 std::optional<QRVError> QRVCodeSigningMapping::_onQueue_setCodeSigningDictionaryValues(
@@ -518,6 +558,7 @@ std::optional<QRVError> QRVCodeSigningMapping::_onQueue_setCodeSigningDictionary
     if (!entry.hasCodeSigningInfo()) {
       if (!stored) continue;
       if (db->deleteCodeSigningEntryWithIdentifier(identifier, &error)) {
+        _onQueue_countWrite(identifier, stored.get(), nullptr);
         QRVLogNotice("Deleted Code Signing Mapping for ID: {}", identifier);
       } else {
         QRVLogError("Failed to delete code signing mapping for ID: {} : {}", identifier, error.description());
@@ -525,6 +566,7 @@ std::optional<QRVError> QRVCodeSigningMapping::_onQueue_setCodeSigningDictionary
       }
     } else if (!stored || *stored != entry) {
       if (db->addCodeSigningEntry(&entry, identifier, &error)) {
+        _onQueue_countWrite(identifier, stored.get(), &entry);
         QRVLogNotice("Set Code Signing Mapping for ID: {} : {}", identifier, entry.description());
       } else {
         QRVLogError("Failed to set code signing mapping for ID: {} : {}", identifier, error.description());
@@ -607,7 +649,9 @@ std::optional<QRVPlist> QRVCodeSigningMapping::_entitlementsFromBundleContainer(
     QRVError readError;
     if (db->codeSigningEntryWithIdentifier(identifier, &readError) || !isNotFound(readError)) return;
     QRVError writeError;
-    if (!db->addCodeSigningEntry(&entry, identifier, &writeError))
+    if (db->addCodeSigningEntry(&entry, identifier, &writeError))
+      _onQueue_countWrite(identifier, nullptr, &entry);
+    else
       QRVLogError("Failed to write code signing info to DB for {} : {}", identifier, writeError.description());
   });
   return entitlementsFromInfo(info);
@@ -734,6 +778,7 @@ bool QRVCodeSigningMapping::removeAllAdvanceCopiesWithError(QRVError* error) {
       return;
     }
     ok = db->deleteAllAdvanceCopiesOfCodeSigningEntriesWithError(error);
+    _onQueue_forgetReferenceCounts();
   });
   return ok;
 }
@@ -913,7 +958,9 @@ void QRVCodeSigningMapping::_onQueue_migrateDataFromLegacyEntitlementsFileToCode
     entry.setRegisteredByCaller(registeredByCaller);
     entry.setPlaceholder(placeholder);
     QRVError addError;
-    if (!db->addCodeSigningEntry(&entry, identifier, &addError))
+    if (db->addCodeSigningEntry(&entry, identifier, &addError))
+      _onQueue_countWrite(identifier, nullptr, &entry);
+    else
       QRVLogError("Failed to migrate code signing entry for {} : {}", identifier, addError.description());
   };
   const QRVPlist* registered = legacy->get("com.kelva.Quorva.EntitlementsRegisteredByCaller");
@@ -988,7 +1035,9 @@ void QRVCodeSigningMapping::_migrateAppGroupIdsFromDataContainers() {
         QRVCodeSigningEntry entry(wrapped, dataClass);
         entry.setPlaceholder(true);
         QRVError addError;
-        if (!db->addCodeSigningEntry(&entry, identifier, &addError))
+        if (db->addCodeSigningEntry(&entry, identifier, &addError))
+          _onQueue_countWrite(identifier, nullptr, &entry);
+        else
           QRVLogError("Failed to migrate code signing entry for {} : {}", identifier, addError.description());
       });
       QRVError clearError;
@@ -1043,6 +1092,7 @@ void QRVCodeSigningMapping::_migrateCachedCodeSigningInfoFromBundleContainersToM
         QRVCodeSigningEntry entry(copy, QRVContainerClassAppData);
         QRVError addError;
         stored = db->addCodeSigningEntry(&entry, identifier, &addError);
+        if (stored) _onQueue_countWrite(identifier, nullptr, &entry);
         if (!stored)
           QRVLogError("Failed to migrate code signing entry for {} : {}", identifier, addError.description());
       });

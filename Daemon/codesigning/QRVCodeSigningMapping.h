@@ -120,6 +120,9 @@ class QRVCodeSigningMapping : public QRVCodeSigningQueries,
   // How many entries claim each group of `type`; none when the database
   // cannot be walked.
   std::optional<QRVGroupReferenceCounts> copyReferenceCountSetOfType(QRVGroupType type);
+  // Drops the kept counts, so that the next call walks the database: tests
+  // compare the kept counts with a fresh walk.
+  void TEST_forgetReferenceCounts();
 
   // ---- Seams the container operations and the cache use ----
   bool identifierHasSystemContainer(const std::string& identifier) override;
@@ -175,7 +178,20 @@ class QRVCodeSigningMapping : public QRVCodeSigningQueries,
                                                      QRVGroupType type, QRVCommandQueue& commandQueue);
   void _onQueue_removeReferenceForGroupIdentifiers(const std::vector<std::string>& groupIdentifiers, QRVGroupType type,
                                                    QRVCommandQueue& commandQueue);
+  // The counted set of a type: kept current by every write below, built by
+  // one walk of the database when first needed (or after a write whose
+  // effect on the claims is not followed one by one).
   std::optional<QRVGroupReferenceCounts> _onQueue_copyReferenceCountSetOfType(QRVGroupType type);
+  // The groups of `type` that one stored entry claims, as the counts see
+  // them; none when it claims none.
+  static GroupList _claimedGroups(const std::string& identifier, const QRVCodeSigningEntry* entry, QRVGroupType type);
+  // After `identifier`'s entry went from `before` to `after` in the
+  // database (either may be null: none stored).
+  void _onQueue_countWrite(const std::string& identifier, const QRVCodeSigningEntry* before,
+                           const QRVCodeSigningEntry* after);
+  // After a write the counts do not follow: they are walked again at the
+  // next need.
+  void _onQueue_forgetReferenceCounts();
   // Writes (or, for an entry without a dictionary, deletes) each entry under
   // the identifier at the same position; the first failure is returned
   // after the rest have been tried.
@@ -197,4 +213,8 @@ class QRVCodeSigningMapping : public QRVCodeSigningQueries,
   std::weak_ptr<QRVServices> services_;
   std::shared_ptr<QRVSerialQueue> queue_;
   std::unique_ptr<QRVSQLiteDB> db_;  // opened on first use; on queue_ only
+  // Counted sets by group type, on queue_ only. A change of one identifier
+  // must not read every row of the database (the counts decide whether it
+  // was a group's last claimant), so they are kept beside it.
+  std::optional<QRVGroupReferenceCounts> referenceCounts_[2];
 };

@@ -12,6 +12,7 @@
 #include <fstream>
 #include <future>
 #include <iterator>
+#include <random>
 #include <thread>
 
 #include "codesigning/QRVSQLiteSchema.h"
@@ -511,6 +512,70 @@ TEST_F(QRVCodeSigningMappingTest, BootCarriesOlderMetadataIntoTheDatabaseOnceAnd
   QRVCommandQueue second;
   mapping().performAllCodeSigningMigrationAndReconciliationWithCommandQueue(second);
   EXPECT_EQ(second.pendingCount(), 0u);
+}
+
+}  // namespace
+
+namespace {
+
+// The kept counts after a long run of mixed changes must be what a walk of
+// the database finds, for both group types: a count that drifts would let a
+// group's container be deleted while it is still claimed, or kept forever.
+TEST_F(QRVCodeSigningMappingTest, KeptCountsAlwaysEqualAFreshWalk) {
+  std::mt19937 random(20261123);
+  auto pick = [&](int n) { return static_cast<int>(random() % static_cast<unsigned>(n)); };
+  auto groups = [&](const char* prefix, int max) {
+    Strings out;
+    for (int k = pick(max + 1); k > 0; k--) out.push_back(prefix + std::to_string(pick(6)));
+    return out;
+  };
+  auto compare = [&](int step) {
+    auto kept = std::make_pair(mapping().copyReferenceCountSetOfType(QRVGroupTypeApplication),
+                               mapping().copyReferenceCountSetOfType(QRVGroupTypeSystem));
+    mapping().TEST_forgetReferenceCounts();
+    auto walked = std::make_pair(mapping().copyReferenceCountSetOfType(QRVGroupTypeApplication),
+                                 mapping().copyReferenceCountSetOfType(QRVGroupTypeSystem));
+    ASSERT_TRUE(kept.first && kept.second && walked.first && walked.second);
+    EXPECT_EQ(*kept.first, *walked.first) << "application groups after step " << step;
+    EXPECT_EQ(*kept.second, *walked.second) << "system groups after step " << step;
+  };
+  compare(-1);  // builds the counts, which every change below must keep up
+  for (int step = 0; step < 300; step++) {
+    QRVCommandQueue queue;
+    const std::string id = "com.example.app" + std::to_string(pick(12));
+    switch (pick(6)) {
+      case 0:  // removed, with its children
+        mapping().removeCodeSigningDictionariesForIdentifierAndItsChildren(id, queue);
+        break;
+      case 1: {  // one string instead of an array, and a malformed list
+        QRVPlist e = QRVPlist::dictionary();
+        e.set(kQRVApplicationGroupsEntitlement, QRVPlist::string("group.one" + std::to_string(pick(3))));
+        if (pick(2)) e.set(kQRVSystemGroupsEntitlement, QRVPlist::uinteger(7));
+        mapping().processCodeSigningInfo(info(e), id, QRVPlist(), queue);
+        break;
+      }
+      case 2:  // a caller's registration
+        mapping().processCallerRegisteredEntitlements(entitlements(groups("group.reg", 2)), id, queue);
+        break;
+      case 3:  // a placeholder or advance copy, later swept
+        mapping().processCodeSigningInfo(
+            info(entitlements(groups("group.", 3))), id,
+            option(pick(2) ? kQRVPlaceholderOption : kQRVAdvanceCopyOption, QRVPlist::boolean(true)), queue);
+        if (pick(4) == 0) ASSERT_TRUE(mapping().removeAllAdvanceCopiesWithError(nullptr));
+        break;
+      case 4:  // a plug-in of another application
+        mapping().processCodeSigningInfo(info(entitlements(groups("group.", 2))), id + ".plugin",
+                                         option(kQRVParentBundleIDOption, QRVPlist::string(id)), queue);
+        break;
+      default:  // installed or updated, with system groups and a fallback key
+        QRVPlist e = entitlements(groups("group.", 4), groups("systemgroup.s", 2));
+        if (pick(3) == 0) e.set(kQRVSystemGroupContainersEntitlement, stringArray({"systemgroup.fallback"}));
+        mapping().processCodeSigningInfo(info(e), id, QRVPlist(), queue);
+        break;
+    }
+    if (step % 25 == 0) compare(step);
+  }
+  compare(300);
 }
 
 }  // namespace
