@@ -46,7 +46,6 @@ void QRVClientConnection::quorvaSetup() {
   QRVError error;
   if (!_recoverFromReplaceOperationsWithError(&error))
     QRVLogError("Failed recovering from replace operations: {}", error.description());
-  QRVLogNotice("boot set-up: no code-signing reconciliation is built yet");
 }
 
 void QRVClientConnection::rebootQuorvaCleanupWithCompletion(std::function<void()> completion) {

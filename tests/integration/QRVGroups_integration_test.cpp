@@ -21,6 +21,13 @@ namespace {
 constexpr uid_t kInstallerUID = 2301;
 constexpr uid_t kMobileUID = 501;
 constexpr const char* kGroup = "group.example.shared";
+constexpr const char* kToolGroup = "group.example.tool";
+
+QRVPlist claimingTheGroup(const char* group = kGroup) {
+  QRVPlist entitlements =
+      QRVPlist::dictionary().set("com.kelva.security.application-groups", QRVPlist::array({QRVPlist::string(group)}));
+  return QRVPlist::dictionary().set("com.kelva.Quorva.Entitlements", std::move(entitlements));
+}
 
 class GroupsIntegrationTest : public QRVDaemonTest {
  protected:
@@ -38,6 +45,16 @@ class GroupsIntegrationTest : public QRVDaemonTest {
                                   .set("Executable", QRVPlist::string(copy))
                                   .set("Entitlements", QRVPlist::dictionary()));
     }
+    // A tool that is not installed by the installer: its groups are what its
+    // own entitlements claim, registered by the daemon when it calls.
+    std::string tool = daemon_.root() + "/apps/tool";
+    fs::copy_file(QUORVACTL_BINARY, tool, fs::copy_options::overwrite_existing);
+    chmod(tool.c_str(), 0755);
+    daemon_.trustEntry("tool",
+                       QRVPlist::dictionary()
+                           .set("SigningIdentifier", QRVPlist::string("com.example.tool"))
+                           .set("Executable", QRVPlist::string(tool))
+                           .set("Entitlements", *claimingTheGroup(kToolGroup).get("com.kelva.Quorva.Entitlements")));
     startDaemon({{kInstallerUID, "com.example.installer", QRVEntitlements({"allowed"})}});
   }
 
@@ -58,7 +75,7 @@ class GroupsIntegrationTest : public QRVDaemonTest {
 
   // What the application `app`, running as the mobile user, is told its
   // shared group's path is; "" when it got none.
-  std::string groupPathSeenBy(const std::string& app) {
+  std::string groupPathSeenBy(const std::string& app, const char* group = kGroup) {
     std::string line =
         daemon_.root() + "/apps/" + app + " --root " + daemon_.root() + " --json group-lookup --class 7 2>/dev/null";
     auto out = QRVRunAs(kMobileUID, kMobileUID, [&] {
@@ -71,7 +88,7 @@ class GroupsIntegrationTest : public QRVDaemonTest {
       return text;
     });
     if (!out) return {};
-    const std::string key = std::string("\"") + kGroup + "\": \"";
+    const std::string key = std::string("\"") + group + "\": \"";
     size_t at = out->find(key);
     if (at == std::string::npos || out->find("\"ReplyError\": 1") == std::string::npos) return {};
     at += key.size();
@@ -80,12 +97,6 @@ class GroupsIntegrationTest : public QRVDaemonTest {
 
   std::string deathRow() const { return daemon_.root() + "/private/var/root/Library/Caches/com.kelva.quorvad/Dead"; }
 };
-
-QRVPlist claimingTheGroup() {
-  QRVPlist entitlements =
-      QRVPlist::dictionary().set("com.kelva.security.application-groups", QRVPlist::array({QRVPlist::string(kGroup)}));
-  return QRVPlist::dictionary().set("com.kelva.Quorva.Entitlements", std::move(entitlements));
-}
 
 }  // namespace
 
@@ -112,4 +123,18 @@ TEST_F(GroupsIntegrationTest, TwoApplicationsShareTheirGroupUntilTheLastIsRemove
   const std::string onDeathRow = deathRow() + "/" + fs::path(mailPath).filename().string();
   // Staging for deletion only moves it; death row is emptied on request.
   EXPECT_TRUE(fs::is_directory(onDeathRow)) << daemon_.readLog();
+}
+
+TEST_F(GroupsIntegrationTest, ACallersOwnEntitlementsCountUntilTheInstallerSpeaksForIt) {
+  // Never installed: the tool's trust-store entitlements are registered as
+  // it calls, and its group follows from them.
+  const std::string toolPath = groupPathSeenBy("tool", kToolGroup);
+  ASSERT_FALSE(toolPath.empty()) << daemon_.readLog();
+  EXPECT_TRUE(fs::is_directory(toolPath));
+
+  // Once the installer has handed over the tool's code signing (claiming the
+  // shared group instead), the tool's own registration no longer overrides it.
+  ASSERT_EQ(install("com.example.tool", claimingTheGroup()), 1u);
+  EXPECT_FALSE(groupPathSeenBy("tool", kGroup).empty()) << daemon_.readLog();
+  EXPECT_EQ(groupPathSeenBy("tool", kToolGroup), "");
 }
