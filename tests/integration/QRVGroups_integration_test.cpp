@@ -9,6 +9,7 @@
 
 #include <cstdio>
 #include <filesystem>
+#include <fstream>
 
 #include "client/QRVContainerClient.h"
 #include "integration/QRVRunAs.h"
@@ -137,4 +138,48 @@ TEST_F(GroupsIntegrationTest, ACallersOwnEntitlementsCountUntilTheInstallerSpeak
   ASSERT_EQ(install("com.example.tool", claimingTheGroup()), 1u);
   EXPECT_FALSE(groupPathSeenBy("tool", kGroup).empty()) << daemon_.readLog();
   EXPECT_EQ(groupPathSeenBy("tool", kToolGroup), "");
+}
+
+namespace {
+
+// A code-signing database that is not a database at all: the daemon must go
+// on serving containers, answer the requests that need the database with a
+// clear code, and use the database once it can be opened.
+class DamagedDatabaseIntegrationTest : public GroupsIntegrationTest {
+ protected:
+  void SetUp() override {
+    if (geteuid() != 0) GTEST_SKIP() << "needs root: clients run under other uids";
+    fs::create_directories(fs::path(database()).parent_path());
+    std::ofstream(database()) << std::string(8192, '\x5a');
+    GroupsIntegrationTest::SetUp();
+  }
+  std::string database() const { return daemon_.root() + "/private/var/root/Library/Quorva/containers.sqlite3"; }
+};
+
+}  // namespace
+
+TEST_F(DamagedDatabaseIntegrationTest, ContainersAreStillServedAndTheDatabaseIsUsedOnceItOpens) {
+  EXPECT_EQ(install("com.example.mail", claimingTheGroup()), 66u) << daemon_.readLog();
+  // Containers do not depend on the database: the application gets its own
+  // data container, and asking for its groups is an answer, not a failure.
+  const std::string line = daemon_.root() + "/apps/mail --root " + daemon_.root() +
+                           " --json lookup --id com.example.mail --class 2 --create 2>/dev/null";
+  auto out = QRVRunAs(kMobileUID, kMobileUID, [&] {
+    std::string text;
+    if (FILE* pipe = popen(line.c_str(), "r")) {
+      char buffer[4096];
+      for (size_t n; (n = fread(buffer, 1, sizeof buffer, pipe)) > 0;) text.append(buffer, n);
+      pclose(pipe);
+    }
+    return text;
+  });
+  ASSERT_TRUE(out.has_value());
+  EXPECT_NE(out->find("\"ReplyError\": 1"), std::string::npos) << *out << daemon_.readLog();
+  EXPECT_NE(daemon_.readLog().find("Failed to initialize database."), std::string::npos);
+
+  // The damaged file is taken away (as an operator would): the next request
+  // that needs the database opens a fresh one.
+  fs::remove(database());
+  ASSERT_EQ(install("com.example.mail", claimingTheGroup()), 1u) << daemon_.readLog();
+  EXPECT_FALSE(groupPathSeenBy("mail").empty()) << daemon_.readLog();
 }
