@@ -62,8 +62,7 @@ void QRVGroupManager::reconcileGroupContainersOfType(QRVGroupType type, QRVComma
         // asking the cache would create the user's class directory.
         auto perUser = services->globalConfiguration->getPerUserConfigurationForUserIdentity(userIdentity);
         if (!perUser || !perUser->existsUserBaseDirectory()) return;
-        QRVGroupReferenceCounts ownCopy = *counts;
-        _cleanupUnreferencedGroupContainersForUserIdentity(userIdentity, QRVContainerClassAppGroup, ownCopy,
+        _cleanupUnreferencedGroupContainersForUserIdentity(userIdentity, QRVContainerClassAppGroup, *counts,
                                                            commandQueue);
       });
 }
