@@ -58,6 +58,10 @@ struct QRVDirectoryEntry {
   int level;                // 0 for the starting point
   const struct stat* stat;  // the entry's own (link) status
   int errnum;               // for kUnreadableDirectory
+  // Only in walks that never follow links: an open descriptor of exactly this
+  // directory or regular file, to act on it without naming it by path again;
+  // -1 for every other kind. It is the walk's, valid during the call.
+  int fd = -1;
 };
 
 class QRVFileManager {
@@ -114,6 +118,24 @@ class QRVFileManager {
   // Called for each entry of a walk; returning false ends the walk, and what
   // the block stored through its error argument becomes the walk's error.
   using TraversalBlock = std::function<bool(const QRVDirectoryEntry& entry, QRVError* error)>;
+
+  // Walks `url` and everything below it, to any depth, fd-relative: every
+  // entry is examined and opened relative to its directory's descriptor and
+  // never through a link (O_NOFOLLOW), so that a link or a directory an
+  // application swaps in while the walk runs is never followed out of the
+  // tree. Entries arrive as with the path walk (pre-order, directories again
+  // after their contents, a mount point visited but not entered, a directory
+  // whose contents cannot be read as kUnreadableDirectory instead of its
+  // post-order visit), directories and regular files with `fd` set. Entries
+  // that vanish (or turn into a link) between listing and opening are left
+  // out: they are not errors. What is delivered is what the descriptor shows,
+  // not what the listing said. At most a fixed number of directory
+  // descriptors stay open however deep the tree; an ancestor closed on the
+  // way down is opened again through ".." and must be the same directory,
+  // otherwise (it was moved during the walk) the walk fails with ESTALE. A
+  // `url` that does not exist is an empty walk; a `url` that cannot be
+  // examined fails with its errno.
+  bool traverseItemAtURLWithoutFollowingLinks(const std::string& url, QRVError* error, const TraversalBlock& block);
 
   // ---- Creation ----
 
@@ -182,6 +204,10 @@ class QRVFileManager {
                                          const std::function<bool(uint32_t currentClass)>& ifPredicate,
                                          QRVError* error);
   bool dataProtectionClassOfItemAtURL(const std::string& url, uint32_t* protectionClass, QRVError* error);
+  // The same on the item open at `fd` (a walk's entry); `path` only words
+  // errors and log lines.
+  bool setDataProtectionClassOfOpenItem(int fd, const std::string& path, uint32_t toClass,
+                                        const std::function<bool(uint32_t currentClass)>& ifPredicate, QRVError* error);
 
   // ---- Ownership and ACLs ----
 
@@ -304,6 +330,7 @@ class QRVFileManager {
   int _makeDirectory(const std::string& path, mode_t mode, bool* created);
   int _makePath(const std::string& path, mode_t mode, bool* created);
   struct Walk;
+  struct DescriptorWalk;
   bool _walk(Walk* walk, const std::string& path, int level, const struct stat& st);
 
   const std::string root_;

@@ -58,22 +58,23 @@ bool QRVFileManager::setDataProtectionClassOfItemAtURL(const std::string& url, u
   int fd = -1;
   if (int e = _open(url, kOpenItemFlags, &fd))
     return QRVFail(error, QRV_POSIX_ERROR(e, "Failed to open {} : {}", url, errnoText(e)));
+  bool ok = setDataProtectionClassOfOpenItem(fd, url, toClass, ifPredicate, error);
+  _close(fd);
+  return ok;
+}
+
+bool QRVFileManager::setDataProtectionClassOfOpenItem(int fd, const std::string& path, uint32_t toClass,
+                                                      const std::function<bool(uint32_t)>& ifPredicate,
+                                                      QRVError* error) {
   if (ifPredicate) {
     uint32_t current = 0;
-    if (int e = extras_->protectionClass(fd, &current)) {
-      _close(fd);
-      return QRVFail(error, QRV_POSIX_ERROR(e, "Failed to getclass of file {}: {}", url, errnoText(e)));
-    }
-    if (!ifPredicate(current)) {
-      _close(fd);
-      return true;
-    }
+    if (int e = extras_->protectionClass(fd, &current))
+      return QRVFail(error, QRV_POSIX_ERROR(e, "Failed to getclass of file {}: {}", path, errnoText(e)));
+    if (!ifPredicate(current)) return true;
   }
-  int e = extras_->setProtectionClass(fd, toClass);
-  _close(fd);
-  if (e)
+  if (int e = extras_->setProtectionClass(fd, toClass))
     return QRVFail(error, QRV_POSIX_ERROR(e, "Failed to setclass({}) on file {}: {}", static_cast<int32_t>(toClass),
-                                          url, errnoText(e)));
+                                          path, errnoText(e)));
   return true;
 }
 
