@@ -561,7 +561,9 @@ TEST_F(QRVCodeSigningMappingTest, KeptCountsAlwaysEqualAFreshWalk) {
         mapping().processCodeSigningInfo(
             info(entitlements(groups("group.", 3))), id,
             option(pick(2) ? kQRVPlaceholderOption : kQRVAdvanceCopyOption, QRVPlist::boolean(true)), queue);
-        if (pick(4) == 0) ASSERT_TRUE(mapping().removeAllAdvanceCopiesWithError(nullptr));
+        if (pick(4) == 0) {
+          ASSERT_TRUE(mapping().removeAllAdvanceCopiesWithError(nullptr));
+        }
         break;
       case 4:  // a plug-in of another application
         mapping().processCodeSigningInfo(info(entitlements(groups("group.", 2))), id + ".plugin",

@@ -91,8 +91,9 @@ TEST_F(FileManagerWalkTest, AnyDepthWithBoundedDescriptorsAndAnAncestorMovedAway
                                                             postOrder += e.kind == Kind::kDirectoryPostOrder;
                                                             // A hundred levels down, far fewer descriptors than levels
                                                             // are open.
-                                                            if (e.kind == Kind::kRegularFile)
+                                                            if (e.kind == Kind::kRegularFile) {
                                                               EXPECT_LT(openDescriptors() - before, 40);
+                                                            }
                                                             return true;
                                                           }))
       << error.description();
