@@ -20,6 +20,7 @@
 #include "core/QRVCommandStageForDelete.h"
 #include "migration/QRVMigrationStatus.h"
 #include "support/QRVContainerTest.h"
+#include "support/QRVLogCapture.h"
 
 namespace fs = std::filesystem;
 using ::testing::ElementsAre;
@@ -76,18 +77,6 @@ Strings staged(QRVCommandQueue& queue, bool withLocking = true) {
   return out;
 }
 
-struct LogCapture {
-  explicit LogCapture(const fs::path& dir) : path(dir / "capture.log") {
-    QRVLog::open("com.kelva.quorvad.test", path.string(), QRVLogLevel::kDebug, 1, 1 << 22);
-  }
-  ~LogCapture() { QRVLog::close(); }
-  std::string text() const {
-    std::ifstream in(path);
-    return std::string(std::istreambuf_iterator<char>(in), {});
-  }
-  const fs::path path;
-};
-
 class QRVCodeSigningMappingTest : public QRVContainerTest {
  protected:
   QRVCodeSigningMappingTest() {
@@ -122,7 +111,7 @@ class QRVCodeSigningMappingTest : public QRVContainerTest {
 };
 
 TEST_F(QRVCodeSigningMappingTest, IdenticalInformationWritesAndDeletesNothing) {
-  LogCapture log(env_.root.path());
+  QRVLogCapture log(env_.root.path());
   QRVPlist i = info(entitlements({"group.a"}, {"systemgroup.s"}, true));
   ASSERT_EQ(process("com.example.app", i, queue_, option(kQRVDataContainerClassOption, QRVPlist::uinteger(2))), 1u);
   EXPECT_THAT(log.text(), HasSubstr("Set Code Signing Mapping for ID: com.example.app"));
@@ -148,7 +137,7 @@ TEST_F(QRVCodeSigningMappingTest, IdenticalInformationWritesAndDeletesNothing) {
 
 TEST_F(QRVCodeSigningMappingTest, TheLastClaimantStagesTheGroupForEveryUserWithABaseDirectory) {
   prepareUsers();
-  LogCapture log(env_.root.path());
+  QRVLogCapture log(env_.root.path());
   ASSERT_EQ(process("com.example.a", info(entitlements({"group.shared", "group.mine", "group.other"})), queue_), 1u);
   // Still claimed by a placeholder and by an invalidated entry.
   ASSERT_EQ(process("com.example.placeholder", info(entitlements({"group.shared"})), queue_,
@@ -187,7 +176,7 @@ TEST_F(QRVCodeSigningMappingTest, TheLastClaimantStagesTheGroupForEveryUserWithA
 }
 
 TEST_F(QRVCodeSigningMappingTest, SystemClaimsSystemGroupsAndThePrefixRule) {
-  LogCapture log(env_.root.path());
+  QRVLogCapture log(env_.root.path());
   QRVPlist e = entitlements({"noprefix.group"}, {"systemgroup.kept", "noprefix.group"}, true);
   ASSERT_EQ(process("com.example.daemon", info(e), queue_), 1u);
   EXPECT_THAT(mapping().systemGroupIdentifiersForIdentifier("com.example.daemon"), ElementsAre("systemgroup.kept"));
@@ -263,7 +252,7 @@ TEST_F(QRVCodeSigningMappingTest, CallerRegistrationNeverOverwritesInstallerInfo
 }
 
 TEST_F(QRVCodeSigningMappingTest, BundleContainerCopyIsMigratedOnDemand) {
-  LogCapture log(env_.root.path());
+  QRVLogCapture log(env_.root.path());
   auto bundle = identity("com.example.old", QRVContainerClassAppBundle);
   create(bundle);
   QRVPlist cached = QRVPlist::dictionary();
@@ -311,7 +300,7 @@ TEST_F(QRVCodeSigningMappingTest, OrphansAreInvalidatedAndHiddenFromExternalRequ
 }
 
 TEST_F(QRVCodeSigningMappingTest, AnUnusableDatabaseNeitherStopsTheDaemonNorLosesData) {
-  LogCapture log(env_.root.path());
+  QRVLogCapture log(env_.root.path());
   // Garbage where the database should be.
   {
     std::ofstream out(dbPath(), std::ios::binary);
@@ -336,7 +325,7 @@ TEST_F(QRVCodeSigningMappingTest, AnUnusableDatabaseNeitherStopsTheDaemonNorLose
 }
 
 TEST_F(QRVCodeSigningMappingTest, ADatabaseHeldByAnotherProcessIsRetriedLater) {
-  LogCapture log(env_.root.path());
+  QRVLogCapture log(env_.root.path());
   sqlite3* other = QRVSQLiteSchema::tryOpenDBWithURL(dbPath(), nullptr);
   ASSERT_NE(other, nullptr);
   // The exclusive lock is taken by the first access and then kept.
@@ -355,7 +344,7 @@ TEST_F(QRVCodeSigningMappingTest, ADatabaseHeldByAnotherProcessIsRetriedLater) {
 }
 
 TEST_F(QRVCodeSigningMappingTest, MalformedInputIsRefusedOrIgnoredWithoutLosingAnything) {
-  LogCapture log(env_.root.path());
+  QRVLogCapture log(env_.root.path());
   ASSERT_EQ(process("com.example.app", info(entitlements({"group.a"}, {}, true)), queue_), 1u);
 
   // Information that is there but not a dictionary is refused, not taken for

@@ -15,6 +15,7 @@
 #include <fstream>
 #include <iterator>
 
+#include "support/QRVLogCapture.h"
 #include "support/QRVTestServices.h"
 
 // Failures print entries as their description.
@@ -41,19 +42,6 @@ QRVCodeSigningEntry entryWith(const std::string& marker,
   entry.setChildBundleIdentifiers(std::move(children));
   return entry;
 }
-
-// Routes the daemon's log to a file for the life of the object.
-struct LogCapture {
-  explicit LogCapture(const fs::path& dir) : path(dir / "capture.log") {
-    QRVLog::open("com.kelva.quorvad.test", path.string(), QRVLogLevel::kDebug, 1, 1 << 22);
-  }
-  ~LogCapture() { QRVLog::close(); }
-  std::string text() const {
-    std::ifstream in(path);
-    return std::string(std::istreambuf_iterator<char>(in), {});
-  }
-  const fs::path path;
-};
 
 class QRVSQLiteDBTest : public ::testing::Test {
  protected:
@@ -315,7 +303,7 @@ TEST_F(QRVSQLiteDBTest, InvalidatesParentAndChildrenInOneTransaction) {
 }
 
 TEST_F(QRVSQLiteDBTest, NotFoundIs67AndIsNotLogged) {
-  LogCapture log(dir_);
+  QRVLogCapture log(dir_);
   add(entryWith("lonely"), "com.example.lonely");
   EXPECT_EQ(failed(db_->codeSigningEntryWithIdentifier("com.example.nobody", &error_) != nullptr), 67u);
   EXPECT_EQ(failed(db_->childIdentifiersForParentIdentifier("com.example.lonely", &error_).has_value()), 67u);
@@ -349,7 +337,7 @@ TEST_F(QRVSQLiteDBTest, UnreadableBlobFailsLookUpAndIsSkippedByEnumeration) {
 // MARK: - Transactions
 
 TEST_F(QRVSQLiteDBTest, FailingCommitIsReportedAsSuccessByAddOnlyAndLeavesNoTransactionOpen) {
-  LogCapture log(dir_);
+  QRVLogCapture log(dir_);
   add(entryWith("p", {{"com.example.child"}}), "com.example.p");
   sqlite3_commit_hook(
       db_->db(), [](void*) { return 1; }, nullptr);  // every COMMIT fails
