@@ -246,6 +246,9 @@ class QRVClientConnection {
   // cleanup must leave alone. False when a journal there cannot be read (or
   // the directory cannot be listed), so that nothing it may name is known.
   bool _stagingItemsNamedByReplaceFiles(std::set<std::string>* names);
+  // The journals in the replace directory (none when it does not exist);
+  // a listing that fails is logged and returned.
+  std::optional<std::vector<std::string>> _replaceFileURLs(QRVError* error);
   // Look-up without creation for the operations above; 21 carries the
   // identity. Without `useLocking` the caller holds the global lock.
   QRVMetadataRef _existingContainer(const QRVContainerIdentityRef& containerIdentity, bool useLocking,

@@ -213,16 +213,23 @@ std::optional<QRVPlist> QRVClientConnection::_readAndValidateReplaceFileAtUrl(co
       .set(kDestURLKey, QRVPlist::string(dest));
 }
 
-bool QRVClientConnection::_stagingItemsNamedByReplaceFiles(std::set<std::string>* names) {
-  QRVFileManager& fm = *services_->fileManager;
+std::optional<std::vector<std::string>> QRVClientConnection::_replaceFileURLs(QRVError* error) {
   const std::string replaceDirectory = services_->globalConfiguration->replaceDirectory();
   QRVError listError;
-  std::optional<std::vector<std::string>> journals = fm.urlsForItemsInDirectoryAtURL(replaceDirectory, &listError);
-  if (!journals) {
-    if (listError.isPOSIX() && listError.code() == ENOENT) return true;
-    QRVLogError("Failed to get items at replace URL {} : {}", replaceDirectory, listError.description());
-    return false;
-  }
+  std::optional<std::vector<std::string>> journals =
+      services_->fileManager->urlsForItemsInDirectoryAtURL(replaceDirectory, &listError);
+  if (journals) return journals;
+  // No replace directory: no replace was ever left unfinished.
+  if (listError.isPOSIX() && listError.code() == ENOENT) return std::vector<std::string>();
+  QRVLogError("Failed to get items at replace URL {} : {}", replaceDirectory, listError.description());
+  QRVFail(error, listError);
+  return std::nullopt;
+}
+
+bool QRVClientConnection::_stagingItemsNamedByReplaceFiles(std::set<std::string>* names) {
+  QRVFileManager& fm = *services_->fileManager;
+  std::optional<std::vector<std::string>> journals = _replaceFileURLs(nullptr);
+  if (!journals) return false;
   for (const std::string& journalURL : *journals) {
     // Read as written, unvalidated: this only keeps things, and a journal
     // that recovery has not judged yet may still be the only record of
@@ -241,14 +248,8 @@ bool QRVClientConnection::_stagingItemsNamedByReplaceFiles(std::set<std::string>
 
 bool QRVClientConnection::_recoverFromReplaceOperationsWithError(QRVError* error) {
   QRVFileManager& fm = *services_->fileManager;
-  const std::string replaceDirectory = services_->globalConfiguration->replaceDirectory();
-  QRVError listError;
-  std::optional<std::vector<std::string>> journals = fm.urlsForItemsInDirectoryAtURL(replaceDirectory, &listError);
-  if (!journals) {
-    if (listError.isPOSIX() && listError.code() == ENOENT) return true;
-    QRVLogError("Failed to get items at replace URL {} : {}", replaceDirectory, listError.description());
-    return QRVFail(error, listError);
-  }
+  std::optional<std::vector<std::string>> journals = _replaceFileURLs(error);
+  if (!journals) return false;
   for (const std::string& journalURL : *journals) {
     QRVError readError;
     std::optional<QRVPlist> journal = _readAndValidateReplaceFileAtUrl(journalURL, &readError);
