@@ -187,6 +187,16 @@ QRVPlist wipeContainerContent(const QRVContainerRef& c) {
 QRVPlist deleteContainerContent(const QRVContainerRef& c) { return containerRequest(C::deleteContainerContent, c); }
 QRVPlist diskUsage(const QRVContainerRef& c) { return containerRequest(C::diskUsage, c); }
 
+QRVPlist setDataProtection(const QRVContainerRef& c, uint64_t protectionClass, bool thirdParty, bool retryIfLocked) {
+  QRVContainerRef withoutUUID = c;
+  withoutUUID.uuid.reset();
+  QRVPlist request = containerRequest(C::setDataProtection, withoutUUID);
+  request.set("DataProtectionClass", QRVPlist::uinteger(protectionClass));
+  request.set("IsThirdParty", QRVPlist::boolean(thirdParty));
+  request.set("RetryIfLocked", QRVPlist::boolean(retryIfLocked));
+  return request;
+}
+
 QRVPlist retryTest(uint64_t crashes) {
   QRVPlist request = withCommand(C::retryTest);
   request.set("NumRetryCrashes", QRVPlist::uinteger(crashes));
@@ -321,6 +331,10 @@ Result QRVContainerClient::deleteContainer(const Ref& c, bool transient, E* e) {
 Result QRVContainerClient::wipeContainerContent(const Ref& c, E* e) { return call(R::wipeContainerContent(c), e); }
 Result QRVContainerClient::deleteContainerContent(const Ref& c, E* e) { return call(R::deleteContainerContent(c), e); }
 Result QRVContainerClient::diskUsage(const Ref& c, E* e) { return call(R::diskUsage(c), e); }
+Result QRVContainerClient::setDataProtection(const Ref& c, uint64_t protectionClass, bool thirdParty,
+                                             bool retryIfLocked, E* e) {
+  return call(R::setDataProtection(c, protectionClass, thirdParty, retryIfLocked), e);
+}
 Result QRVContainerClient::retryTest(uint64_t crashes, E* e) { return call(R::retryTest(crashes), e); }
 Result QRVContainerClient::stageSharedContent(const std::string& identifier, const std::string& sourcePath,
                                               const std::string& destPath, E* e) {

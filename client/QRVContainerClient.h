@@ -97,6 +97,9 @@ QRVPlist deleteContainer(const QRVContainerRef& c, bool transient);
 QRVPlist wipeContainerContent(const QRVContainerRef& c);
 QRVPlist deleteContainerContent(const QRVContainerRef& c);
 QRVPlist diskUsage(const QRVContainerRef& c);
+// The container's UUID, if any, is not sent: the daemon acts on the current
+// container of the identity.
+QRVPlist setDataProtection(const QRVContainerRef& c, uint64_t protectionClass, bool thirdParty, bool retryIfLocked);
 QRVPlist retryTest(uint64_t crashes);
 QRVPlist stageSharedContent(const std::string& identifier, const std::string& sourcePath,
                             const std::string& destPath);
@@ -145,6 +148,10 @@ class QRVContainerClient {
   Result wipeContainerContent(const QRVContainerRef& c, QRVClientError* e);
   Result deleteContainerContent(const QRVContainerRef& c, QRVClientError* e);
   Result diskUsage(const QRVContainerRef& c, QRVClientError* e);
+  // Answers when the change has ended: with `retryIfLocked` on a locked
+  // device, only after the next unlock (mind the timeout).
+  Result setDataProtection(const QRVContainerRef& c, uint64_t protectionClass, bool thirdParty, bool retryIfLocked,
+                           QRVClientError* e);
   Result retryTest(uint64_t crashes, QRVClientError* e);
   Result stageSharedContent(const std::string& identifier, const std::string& sourcePath,
                             const std::string& destPath, QRVClientError* e);

@@ -158,12 +158,12 @@ struct Typed {
   QRVContainerRef container;
   QRVContainerRef replacement;  // replace: the --new-* side
   bool haveId = false, haveClass = false, haveNewId = false, haveNewClass = false;
-  bool create = false, transient = false, info = false, relative = false;
+  bool create = false, transient = false, info = false, relative = false, thirdParty = false, retryIfLocked = false;
   std::optional<bool> enable;
   std::optional<std::string> key, path, dest, group;
   std::optional<QRVPlist> signing, signingOptions;
   std::optional<QRVPlist> value;
-  std::optional<uint64_t> lock, crashes;
+  std::optional<uint64_t> lock, crashes, protectionClass;
 };
 
 bool parseUUID(const std::string& text, QRVUUIDBytes* out, std::string* error) {
@@ -197,11 +197,12 @@ bool parseTyped(Words& words, Options& options, std::string_view allowed, Typed*
         return true;
     return false;
   };
-  static constexpr std::string_view kFlags[] = {"--create", "--transient", "--info", "--relative", "--enable",
-                                                "--disable"};
+  static constexpr std::string_view kFlags[] = {"--create",  "--transient",   "--info",           "--relative",
+                                                "--enable",  "--disable",     "--third-party",    "--retry-if-locked"};
   static constexpr std::string_view kValued[] = {
       "--id",    "--class", "--persona", "--uuid", "--new-id",  "--new-class", "--new-persona", "--new-uuid", "--key",
-      "--value", "--path",  "--dest",    "--lock", "--crashes", "--group",     "--signing",     "--options"};
+      "--value", "--path",  "--dest",    "--lock", "--crashes", "--group",     "--signing",     "--options",
+      "--protection-class"};
   while (!words.empty()) {
     if (takeCommonOption(words, options, error)) {
       if (!error->empty()) return false;
@@ -219,6 +220,8 @@ bool parseTyped(Words& words, Options& options, std::string_view allowed, Typed*
       if (flag == "--relative") t->relative = true;
       if (flag == "--enable") t->enable = true;
       if (flag == "--disable") t->enable = false;
+      if (flag == "--third-party") t->thirdParty = true;
+      if (flag == "--retry-if-locked") t->retryIfLocked = true;
       break;
     }
     if (matched) continue;
@@ -249,6 +252,7 @@ bool parseTyped(Words& words, Options& options, std::string_view allowed, Typed*
       }
       if (name == "--lock" && (good = parseNumber(name, v, &n, error))) t->lock = n;
       if (name == "--crashes" && (good = parseNumber(name, v, &n, error))) t->crashes = n;
+      if (name == "--protection-class" && (good = parseNumber(name, v, &n, error))) t->protectionClass = n;
       if (name == "--value") {
         // "--value TEXT" guesses the type as KEY=VALUE words do; a value
         // starting with ':' spells it out ("--value :uint=5").
@@ -321,6 +325,11 @@ QRV_TYPED(buildWipe, "--id --persona", {
 QRV_TYPED(buildDiskUsage, "--id --class --persona --uuid", {
   if (!require(t.haveId && t.haveClass && t.container.uuid, "--id, --class and --uuid", error)) return std::nullopt;
   return R::diskUsage(t.container);
+})
+QRV_TYPED(buildSetDataProtection, "--id --class --persona --protection-class --third-party --retry-if-locked", {
+  if (!require(t.haveId && t.haveClass && t.protectionClass, "--id, --class and --protection-class", error))
+    return std::nullopt;
+  return R::setDataProtection(t.container, *t.protectionClass, t.thirdParty, t.retryIfLocked);
 })
 QRV_TYPED(buildAssetsPath, "--id --persona --relative --create", {
   if (!require(t.haveId, "--id", error)) return std::nullopt;
@@ -457,6 +466,11 @@ Example:
      "Replaces a container with another one.\n", buildReplace},
     {"disk-usage", "disk-usage --id ID --class N --uuid UUID [--persona S]", "Prints the bytes a container uses.\n",
      buildDiskUsage},
+    {"set-data-protection",
+     "set-data-protection --id ID --class N --protection-class P [--persona S] [--third-party] [--retry-if-locked]",
+     "Changes the protection class of a data container's files to P. With\n--retry-if-locked, a locked device "
+     "makes the daemon wait for the next unlock\n(the answer comes then); without it the answer is 61.\n",
+     buildSetDataProtection},
     {"assets-path", "assets-path --id ID [--persona S] [--relative] [--create]",
      "Prints the user-managed assets directory of ID's application data container.\n", buildAssetsPath},
     {"assets-delete", "assets-delete --id ID --path P [--persona S]", "Deletes the user-managed asset P of ID.\n",

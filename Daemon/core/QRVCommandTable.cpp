@@ -4,6 +4,7 @@
 #include "core/QRVCommandHandlers.h"
 #include "core/QRVContainerHandlers.h"
 #include "core/QRVContentsHandlers.h"
+#include "core/QRVDataProtectionHandlers.h"
 #include "core/QRVDeleteHandlers.h"
 #include "core/QRVGroupHandlers.h"
 
@@ -37,7 +38,7 @@ const QRVCommandTable kTable = {{
     {18, QRVHandleProcessCodeSigningInfo, kEntitlementAllowed,                R, _, _},  // processCodeSigningInfo
     {19, QRVHandleCodeSigningInfoForIdentifier, kEntitlementAllowed,                R, _, _},  // codeSigningInfoForIdentifier
     {20, QRVHandleInvalidateCodeSigningInfoForAppsWithoutBundleContainer, kEntitlementAllowed,                R, _, _},  // invalidateCodeSigningInfoForAppsWithoutBundleContainer
-    {21, nullptr,                           kEntitlementAllowed,                _, _, _},  // setDataProtection
+    {21, QRVHandleSetDataProtection,       kEntitlementAllowed,                _, _, _},  // setDataProtection
     {22, QRVHandleRecreateDefaultStructure, kEntitlementAllowed,                R, _, _},  // recreateDefaultStructureAgain
     {23, QRVHandleDiskUsage,                kEntitlementAllowed,                R, _, L},  // diskUsage
     {24, nullptr,                           kEntitlementDataMigration,          R, _, _},  // performDataMigration

@@ -2,6 +2,7 @@
 
 #include "codesigning/QRVBuiltInWellKnownNames.h"
 #include "codesigning/QRVGroupManager.h"
+#include "dataprotection/QRVDataProtectionManager.h"
 
 std::shared_ptr<QRVServices> QRVServices::make(const std::string& root, QRVPlatform platform) {
   auto s = std::make_shared<QRVServices>();
@@ -33,9 +34,8 @@ std::shared_ptr<QRVServices> QRVServices::make(const std::string& root, QRVPlatf
   s->codeSigning = s->codeSigningMapping;
   s->systemGroups = s->codeSigningMapping;
   s->pluginParents = s->codeSigningMapping;
-  // The data-protection manager is not connected yet: the seam that knows
-  // nothing stands in.
-  s->dataProtection = std::make_shared<QRVNoDataProtectionQueries>();
+  s->dataProtectionManager = std::make_shared<QRVDataProtectionManager>(std::weak_ptr<QRVServices>(s));
+  s->dataProtection = s->dataProtectionManager;
   s->wellKnownNames = std::make_shared<QRVBuiltInWellKnownNames>(s->globalConfiguration);
   s->containerCache = std::make_shared<QRVContainerCache>(s->fileManager, s->globalConfiguration, s->userIdentityCache,
                                                           s->platform.sandbox, s->pluginParents, s->wellKnownNames);

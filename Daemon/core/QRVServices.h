@@ -16,6 +16,7 @@
 #include "platform/QRVPlatform.h"
 #include "users/QRVUserIdentityCache.h"
 
+class QRVDataProtectionManager;
 class QRVGroupManager;
 
 struct QRVServices {
@@ -47,6 +48,9 @@ struct QRVServices {
   std::shared_ptr<QRVSystemGroupQueries> systemGroups;
   // Group containers: which an owner claims, and the sweep of unclaimed ones.
   std::shared_ptr<QRVGroupManager> groupManager;
+  // Changes of data containers' protection classes; it also answers the
+  // data-protection seam above.
+  std::shared_ptr<QRVDataProtectionManager> dataProtectionManager;
 
   // Runs `job` on `queue` inside a keep-alive transaction, so the daemon is
   // not considered idle until it has finished.

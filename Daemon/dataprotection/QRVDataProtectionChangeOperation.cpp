@@ -275,7 +275,11 @@ std::optional<QRVDataProtectionUpdate> QRVDataProtectionChangeOperation::_readAn
 std::shared_ptr<Op> QRVDataProtectionChangeOperation::dataProtectionChangeOperationAtURL(
     const std::string& url, std::shared_ptr<QRVSerialQueue> queue, std::shared_ptr<QRVServices> services,
     QRVError* error) {
-  std::optional<QRVDataProtectionUpdate> update = _readAndValidateDataProtectionUpdateAtURL(url, *services, error);
+  // Only the reading happens on the file queue: the look-up below takes the
+  // identifier locks, and a pass holding one of those waits for the file
+  // queue (to check that it is still current).
+  std::optional<QRVDataProtectionUpdate> update;
+  queue->sync([&] { update = _readAndValidateDataProtectionUpdateAtURL(url, *services, error); });
   if (!update) return nullptr;
   QRVUserIdentityRef user = update->userIdentity;
   if (!user) user = services->userIdentityCache->defaultUserIdentity();

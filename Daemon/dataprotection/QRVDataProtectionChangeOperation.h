@@ -25,6 +25,9 @@
 // performChangeOperation may run on any thread but not twice at once for one
 // operation (retries are serialised by the lock-state queue). Set the blocks
 // before performChangeOperation.
+//
+// Lock order: a container's identifier lock, then `queue`. Nothing running
+// on `queue` may take an identifier lock or look a container up.
 #pragma once
 
 #include <atomic>
@@ -127,10 +130,12 @@ class QRVDataProtectionChangeOperation : public std::enable_shared_from_this<QRV
   static std::optional<QRVDataProtectionUpdate> _readAndValidateDataProtectionUpdateAtURL(const std::string& url,
                                                                                           QRVServices& services,
                                                                                           QRVError* error);
-  // The operation an update file left behind describes. Call on `queue`. The
-  // file must lie where the container it names keeps its update file (29
-  // otherwise: a file this daemon did not write). Codes: those of the read,
-  // 29, 21 (the container is gone).
+  // The operation an update file left behind describes. The file is read on
+  // `queue`; the container is looked up after leaving it. Never call this on
+  // `queue`: the look-up takes identifier locks, and a pass holding one waits
+  // for `queue`. The file must lie where the container it names keeps its
+  // update file (29 otherwise: a file this daemon did not write). Codes:
+  // those of the read, 29, 21 (the container is gone).
   static std::shared_ptr<QRVDataProtectionChangeOperation> dataProtectionChangeOperationAtURL(
       const std::string& url, std::shared_ptr<QRVSerialQueue> queue, std::shared_ptr<QRVServices> services,
       QRVError* error);

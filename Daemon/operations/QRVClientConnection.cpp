@@ -3,6 +3,7 @@
 #include <set>
 
 #include "base/QRVLog.h"
+#include "dataprotection/QRVDataProtectionManager.h"
 #include "fs/QRVDictionaryAdditions.h"
 
 QRVClientConnection::QRVClientConnection(std::shared_ptr<const QRVClientIdentity> clientIdentity, bool entitled,
@@ -22,7 +23,13 @@ QRVClientConnection::QRVClientConnection(std::shared_ptr<const QRVClientIdentity
 
 std::shared_ptr<QRVClientConnection> QRVClientConnection::makeSharedClientConnection(
     std::shared_ptr<QRVServices> services) {
-  auto identity = QRVClientIdentity::anonymousPrivilegedClientIdentity(*services->userIdentityCache);
+  QRVUserIdentityRef user = services->userIdentityCache->defaultUserIdentity();
+  return makePrivilegedClientConnection(std::move(user), std::move(services));
+}
+
+std::shared_ptr<QRVClientConnection> QRVClientConnection::makePrivilegedClientConnection(
+    QRVUserIdentityRef userIdentity, std::shared_ptr<QRVServices> services) {
+  auto identity = QRVClientIdentity::privilegedClientIdentityWithUserIdentity(std::move(userIdentity));
   return std::make_shared<QRVClientConnection>(std::move(identity), /*entitled=*/true, /*allowOtherIdLookup=*/false,
                                                /*unrestricted=*/true, std::nullopt, std::nullopt,
                                                std::make_shared<QRVCommandQueue>(), std::move(services));
@@ -46,6 +53,10 @@ void QRVClientConnection::quorvaSetup() {
   QRVError error;
   if (!_recoverFromReplaceOperationsWithError(&error))
     QRVLogError("Failed recovering from replace operations: {}", error.description());
+  // A class change a crash interrupted is finished, so no container stays
+  // half in its old class.
+  if (!services_->dataProtectionManager->restartPendingDataProtectionOperationsWithError(&error))
+    QRVLogError("Failed restarting pending data protection operations: {}", error.description());
 }
 
 void QRVClientConnection::rebootQuorvaCleanupWithCompletion(std::function<void()> completion) {

@@ -33,6 +33,9 @@ class QRVClientConnection {
   // its own command queue, entitled and unrestricted, no lookup for other
   // identifiers.
   static std::shared_ptr<QRVClientConnection> makeSharedClientConnection(std::shared_ptr<QRVServices> services);
+  // The same, acting for `userIdentity` rather than the default user.
+  static std::shared_ptr<QRVClientConnection> makePrivilegedClientConnection(QRVUserIdentityRef userIdentity,
+                                                                            std::shared_ptr<QRVServices> services);
 
   const std::shared_ptr<const QRVClientIdentity>& clientIdentity() const { return clientIdentity_; }
   bool isEntitled() const { return entitled_; }

@@ -22,11 +22,6 @@ const char* lookupKeyForContainerClass(QRVContainerClass c) {
   return c < sizeof kKeys / sizeof kKeys[0] ? kKeys[c] : nullptr;
 }
 
-
-// The data-protection class asked for by the installer in the container's
-// info values.
-constexpr const char* kContentProtectionClassKey = "com.kelva.Verdane.ContentProtectionClass";
-
 }  // namespace
 
 const std::set<std::string>* QRVClientConnection::_lookupForContainerClass(QRVContainerClass containerClass) {
@@ -60,10 +55,7 @@ bool QRVClientConnection::_createTopLevelContainerDirectory(const std::string& u
 
 uint32_t QRVClientConnection::_dataProtectionClassForContainerMetadata(const QRVMetadata& metadata) {
   if (!QRVContainerClassIsPerUser(metadata.containerClass())) return 0;
-  const QRVPlist* asked = metadata.info().get(kContentProtectionClassKey);
-  if (asked && (asked->type() == QRVPlist::Type::UInteger || asked->type() == QRVPlist::Type::Real))
-    return static_cast<uint32_t>(asked->type() == QRVPlist::Type::UInteger ? asked->uint64Value()
-                                                                           : static_cast<uint64_t>(asked->realValue()));
+  if (std::optional<uint32_t> asked = QRVContentProtectionClassInInfo(metadata.info())) return *asked;
   return services_->dataProtection->intendedDataProtectionClassBasedOnEntitlementsForIdentifier(metadata.identifier());
 }
 

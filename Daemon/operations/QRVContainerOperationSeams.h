@@ -6,8 +6,12 @@
 // neutral answers until the real components are connected.
 #pragma once
 
+#include <cstdint>
+#include <optional>
 #include <string>
 #include <vector>
+
+#include "base/QRVPlist.h"
 
 class QRVCommandQueue;
 
@@ -35,6 +39,19 @@ class QRVNoCodeSigningQueries : public QRVCodeSigningQueries {
   }
   uint64_t invalidateCodeSigningInfoForIdentifierAndItsChildren(const std::string&) override { return 1; }
 };
+
+// The info value holding the data-protection class a container was last
+// given (or was asked to be created with).
+inline constexpr const char* kQRVContentProtectionClassKey = "com.kelva.Verdane.ContentProtectionClass";
+
+// The class `info` records; none when it holds no number there.
+inline std::optional<uint32_t> QRVContentProtectionClassInInfo(const QRVPlist& info) {
+  const QRVPlist* value = info.isDictionary() ? info.get(kQRVContentProtectionClassKey) : nullptr;
+  if (!value) return std::nullopt;
+  if (value->type() == QRVPlist::Type::UInteger) return static_cast<uint32_t>(value->uint64Value());
+  if (value->type() == QRVPlist::Type::Real) return static_cast<uint32_t>(static_cast<uint64_t>(value->realValue()));
+  return std::nullopt;
+}
 
 class QRVDataProtectionQueries {
  public:
