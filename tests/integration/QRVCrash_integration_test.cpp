@@ -22,6 +22,7 @@
 #include <thread>
 
 #include "client/QRVClient.h"
+#include "integration/QRVArmedDaemon.h"
 #include "integration/QRVDaemonProcess.h"
 #include "integration/QRVRunAs.h"
 #include "support/QRVEventually.h"
@@ -96,23 +97,6 @@ void trustInstaller(QRVDaemonProcess& daemon) {
                   QRVPlist::dictionary().set("com.kelva.private.Quorva.allowed", QRVPlist::boolean(true)));
 }
 
-// Starts the daemon armed to stop dead when it reaches `point`.
-void startArmed(QRVDaemonProcess& daemon, const char* point) {
-  setenv("QUORVAD_CRASH_AT", point, 1);
-  daemon.start();
-  unsetenv("QUORVAD_CRASH_AT");
-}
-
-// Sends `request` to an armed daemon and checks that it stopped dead: no
-// reply, exit status 70.
-void expectStoppedDeadBy(QRVDaemonProcess& daemon, const QRVPlist& request) {
-  QRVPlist reply = QRVRepliesAs(daemon, kInstallerUID, {request})[0];
-  EXPECT_EQ(QRVClient::resultCode(reply), 0u) << "the daemon answered instead of stopping";
-  std::optional<int> status = daemon.waitForExit(std::chrono::seconds(5));
-  ASSERT_TRUE(status.has_value());
-  EXPECT_TRUE(WIFEXITED(*status) && WEXITSTATUS(*status) == 70);
-}
-
 // Restarts the daemon after a crash and waits until the start-up cleanup has
 // emptied staging and death row.
 void restartAndExpectCleanedUp(QRVDaemonProcess& daemon) {
@@ -156,8 +140,8 @@ TEST(CrashIntegrationTest, AReplaceKilledAtAnyStepLeavesOneWholeContainer) {
       if (wipe) involved.push_back(kTransientDirectory);
       const Snapshot before = snapshotOf(daemon.root(), involved);
 
-      startArmed(daemon, point);
-      expectStoppedDeadBy(daemon,
+      QRVStartArmed(daemon, point);
+      QRVExpectStoppedDeadBy(daemon, kInstallerUID,
               wipe ? QRVRequest(12)
                           .set("Identifier", QRVPlist::string("com.example.r"))
                           .set("ContainerClass", QRVPlist::uinteger(2))
@@ -205,8 +189,8 @@ TEST(CrashIntegrationTest, ACreationKilledAtAnyStepLeavesAWholeContainerOrNone) 
     SCOPED_TRACE(point);
     QRVDaemonProcess daemon;
     trustInstaller(daemon);
-    startArmed(daemon, point);
-    expectStoppedDeadBy(daemon, QRVCreateRequest("com.example.c", 2));
+    QRVStartArmed(daemon, point);
+    QRVExpectStoppedDeadBy(daemon, kInstallerUID, QRVCreateRequest("com.example.c", 2));
     restartAndExpectCleanedUp(daemon);
 
     QRVPlist found = QRVRepliesAs(daemon, kInstallerUID, {lookupRequest("com.example.c")})[0];
@@ -234,7 +218,7 @@ TEST(CrashIntegrationTest, DeathRowEmptyingKilledHalfwayIsFinishedAtTheNextStart
   trustInstaller(daemon);
   // Death row is empty when this daemon starts, so its start-up cleanup
   // passes no crash point; command 4 below does.
-  startArmed(daemon, "deathrow.item-removed");
+  QRVStartArmed(daemon, "deathrow.item-removed");
   std::vector<QRVPlist> made = QRVRepliesAs(
       daemon, kInstallerUID, {QRVCreateRequest("com.example.a", 2), QRVCreateRequest("com.example.b", 2), QRVCreateRequest("com.example.k", 2)});
   for (const QRVPlist& reply : made) ASSERT_EQ(QRVClient::resultCode(reply), 1u);
@@ -257,7 +241,7 @@ TEST(CrashIntegrationTest, DeathRowEmptyingKilledHalfwayIsFinishedAtTheNextStart
   ASSERT_EQ(std::distance(fs::directory_iterator(deathRow), fs::directory_iterator()), 2);
   const Snapshot before = snapshotOf(daemon.root(), {});
 
-  expectStoppedDeadBy(daemon, QRVRequest(4));
+  QRVExpectStoppedDeadBy(daemon, kInstallerUID, QRVRequest(4));
   EXPECT_EQ(std::distance(fs::directory_iterator(deathRow), fs::directory_iterator()), 1)
       << "the daemon should have stopped after the first item";
 
