@@ -150,6 +150,7 @@ TEST_F(DataProtectionIntegrationTest, ALockedDeviceHoldsTheAnswerUntilTheUnlock)
   fill(2000);
   resetTo(4);
   EXPECT_EQ(code(setDataProtection(2, true)), QRVResultCode::kInvalidInput);
+  EXPECT_EQ(code(setDataProtection(uint64_t{1} << 32 | 1, true)), QRVResultCode::kInvalidInput) << "not cut to 1";
   EXPECT_EQ(code(setDataProtection(3, true, /*thirdParty=*/true)), QRVResultCode::kSuccess);
   EXPECT_EQ(code(setDataProtection(4, true, /*thirdParty=*/true)), QRVResultCode::kInvalidInput);
   EXPECT_EQ(recordedClass(), 3u);

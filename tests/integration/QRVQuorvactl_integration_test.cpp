@@ -102,4 +102,23 @@ TEST_F(QuorvactlIntegrationTest, LookupFeedsTypedCallsListsAndRefuses) {
   EXPECT_EQ(quorvactl(root_ + " list --class 1 --uuid x").status, 2);
 }
 
+// set-data-protection answers with the daemon's code; the class it set is
+// what the container's info then records.
+TEST_F(QuorvactlIntegrationTest, SetDataProtectionChangesAndRecordsTheClass) {
+  ToolRun created = quorvactl(root_ + " --json lookup --id com.example.dp --class 2 --create");
+  ASSERT_EQ(created.status, 0) << created.out;
+  const std::string container = " --id com.example.dp --class 2";
+  EXPECT_EQ(quorvactl(root_ + " set-data-protection" + container).status, 2) << "--protection-class is required";
+  EXPECT_EQ(quorvactl(root_ + " set-data-protection" + container + " --protection-class 2").status, 1);
+  EXPECT_EQ(quorvactl(root_ + " set-data-protection" + container + " --protection-class 4 --third-party").status, 1);
+  ToolRun set = quorvactl(root_ + " --json set-data-protection" + container + " --protection-class 4 --retry-if-locked");
+  EXPECT_EQ(set.status, 0) << set.out;
+  EXPECT_NE(set.out.find("\"ReplyError\": 1"), std::string::npos) << set.out;
+
+  ToolRun info = quorvactl(root_ + " --json info-get" + container + " --uuid " + jsonString(created.out, "ReplyUUID") +
+                           " --key com.kelva.Verdane.ContentProtectionClass");
+  EXPECT_EQ(info.status, 0) << info.out;
+  EXPECT_NE(info.out.find("\"ReplyInfoValue\": 4"), std::string::npos) << info.out;
+}
+
 }  // namespace
