@@ -446,32 +446,32 @@ bool QRVDataProtectionChangeOperation::_changeItemAtURL(const std::string& itemU
   const uint32_t fileTarget = target == 0 ? kDefaultFileClass : target;
   const bool neverRaise = (changeType_ & kNeverRaiseFileClass) != 0;
 
-  auto directoryPredicate = [&](const std::string& path) {
-    return [&, path](uint32_t current) {
-      if (current == kUntouchableClass) return false;
-      QRVLogDebug("Setting protection class of {} to {}", path, newClass_);
-      return true;
-    };
+  // Built once for the whole walk: a container may hold a great many items.
+  std::string_view current;  // the directory the predicate is asked about
+  const std::function<bool(uint32_t)> directoryPredicate = [&](uint32_t itemClass) {
+    if (itemClass == kUntouchableClass) return false;
+    QRVLogDebug("Setting protection class of {} to {}", current, newClass_);
+    return true;
   };
-  auto filePredicate = [&](uint32_t current) {
-    if (current == kUntouchableClass || current == fileTarget) return false;
-    return !(neverRaise && fileTarget > current);
+  const std::function<bool(uint32_t)> filePredicate = [&](uint32_t itemClass) {
+    if (itemClass == kUntouchableClass || itemClass == fileTarget) return false;
+    return !(neverRaise && fileTarget > itemClass);
   };
 
   QRVError walkError;
   bool ok = fm.traverseItemAtURLWithoutFollowingLinks(
       itemURL, &walkError, [&](const QRVDirectoryEntry& entry, QRVError* stop) {
-        const std::string path(entry.path);
         QRVError setError;
         bool set = true;
         switch (entry.kind) {
           case Kind::kDirectoryPostOrder:
+            current = entry.path;
             if (changeType_ & kChangeDirectories)
-              set = fm.setDataProtectionClassOfOpenItem(entry.fd, path, target, directoryPredicate(path), &setError);
+              set = fm.setDataProtectionClassOfOpenItem(entry.fd, entry.path, target, directoryPredicate, &setError);
             break;
           case Kind::kRegularFile:
             if (changeType_ & kChangeFiles)
-              set = fm.setDataProtectionClassOfOpenItem(entry.fd, path, fileTarget, filePredicate, &setError);
+              set = fm.setDataProtectionClassOfOpenItem(entry.fd, entry.path, fileTarget, filePredicate, &setError);
             break;
           case Kind::kDirectory:
           case Kind::kSymbolicLink:
@@ -479,12 +479,12 @@ bool QRVDataProtectionChangeOperation::_changeItemAtURL(const std::string& itemU
             break;
           case Kind::kDirectoryCycle:
           case Kind::kUnreadableDirectory:
-            QRVLogError("FTS returned error for {} : {}", path, strerror(entry.errnum));
+            QRVLogError("FTS returned error for {} : {}", entry.path, strerror(entry.errnum));
             break;
         }
         if (set) return true;
         if (setError.isPOSIX() && setError.code() == EBADF) {
-          QRVLogError("Ignoring failure to set protection class to {} on {} (mode 0{:o}): {}", newClass_, path,
+          QRVLogError("Ignoring failure to set protection class to {} on {} (mode 0{:o}): {}", newClass_, entry.path,
                       entry.stat->st_mode, setError.description());
           return true;
         }

@@ -206,7 +206,7 @@ class QRVFileManager {
   bool dataProtectionClassOfItemAtURL(const std::string& url, uint32_t* protectionClass, QRVError* error);
   // The same on the item open at `fd` (a walk's entry); `path` only words
   // errors and log lines.
-  bool setDataProtectionClassOfOpenItem(int fd, const std::string& path, uint32_t toClass,
+  bool setDataProtectionClassOfOpenItem(int fd, std::string_view path, uint32_t toClass,
                                         const std::function<bool(uint32_t currentClass)>& ifPredicate, QRVError* error);
 
   // ---- Ownership and ACLs ----

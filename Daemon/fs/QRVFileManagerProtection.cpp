@@ -63,7 +63,7 @@ bool QRVFileManager::setDataProtectionClassOfItemAtURL(const std::string& url, u
   return ok;
 }
 
-bool QRVFileManager::setDataProtectionClassOfOpenItem(int fd, const std::string& path, uint32_t toClass,
+bool QRVFileManager::setDataProtectionClassOfOpenItem(int fd, std::string_view path, uint32_t toClass,
                                                       const std::function<bool(uint32_t)>& ifPredicate,
                                                       QRVError* error) {
   if (ifPredicate) {

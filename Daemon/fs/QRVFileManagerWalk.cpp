@@ -1,6 +1,7 @@
 // The walk that never follows links: for changing what lies inside a
 // container, whose application may plant links or swap directories while the
 // daemon (as root) works on it.
+#include <dirent.h>
 #include <fcntl.h>
 
 #include <cerrno>
@@ -22,9 +23,10 @@ constexpr int kItemFlags = O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLO
 constexpr size_t kMaxOpenDirectories = 32;
 
 // Opening an entry that was listed failed because it is no longer what was
-// listed: gone (ENOENT), a link now (ELOOP), or no longer a directory
-// (ENOTDIR). The application changed its own data under the walk.
-bool vanished(int e) { return e == ENOENT || e == ELOOP || e == ENOTDIR; }
+// listed: gone (ENOENT), a link now (ELOOP), no longer a directory
+// (ENOTDIR), or a socket now (ENXIO). The application changed its own data
+// under the walk.
+bool vanished(int e) { return e == ENOENT || e == ELOOP || e == ENOTDIR || e == ENXIO; }
 
 bool sameItem(const struct stat& a, const struct stat& b) { return a.st_dev == b.st_dev && a.st_ino == b.st_ino; }
 
@@ -151,23 +153,28 @@ bool QRVFileManager::traverseItemAtURLWithoutFollowingLinks(const std::string& u
       continue;
     }
 
-    const std::string name = top.names[top.next++].name;
+    const QRVFileSystem::DirectoryEntry& listed = top.names[top.next++];
+    const std::string& name = listed.name;
     const std::string path = QRVPathComponents::appending(top.path, name);
     struct stat child;
-    if (int e = files_->status(top.fd, name, &child, AT_SYMLINK_NOFOLLOW)) {
-      if (e == ENOENT) continue;
-      return QRVFail(error, QRV_POSIX_ERROR(e, "Error for path {}: {}", path, errnoText(e)));
-    }
-    if (!S_ISDIR(child.st_mode) && !S_ISREG(child.st_mode)) {
-      if (!walk.deliver(kindOfNonDirectory(child), path, level + 1, child, -1, 0)) return stopped();
-      continue;
-    }
-    if (S_ISDIR(child.st_mode) && walk.isAncestor(child)) {
-      if (!walk.deliver(Kind::kDirectoryCycle, path, level + 1, child, -1, ELOOP)) return stopped();
-      continue;
+    // A directory or regular file by its listing is opened straight away:
+    // the status of what was opened decides below. Anything else, or an entry
+    // the file system did not type, is looked at first, so that nothing but
+    // a directory or a regular file is ever opened.
+    bool isDirectory = listed.type == DT_DIR;
+    if (!isDirectory && listed.type != DT_REG) {
+      if (int e = files_->status(top.fd, name, &child, AT_SYMLINK_NOFOLLOW)) {
+        if (e == ENOENT) continue;
+        return QRVFail(error, QRV_POSIX_ERROR(e, "Error for path {}: {}", path, errnoText(e)));
+      }
+      if (!S_ISDIR(child.st_mode) && !S_ISREG(child.st_mode)) {
+        if (!walk.deliver(kindOfNonDirectory(child), path, level + 1, child, -1, 0)) return stopped();
+        continue;
+      }
+      isDirectory = S_ISDIR(child.st_mode);
     }
     int childFD = -1;
-    if (int e = files_->open(top.fd, name, S_ISDIR(child.st_mode) ? kDirectoryFlags : kItemFlags, 0, &childFD)) {
+    if (int e = files_->open(top.fd, name, isDirectory ? kDirectoryFlags : kItemFlags, 0, &childFD)) {
       if (vanished(e)) continue;
       return QRVFail(error, QRV_POSIX_ERROR(e, "Error for path {}: {}", path, errnoText(e)));
     }
@@ -176,6 +183,11 @@ bool QRVFileManager::traverseItemAtURLWithoutFollowingLinks(const std::string& u
     if (int e = files_->statusOfFD(childFD, &child)) {
       _close(childFD);
       return QRVFail(error, QRV_POSIX_ERROR(e, "Error for path {}: {}", path, errnoText(e)));
+    }
+    if (S_ISDIR(child.st_mode) && walk.isAncestor(child)) {
+      _close(childFD);
+      if (!walk.deliver(Kind::kDirectoryCycle, path, level + 1, child, -1, ELOOP)) return stopped();
+      continue;
     }
     if (!S_ISDIR(child.st_mode)) {
       bool ok =

@@ -83,7 +83,9 @@ class DataProtectionIntegrationTest : public testing::Test {
   void SetUp() override {
     if (geteuid() != 0) GTEST_SKIP() << "needs root: clients run under other uids";
     daemon_.trustUID(kInstallerUID, "com.example.installer", QRVEntitlements({"allowed"}));
-    daemon_.start();
+    // At debug level, so that a test can see when the daemon has noticed a
+    // change of the lock state.
+    daemon_.start({"--log-level", "7"});
     QRVPlist created = reply(QRVCreateRequest(kIdentifier, 2));
     ASSERT_EQ(QRVClient::resultCode(created), 1u);
     container_ = created.stringForKey("ReplyPath");
@@ -106,7 +108,13 @@ class DataProtectionIntegrationTest : public testing::Test {
     std::ofstream(daemon_.root() + "/outside/secret") << "not the application's";
     fs::create_directory_symlink(daemon_.root() + "/outside", container_ / "Documents" / "escape");
   }
-  void setLocked(bool locked) { std::ofstream(daemon_.root() + "/run/quorva/lockstate") << (locked ? "1\n" : "0\n"); }
+  // Locks or unlocks the device; a lock returns once the daemon has noticed.
+  void setLocked(bool locked) {
+    std::ofstream(daemon_.root() + "/run/quorva/lockstate") << (locked ? "1\n" : "0\n");
+    if (locked) {
+      EXPECT_TRUE(daemon_.logEventuallyContains("LockState=1"));
+    }
+  }
   std::vector<fs::path> updateFiles() {
     std::vector<fs::path> files;
     const fs::path pending = daemon_.root() + "/private/var/root/Library/Quorva/PendingUpdates";
