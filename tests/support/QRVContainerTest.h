@@ -7,6 +7,7 @@
 #include <gtest/gtest.h>
 #include <unistd.h>
 
+#include <filesystem>
 #include <memory>
 #include <optional>
 #include <string>
@@ -43,6 +44,29 @@ class QRVContainerTest : public testing::Test {
   // than made, and only the wrapper reports them.
   int statThroughSeam(const std::string& path, struct stat* st) {
     return env_.posixFileSystem->status(AT_FDCWD, path, st, 0);
+  }
+
+  // The protection class of `path` (never followed), as the daemon reads it.
+  uint32_t classOf(const std::string& path) {
+    int fd = open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC);
+    EXPECT_GE(fd, 0) << path;
+    uint32_t c = 99;
+    EXPECT_EQ(env_.fileSystem->protectionClass(fd, &c), 0) << path;
+    close(fd);
+    return c;
+  }
+  void setClass(const std::string& path, uint32_t c) {
+    int fd = open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC);
+    ASSERT_GE(fd, 0) << path;
+    ASSERT_EQ(env_.fileSystem->setProtectionClass(fd, c), 0) << path;
+    close(fd);
+  }
+  // A small file at `path` (directories made as needed), of class `c` unless
+  // that is 0.
+  void file(const std::string& path, uint32_t c = 0) {
+    std::filesystem::create_directories(std::filesystem::path(path).parent_path());
+    QRVWriteText(path, "data");
+    if (c) setClass(path, c);
   }
 
   QRVUserIdentityRef mobile() {

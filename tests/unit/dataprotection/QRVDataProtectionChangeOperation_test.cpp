@@ -37,26 +37,6 @@ class DataProtectionChangeTest : public QRVContainerTest {
 
   std::string in(const std::string& relative) { return container_->url() + "/" + relative; }
 
-  uint32_t classOf(const std::string& path) {
-    int fd = open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC);
-    EXPECT_GE(fd, 0) << path;
-    uint32_t c = 99;
-    EXPECT_EQ(env_.fileSystem->protectionClass(fd, &c), 0) << path;
-    close(fd);
-    return c;
-  }
-  void setClass(const std::string& path, uint32_t c) {
-    int fd = open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC);
-    ASSERT_GE(fd, 0) << path;
-    ASSERT_EQ(env_.fileSystem->setProtectionClass(fd, c), 0) << path;
-    close(fd);
-  }
-  void file(const std::string& path, uint32_t c = 0) {
-    fs::create_directories(fs::path(path).parent_path());
-    QRVWriteText(path, "data");
-    if (c) setClass(path, c);
-  }
-
   std::shared_ptr<Op> make(int32_t newClass, uint32_t changeType, bool retry = true) {
     return Op::initWithContainerMetadata(container_, newClass, retry, changeType, fileQueue_, env_.services);
   }

@@ -36,22 +36,6 @@ class DataProtectionManagerTest : public QRVContainerTest {
     ASSERT_TRUE(queue.executeAllUntilExhaustedOrError(&result)) << result;
   }
 
-  uint32_t classOf(const std::string& path) {
-    int fd = open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC);
-    EXPECT_GE(fd, 0) << path;
-    uint32_t c = 99;
-    EXPECT_EQ(env_.fileSystem->protectionClass(fd, &c), 0) << path;
-    close(fd);
-    return c;
-  }
-  void file(const std::string& path, uint32_t c) {
-    fs::create_directories(fs::path(path).parent_path());
-    QRVWriteText(path, "data");
-    int fd = open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC);
-    ASSERT_GE(fd, 0);
-    ASSERT_EQ(env_.fileSystem->setProtectionClass(fd, c), 0);
-    close(fd);
-  }
   // The class the container's info records; nothing when none is.
   std::optional<uint32_t> recorded(const QRVContainerIdentityRef& id) {
     QRVError error;
