@@ -229,6 +229,14 @@ class QRVClientConnection {
                                          QRVError* error);
   bool _createSubDirectories(const std::string& url, const QRVMetadata& metadata, QRVError* error);
   uint32_t _dataProtectionClassForContainerMetadata(const QRVMetadata& metadata);
+  // Sends to death row every entry of `directories` that can be a container
+  // of `containerClass` by its name but has no metadata file: what a crash
+  // or an older system left. Other entries are left alone.
+  void _cleanupOrphanedDataForDirectories(const std::vector<std::string>& directories,
+                                          QRVContainerClass containerClass);
+  // Drops the code-signing records kept ahead of an installation that never
+  // came.
+  void _cleanupOprhanedCodeSigningMappingData();
   // Moves `url` into a fresh directory on death row under its own name. A
   // missing item is success. Fails with 41. With `startDeletionThread` the
   // emptying of death row is started.
