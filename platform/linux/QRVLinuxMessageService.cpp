@@ -485,12 +485,7 @@ void QRVLinuxMessageService::acceptPending() {
     // The pidfd pins the peer's identity: if the process is gone by the time
     // its start time has been read, the pid may already be someone else's.
     int pidfd = static_cast<int>(syscall(SYS_pidfd_open, cred.pid, 0));
-    std::optional<uint64_t> start = QRVProcInfo::startTime(cred.pid);
-    if (pidfd >= 0) {
-      pollfd p{pidfd, POLLIN, 0};
-      if (poll(&p, 1, 0) == 1) start.reset();
-    }
-    QRVAuditToken token = QRVAuditToken::make(cred.uid, cred.gid, cred.pid, start.value_or(0));
+    QRVAuditToken token = QRVProcInfo::auditTokenForPeer(cred, pidfd);
     std::optional<uint32_t> persona = QRVProcInfo::personaFromCgroup(cred.pid);
     std::shared_ptr<Connection> connection;
     {
