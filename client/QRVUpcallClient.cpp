@@ -201,6 +201,29 @@ std::optional<QRVUpcallAnswer> QRVUpcallClient::askWithItems(const std::vector<u
   return answer;
 }
 
+const char* QRVUpcallClient::returnCodeMeaning(int32_t code) {
+  switch (code) {
+    case 0:
+      return "answered";
+    case M::kTypeError:
+      return "malformed request";
+    case M::kBadID:
+      return "unknown message id";
+    case M::kTrailerError:
+      return "no sender credentials";
+    case M::kStatusBadRequest:
+      return "bad request, or no user identity for the persona";
+    case M::kStatusUnreadable:
+      return "an item could not be read";
+    case M::kStatusNoReplyBuffer:
+      return "no reply buffer";
+    case M::kNotEntitled:
+      return "caller not entitled";
+    default:
+      return "unknown return code";
+  }
+}
+
 std::optional<std::vector<uint8_t>> QRVUpcallClient::packRequest(const QRVUpcallProcess& process,
                                                                  QRVClientError* error) {
   Packbuff pb(sb_packbuff_new(1024));

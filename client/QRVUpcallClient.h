@@ -99,6 +99,9 @@ class QRVUpcallClient {
   std::optional<QRVUpcallAnswer> askWithItems(const std::vector<uint8_t>& items, uint32_t messageId,
                                               std::chrono::milliseconds timeout, QRVClientError* error);
 
+  // A few words on an answer's return code, for people.
+  static const char* returnCodeMeaning(int32_t code);
+
   // The request items for `process`, as a packed buffer.
   static std::optional<std::vector<uint8_t>> packRequest(const QRVUpcallProcess& process, QRVClientError* error);
   // The reply items; nothing (EBADMSG) when they break the format.

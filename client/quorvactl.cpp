@@ -446,19 +446,6 @@ bool parseUpcall(Words& words, Options& options, QRVUpcallProcess* process, std:
   return true;
 }
 
-const char* upcallReturnCodeMeaning(int32_t code) {
-  switch (code) {
-    case QRVUpcallMessage::kTypeError: return "malformed request";
-    case QRVUpcallMessage::kBadID: return "unknown message id";
-    case QRVUpcallMessage::kTrailerError: return "no sender credentials";
-    case QRVUpcallMessage::kStatusBadRequest: return "bad request or no user identity for the persona";
-    case QRVUpcallMessage::kStatusUnreadable: return "an item could not be read";
-    case QRVUpcallMessage::kStatusNoReplyBuffer: return "no reply buffer";
-    case QRVUpcallMessage::kNotEntitled: return "caller not entitled";
-    default: return "unknown";
-  }
-}
-
 int runUpcall(Words& words, Options& options) {
   QRVUpcallProcess process;
   std::string error;
@@ -475,7 +462,7 @@ int runUpcall(Words& words, Options& options) {
   if (answer->returnCode != 0) {
     // Return codes may be negative, which the reply renderings (unsigned
     // numbers only) cannot show.
-    const char* meaning = upcallReturnCodeMeaning(answer->returnCode);
+    const char* meaning = QRVUpcallClient::returnCodeMeaning(answer->returnCode);
     if (options.json)
       fmt::print("{{\"ReturnCode\": {}, \"Meaning\": {}}}\n", answer->returnCode, QRVReplyFormat::jsonString(meaning));
     else
