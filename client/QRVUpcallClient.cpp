@@ -12,6 +12,7 @@
 #include <cstring>
 #include <memory>
 
+#include "base/QRVDescriptorPassing.h"
 #include "base/QRVUpcallMessage.h"
 #include "packbuff/packbuff.h"
 
@@ -45,7 +46,7 @@ bool fail(QRVClientError* error, int errnum, std::string message) {
 
 // The reply's region: at least `size` bytes of a sealed memory file.
 bool readRegion(int fd, uint32_t size, std::vector<uint8_t>* out, QRVClientError* error) {
-  constexpr int kSeals = F_SEAL_WRITE | F_SEAL_GROW | F_SEAL_SHRINK;
+  constexpr int kSeals = QRVDescriptorPassing::kContentSeals;
   int seals = fcntl(fd, F_GET_SEALS);
   struct stat st;
   if (seals < 0 || (seals & kSeals) != kSeals || fstat(fd, &st) != 0 || static_cast<uint64_t>(st.st_size) < size)
@@ -116,29 +117,14 @@ std::optional<QRVUpcallAnswer> QRVUpcallClient::askWithItems(const std::vector<u
                                                              QRVClientError* error) {
   // The items go in a memory file sealed before it is sent: the daemon
   // refuses any it could see change.
-  Descriptor region(memfd_create("quorva-upcall-request", MFD_CLOEXEC | MFD_ALLOW_SEALING));
-  if (region.get() < 0 || write(region.get(), items.data(), items.size()) != static_cast<ssize_t>(items.size()) ||
-      fcntl(region.get(), F_ADD_SEALS, F_SEAL_WRITE | F_SEAL_GROW | F_SEAL_SHRINK | F_SEAL_SEAL) != 0) {
+  Descriptor region(QRVDescriptorPassing::makeSealedMemory("quorva-upcall-request", items));
+  if (region.get() < 0) {
     int e = errno;
     fail(error, e, fmt::format("cannot prepare the request's memory: {}", strerror(e)));
     return std::nullopt;
   }
   std::vector<uint8_t> message = M::encodeRequest(messageId, static_cast<uint32_t>(items.size()));
-  iovec iov{message.data(), message.size()};
-  alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int))] = {};
-  msghdr msg{};
-  msg.msg_iov = &iov;
-  msg.msg_iovlen = 1;
-  msg.msg_control = control;
-  msg.msg_controllen = sizeof control;
-  cmsghdr* c = CMSG_FIRSTHDR(&msg);
-  c->cmsg_level = SOL_SOCKET;
-  c->cmsg_type = SCM_RIGHTS;
-  c->cmsg_len = CMSG_LEN(sizeof(int));
-  int regionFd = region.get();
-  memcpy(CMSG_DATA(c), &regionFd, sizeof regionFd);
-  while (sendmsg(fd_, &msg, MSG_NOSIGNAL) < 0) {
-    if (errno == EINTR) continue;
+  if (QRVDescriptorPassing::send(fd_, message, region.get(), 0) < 0) {
     int e = errno;
     fail(error, e == EPIPE ? ECONNRESET : e, fmt::format("cannot send the upcall request: {}", strerror(e)));
     return std::nullopt;
@@ -154,25 +140,10 @@ std::optional<QRVUpcallAnswer> QRVUpcallClient::askWithItems(const std::vector<u
     return std::nullopt;
   }
   uint8_t reply[M::kMessageSize + 8];
-  iovec rv{reply, sizeof reply};
-  alignas(cmsghdr) char replyControl[CMSG_SPACE(4 * sizeof(int))];
-  msghdr in{};
-  in.msg_iov = &rv;
-  in.msg_iovlen = 1;
-  in.msg_control = replyControl;
-  in.msg_controllen = sizeof replyControl;
-  ssize_t n;
-  while ((n = recvmsg(fd_, &in, MSG_CMSG_CLOEXEC)) < 0 && errno == EINTR) {
-  }
+  std::vector<int> fds;
+  ssize_t n = QRVDescriptorPassing::receive(fd_, reply, sizeof reply, 0, &fds, nullptr);
   std::vector<std::unique_ptr<Descriptor>> regions;
-  for (cmsghdr* h = CMSG_FIRSTHDR(&in); n >= 0 && h; h = CMSG_NXTHDR(&in, h)) {
-    if (h->cmsg_level != SOL_SOCKET || h->cmsg_type != SCM_RIGHTS) continue;
-    for (size_t i = 0; i < (h->cmsg_len - CMSG_LEN(0)) / sizeof(int); i++) {
-      int fd;
-      memcpy(&fd, CMSG_DATA(h) + i * sizeof(int), sizeof fd);
-      regions.push_back(std::make_unique<Descriptor>(fd));
-    }
-  }
+  for (int fd : fds) regions.push_back(std::make_unique<Descriptor>(fd));
   if (n <= 0) {
     fail(error, n == 0 ? ECONNRESET : errno, "quorvad closed the upcall connection without an answer");
     return std::nullopt;

@@ -17,22 +17,21 @@
 #include <map>
 #include <vector>
 
+#include "base/QRVDescriptorPassing.h"
 #include "base/QRVLog.h"
 #include "base/QRVMutex.h"
+#include "platform/linux/QRVUnixSocket.h"
 #include "platform/linux/QRVProcInfo.h"
 
 namespace {
 
 constexpr uint64_t kListenerTag = 0;
 constexpr uint64_t kWakeTag = UINT64_MAX;
-// Descriptors beyond one are an error; room for a few lets the daemon see
-// (and close) them instead of having the kernel drop them unseen.
-constexpr size_t kMaxDescriptors = 8;
-constexpr int kSeals = F_SEAL_WRITE | F_SEAL_GROW | F_SEAL_SHRINK;
+constexpr int kSeals = QRVDescriptorPassing::kContentSeals;
 
 class Descriptor {
  public:
-  explicit Descriptor(int fd = -1) : fd_(fd) {}
+  Descriptor(int fd = -1) : fd_(fd) {}  // NOLINT: converts the received ints
   Descriptor(Descriptor&& o) noexcept : fd_(o.fd_) { o.fd_ = -1; }
   Descriptor& operator=(Descriptor&& o) noexcept {
     std::swap(fd_, o.fd_);
@@ -115,30 +114,14 @@ class QRVLinuxUpcallTransport::Connection {
   bool send(const QRVUpcallReply& reply) {
     Descriptor region;
     if (reply.region) {
-      region = Descriptor(static_cast<int>(memfd_create("quorvad-upcall-reply", MFD_CLOEXEC | MFD_ALLOW_SEALING)));
-      if (region.get() < 0 || !writeAll(region.get(), *reply.region) ||
-          fcntl(region.get(), F_ADD_SEALS, kSeals | F_SEAL_SEAL) != 0) {
-        // Nothing the peer could use: it is told by the connection's end.
+      region = Descriptor(QRVDescriptorPassing::makeSealedMemory("quorvad-upcall-reply", *reply.region));
+      if (region.get() < 0) {
+        // Nothing the peer could use: it learns from the connection's end.
         QRVLogError("cannot make the reply region for pid {}: {}", cred_.pid, strerror(errno));
         return false;
       }
     }
-    iovec iov{const_cast<uint8_t*>(reply.message.data()), reply.message.size()};
-    msghdr msg{};
-    msg.msg_iov = &iov;
-    msg.msg_iovlen = 1;
-    alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int))] = {};
-    if (region.get() >= 0) {
-      msg.msg_control = control;
-      msg.msg_controllen = sizeof control;
-      cmsghdr* c = CMSG_FIRSTHDR(&msg);
-      c->cmsg_level = SOL_SOCKET;
-      c->cmsg_type = SCM_RIGHTS;
-      c->cmsg_len = CMSG_LEN(sizeof(int));
-      int fd = region.get();
-      memcpy(CMSG_DATA(c), &fd, sizeof fd);
-    }
-    if (sendmsg(fd_.get(), &msg, MSG_DONTWAIT | MSG_NOSIGNAL) >= 0) return true;
+    if (QRVDescriptorPassing::send(fd_.get(), reply.message, region.get(), MSG_DONTWAIT) >= 0) return true;
     if (errno == EPIPE || errno == ECONNRESET)
       QRVLogDebug("pid {} left before its upcall reply", cred_.pid);
     else
@@ -147,17 +130,6 @@ class QRVLinuxUpcallTransport::Connection {
   }
 
  private:
-  static bool writeAll(int fd, const std::vector<uint8_t>& bytes) {
-    size_t done = 0;
-    while (done < bytes.size()) {
-      ssize_t n = write(fd, bytes.data() + done, bytes.size() - done);
-      if (n < 0 && errno == EINTR) continue;
-      if (n <= 0) return false;
-      done += static_cast<size_t>(n);
-    }
-    return true;
-  }
-
   const uint64_t id_;
   const Descriptor fd_;
   const ucred cred_;
@@ -246,14 +218,8 @@ bool QRVLinuxUpcallTransport::checkIn(const std::string& name, std::shared_ptr<Q
                                       Handler handler, QRVError* error) {
   if (thread_.joinable()) return QRVFail(error, QRV_POSIX_ERROR(EALREADY, "{} is already checked in", name));
   const std::string& path = options_.socketPath;
-  sockaddr_un addr{};
-  if (path.size() >= sizeof addr.sun_path)
-    return QRVFail(error, QRV_POSIX_ERROR(ENAMETOOLONG, "socket path too long: {}", path));
-  std::error_code ec;
-  std::filesystem::create_directories(std::filesystem::path(path).parent_path(), ec);
-  // A socket left by an earlier run would make bind fail.
-  struct stat st;
-  if (lstat(path.c_str(), &st) == 0 && S_ISSOCK(st.st_mode)) unlink(path.c_str());
+  sockaddr_un addr;
+  if (!QRVUnixSocket::prepareToBind(path, &addr, error)) return false;
 
   Shared& s = *shared_;
   s.epollFd = epoll_create1(EPOLL_CLOEXEC);
@@ -261,8 +227,6 @@ bool QRVLinuxUpcallTransport::checkIn(const std::string& name, std::shared_ptr<Q
   s.listenFd = socket(AF_UNIX, SOCK_SEQPACKET | SOCK_NONBLOCK | SOCK_CLOEXEC, 0);
   if (s.epollFd < 0 || s.wakeFd < 0 || s.listenFd < 0)
     return QRVFail(error, QRV_POSIX_ERROR(errno, "cannot set up {}: {}", name, strerror(errno)));
-  addr.sun_family = AF_UNIX;
-  memcpy(addr.sun_path, path.c_str(), path.size() + 1);
   // The socket inode's mode before bind is the mode the path gets (less the
   // umask), so the path is never more open than 0660; the listen comes only
   // after owner and mode are final, so nobody connects before.
@@ -318,15 +282,8 @@ void QRVLinuxUpcallTransport::run() {
 void QRVLinuxUpcallTransport::acceptPending() {
   static int64_t lastRefusalLog = 0;  // this thread only
   for (;;) {
-    int fd = accept4(shared_->listenFd, nullptr, nullptr, SOCK_NONBLOCK | SOCK_CLOEXEC);
-    if (fd < 0) {
-      if (errno == EINTR || errno == ECONNABORTED) continue;
-      if (errno != EAGAIN && errno != EWOULDBLOCK) {
-        QRVLogError("upcall accept failed: {}", strerror(errno));
-        if (errno == EMFILE || errno == ENFILE) usleep(10'000);
-      }
-      return;
-    }
+    int fd = QRVUnixSocket::next(shared_->listenFd, "com.kelva.quorvad.upcall");
+    if (fd < 0) return;
     ucred cred{};
     socklen_t len = sizeof cred;
     if (getsockopt(fd, SOL_SOCKET, SO_PEERCRED, &cred, &len) != 0) {
@@ -358,25 +315,12 @@ void QRVLinuxUpcallTransport::acceptPending() {
 
 void QRVLinuxUpcallTransport::receive(const std::shared_ptr<Connection>& connection, uint32_t events) {
   std::vector<uint8_t> bytes(QRVUpcallRequest::kMaxKeptBytes);
-  iovec iov{bytes.data(), bytes.size()};
-  alignas(cmsghdr) char control[CMSG_SPACE(kMaxDescriptors * sizeof(int))];
-  msghdr msg{};
-  msg.msg_iov = &iov;
-  msg.msg_iovlen = 1;
-  msg.msg_control = control;
-  msg.msg_controllen = sizeof control;
+  std::vector<int> fds;
+  bool dropped = false;
   // MSG_TRUNC: the real length of a longer message, whose rest is dropped.
-  ssize_t n = recvmsg(connection->fd(), &msg, MSG_DONTWAIT | MSG_CMSG_CLOEXEC | MSG_TRUNC);
-  std::vector<Descriptor> regions;
-  for (cmsghdr* c = CMSG_FIRSTHDR(&msg); n >= 0 && c; c = CMSG_NXTHDR(&msg, c)) {
-    if (c->cmsg_level != SOL_SOCKET || c->cmsg_type != SCM_RIGHTS) continue;
-    size_t count = (c->cmsg_len - CMSG_LEN(0)) / sizeof(int);
-    for (size_t i = 0; i < count; i++) {
-      int fd;
-      memcpy(&fd, CMSG_DATA(c) + i * sizeof(int), sizeof fd);
-      regions.emplace_back(fd);
-    }
-  }
+  ssize_t n = QRVDescriptorPassing::receive(connection->fd(), bytes.data(), bytes.size(), MSG_DONTWAIT | MSG_TRUNC,
+                                            &fds, &dropped);
+  std::vector<Descriptor> regions(fds.begin(), fds.end());
   if (n < 0) {
     if (errno == EAGAIN || errno == EWOULDBLOCK || errno == EINTR) {
       if (!connection->arm(shared_->epollFd, EPOLL_CTL_MOD)) shared_->forget(connection->id());
@@ -396,8 +340,8 @@ void QRVLinuxUpcallTransport::receive(const std::shared_ptr<Connection>& connect
   // Without credentials the request has no sender: the server answers that.
   std::optional<QRVAuditToken> sender;
   if (connection->credentials().uid != static_cast<uid_t>(-1)) sender = connection->token();
-  auto request = std::make_shared<Request>(std::move(bytes), static_cast<size_t>(n), sender, std::move(regions),
-                                           (msg.msg_flags & MSG_CTRUNC) != 0);
+  auto request =
+      std::make_shared<Request>(std::move(bytes), static_cast<size_t>(n), sender, std::move(regions), dropped);
   std::shared_ptr<Shared> shared = shared_;
   shared->queue->async([shared, connection, request]() mutable {
     std::optional<QRVUpcallReply> reply = shared->handler(*request);

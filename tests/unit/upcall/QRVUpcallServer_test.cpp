@@ -15,6 +15,7 @@
 #include <fstream>
 #include <thread>
 
+#include "base/QRVDescriptorPassing.h"
 #include "base/QRVUpcallMessage.h"
 #include "codesigning/QRVCodeSigningMapping.h"
 #include "core/QRVCommandQueue.h"
@@ -115,23 +116,26 @@ class Peer {
     EXPECT_EQ(connect(fd_, reinterpret_cast<sockaddr*>(&a), sizeof a), 0) << strerror(errno);
   }
   ~Peer() { close(fd_); }
-  // Sends `message` with `fds` (closed here after sending).
+  // Sends `message` with `fds` (closed here after sending). Up to one goes
+  // through the shared helper; more are attached by hand.
   void send(const std::vector<uint8_t>& message, std::vector<int> fds = {}) {
-    iovec iov{const_cast<uint8_t*>(message.data()), message.size()};
-    msghdr msg{};
-    msg.msg_iov = &iov;
-    msg.msg_iovlen = 1;
-    std::vector<char> control(CMSG_SPACE(sizeof(int) * std::max<size_t>(1, fds.size())));
-    if (!fds.empty()) {
+    if (fds.size() <= 1) {
+      EXPECT_GE(QRVDescriptorPassing::send(fd_, message, fds.empty() ? -1 : fds[0], 0), 0) << strerror(errno);
+    } else {
+      iovec iov{const_cast<uint8_t*>(message.data()), message.size()};
+      std::vector<char> control(CMSG_SPACE(sizeof(int) * fds.size()));
+      msghdr msg{};
+      msg.msg_iov = &iov;
+      msg.msg_iovlen = 1;
       msg.msg_control = control.data();
-      msg.msg_controllen = CMSG_SPACE(sizeof(int) * fds.size());
+      msg.msg_controllen = control.size();
       cmsghdr* c = CMSG_FIRSTHDR(&msg);
       c->cmsg_level = SOL_SOCKET;
       c->cmsg_type = SCM_RIGHTS;
       c->cmsg_len = CMSG_LEN(sizeof(int) * fds.size());
       memcpy(CMSG_DATA(c), fds.data(), sizeof(int) * fds.size());
+      EXPECT_GE(sendmsg(fd_, &msg, MSG_NOSIGNAL), 0) << strerror(errno);
     }
-    EXPECT_GE(sendmsg(fd_, &msg, MSG_NOSIGNAL), 0) << strerror(errno);
     for (int fd : fds) close(fd);
   }
   struct Reply {
@@ -145,26 +149,17 @@ class Peer {
     pollfd p{fd_, POLLIN, 0};
     EXPECT_EQ(poll(&p, 1, 10'000), 1) << "no reply";
     r.message.resize(128);
-    iovec iov{r.message.data(), r.message.size()};
-    alignas(cmsghdr) char control[CMSG_SPACE(4 * sizeof(int))];
-    msghdr msg{};
-    msg.msg_iov = &iov;
-    msg.msg_iovlen = 1;
-    msg.msg_control = control;
-    msg.msg_controllen = sizeof control;
-    ssize_t n = recvmsg(fd_, &msg, MSG_CMSG_CLOEXEC);
+    std::vector<int> fds;
+    ssize_t n = QRVDescriptorPassing::receive(fd_, r.message.data(), r.message.size(), 0, &fds, nullptr);
     r.message.resize(n > 0 ? n : 0);
-    for (cmsghdr* c = CMSG_FIRSTHDR(&msg); c; c = CMSG_NXTHDR(&msg, c)) {
-      for (size_t i = 0; i < (c->cmsg_len - CMSG_LEN(0)) / sizeof(int); i++, r.regions++) {
-        int fd;
-        memcpy(&fd, CMSG_DATA(c) + i * sizeof(int), sizeof fd);
-        struct stat st;
-        fstat(fd, &st);
-        r.seals = fcntl(fd, F_GET_SEALS);
-        r.region.resize(st.st_size);
-        EXPECT_EQ(pread(fd, r.region.data(), r.region.size(), 0), st.st_size);
-        close(fd);
-      }
+    for (int fd : fds) {
+      struct stat st;
+      fstat(fd, &st);
+      r.regions++;
+      r.seals = fcntl(fd, F_GET_SEALS);
+      r.region.resize(st.st_size);
+      EXPECT_EQ(pread(fd, r.region.data(), r.region.size(), 0), st.st_size);
+      close(fd);
     }
     return r;
   }
