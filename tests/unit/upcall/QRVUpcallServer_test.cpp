@@ -450,3 +450,39 @@ TEST_F(QRVUpcallServerTest, OnlyRootAndEntitledPeersAreServed) {
   EXPECT_EQ(answer(QRVAuditToken::make(0, 0, 99, 1)), 0);
   EXPECT_EQ(answer(std::nullopt), -309);
 }
+
+TEST_F(QRVUpcallServerTest, ThePersonaPicksTheUserIdentity) {
+  env_.personas->supported = true;
+  auto persona = [](uint32_t id, uint32_t type, const char* unique, const char* home) {
+    QRVPersona p;
+    p.personaID = id, p.uid = 501, p.gid = 501, p.type = type, p.uniqueString = unique, p.home = home;
+    return p;
+  };
+  env_.personas->list = {persona(1000, 0, "PERSONAL", "/private/var/mobile"),
+                         persona(2000, 1, "WORK", "/private/var/work"),
+                         persona(3000, 2, "GUEST", "/private/var/guest")};
+  env_.services->userIdentityCache->flush();
+  fs::create_directories(env_.root.path() + "/private/var/work/Containers");
+  auto asked = [&](uint32_t persona) {
+    std::vector<uint8_t> b;
+    str(b, M::kRequestCodeSignatureID, "com.example.app");
+    item(b, 1, M::kRequestUID, 501);
+    item(b, 1, M::kRequestPersonaID, persona);
+    end(b);
+    return items(ask(b).region);
+  };
+  // The enterprise persona has containers of its own; a guest uses the
+  // personal user's, as does a request without persona.
+  std::vector<Item> work = asked(2000);
+  ASSERT_EQ(work.size(), 4u);
+  EXPECT_EQ(work[0].text, env_.root.path() + "/private/var/work");
+  EXPECT_EQ(work[1].text.rfind(env_.root.path() + "/private/var/work/", 0), 0u) << work[1].text;
+  std::vector<Item> personal = asked(M::kNoPersona);
+  ASSERT_EQ(personal.size(), 4u);
+  EXPECT_EQ(personal[0].text, env_.root.path() + "/private/var/mobile");
+  EXPECT_NE(personal[1].text, work[1].text);
+  std::vector<Item> guest = asked(3000);
+  ASSERT_EQ(guest.size(), 4u);
+  EXPECT_EQ(guest[1].text, personal[1].text);
+  EXPECT_EQ(asked(1000)[1].text, personal[1].text);
+}
