@@ -463,11 +463,11 @@ TEST_F(QRVUpcallServerTest, ThePersonaPicksTheUserIdentity) {
                          persona(3000, 2, "GUEST", "/private/var/guest")};
   env_.services->userIdentityCache->flush();
   fs::create_directories(env_.root.path() + "/private/var/work/Containers");
-  auto asked = [&](uint32_t persona) {
+  auto asked = [&](uint32_t personaID) {
     std::vector<uint8_t> b;
     str(b, M::kRequestCodeSignatureID, "com.example.app");
     item(b, 1, M::kRequestUID, 501);
-    item(b, 1, M::kRequestPersonaID, persona);
+    item(b, 1, M::kRequestPersonaID, personaID);
     end(b);
     return items(ask(b).region);
   };
