@@ -82,9 +82,15 @@ std::optional<QRVClient> QRVClient::connect(const std::string& root, QRVClientEr
 
 std::optional<QRVClient> QRVClient::connectToSocket(const std::string& socketPath,
                                                     QRVClientError* error) {
-  auto failed = [&](int errnum, std::string message) -> std::optional<QRVClient> {
+  int fd = connectUnixSocket(socketPath, SOCK_STREAM, error);
+  if (fd < 0) return std::nullopt;
+  return QRVClient(fd, socketPath);
+}
+
+int QRVClient::connectUnixSocket(const std::string& socketPath, int type, QRVClientError* error) {
+  auto failed = [&](int errnum, std::string message) {
     if (error) *error = {errnum, std::move(message)};
-    return std::nullopt;
+    return -1;
   };
 
   sockaddr_un address{};
@@ -96,7 +102,7 @@ std::optional<QRVClient> QRVClient::connectToSocket(const std::string& socketPat
                               socketPath.size(), sizeof(address.sun_path) - 1, socketPath));
   memcpy(address.sun_path, socketPath.c_str(), socketPath.size() + 1);
 
-  int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  int fd = socket(AF_UNIX, type | SOCK_CLOEXEC, 0);
   if (fd < 0) {
     int e = errno;
     return failed(e, fmt::format("cannot create a socket: {}", errnoText(e)));
@@ -115,7 +121,7 @@ std::optional<QRVClient> QRVClient::connectToSocket(const std::string& socketPat
       return failed(e, fmt::format("quorvad is not running (nothing listening at {})", socketPath));
     return failed(e, fmt::format("cannot connect to quorvad at {}: {}", socketPath, errnoText(e)));
   }
-  return QRVClient(fd, socketPath);
+  return fd;
 }
 
 // --- deadlines ------------------------------------------------------------

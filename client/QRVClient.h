@@ -77,6 +77,9 @@ class QRVClient {
   // Same, given the socket path itself.
   static std::optional<QRVClient> connectToSocket(const std::string& socketPath,
                                                   QRVClientError* error);
+  // A close-on-exec Unix socket of `type` connected to `socketPath`, or -1
+  // with `error` filled as connect() fills it.
+  static int connectUnixSocket(const std::string& socketPath, int type, QRVClientError* error);
   // Takes ownership of an already connected stream socket (for example one
   // end of a socketpair). `description` names the peer in error messages.
   static QRVClient adoptSocket(int fd, std::string description = "quorvad");

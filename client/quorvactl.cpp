@@ -17,6 +17,7 @@
 #include "client/QRVProtocol.h"
 #include "client/QRVReplyFormat.h"
 #include "client/QRVRequestArguments.h"
+#include "client/QRVUpcallClient.h"
 
 namespace {
 
@@ -405,6 +406,87 @@ QRV_TYPED(buildCodeSigningInvalidateOrphans, "",
 
 #undef QRV_TYPED
 
+// --- upcall ---------------------------------------------------------------
+
+// Reads the upcall's options into `process`.
+bool parseUpcall(Words& words, Options& options, QRVUpcallProcess* process, std::string* error) {
+  auto number = [&](std::string_view name, const std::string& text, std::optional<uint32_t>* out) {
+    uint64_t n = 0;
+    if (!parseNumber(name, text, &n, error)) return false;
+    if (n > UINT32_MAX) {
+      *error = fmt::format("{} needs a 32-bit number, not \"{}\"", name, text);
+      return false;
+    }
+    *out = static_cast<uint32_t>(n);
+    return true;
+  };
+  static constexpr std::string_view kOptions[] = {
+      "--code-signing-id", "--container-id", "--application-id", "--system-container", "--app-group",
+      "--system-group",    "--uid",          "--persona",        "--container-type"};
+  while (!words.empty()) {
+    if (takeCommonOption(words, options, error)) {
+      if (!error->empty()) return false;
+      continue;
+    }
+    std::string word(words.peek());
+    std::string_view name;
+    std::string v;
+    for (std::string_view o : kOptions)
+      if (takeOptionValue(words, o, &v, error)) {
+        name = o;
+        break;
+      }
+    if (!error->empty()) return false;
+    if (name.empty()) {
+      *error = fmt::format("upcall does not take \"{}\"", word);
+      return false;
+    }
+    if (name == "--code-signing-id") process->codeSigningIdentifier = v;
+    if (name == "--container-id") process->containerIdentifier = v;
+    if (name == "--application-id") process->applicationIdentifier = v;
+    if (name == "--system-container") process->systemContainerIdentifier = v;
+    if (name == "--app-group") process->appGroupIdentifiers.push_back(v);
+    if (name == "--system-group") process->systemGroupIdentifiers.push_back(v);
+    if ((name == "--uid" && !number(name, v, &process->uid)) ||
+        (name == "--persona" && !number(name, v, &process->personaID)) ||
+        (name == "--container-type" && !number(name, v, &process->containerType)))
+      return false;
+  }
+  return true;
+}
+
+int runUpcall(Words& words, Options& options) {
+  QRVUpcallProcess process;
+  std::string error;
+  if (!parseUpcall(words, options, &process, &error)) {
+    fmt::print(stderr, "quorvactl: {}\nTry 'quorvactl help upcall'.\n", error);
+    return kExitUsage;
+  }
+  QRVClientError clientError;
+  auto answer = QRVUpcallClient::ask(QRVClient::resolveRoot(options.root), process, options.timeout, &clientError);
+  if (!answer) {
+    fmt::print(stderr, "quorvactl: {}\n", clientError.message);
+    return kExitNoAnswer;
+  }
+  if (answer->returnCode != 0) {
+    // Return codes may be negative, which the reply renderings (unsigned
+    // numbers only) cannot show.
+    const char* meaning = QRVUpcallClient::returnCodeMeaning(answer->returnCode);
+    if (options.json)
+      fmt::print("{{\"ReturnCode\": {}, \"Meaning\": {}}}\n", answer->returnCode, QRVReplyFormat::jsonString(meaning));
+    else
+      fmt::print("ReturnCode = {} ({})\n", answer->returnCode, meaning);
+    return kExitDaemonError;
+  }
+  QRVPlist reply = answer->containers.plist();
+  reply.set("ReturnCode", QRVPlist::uinteger(0));
+  if (options.json)
+    fmt::print("{}\n", QRVReplyFormat::json(reply));
+  else
+    fmt::print("{}", QRVReplyFormat::human(reply));
+  return kExitSuccess;
+}
+
 struct Subcommand {
   std::string_view name;
   std::string_view synopsis;
@@ -513,6 +595,24 @@ Example:
     {"codesign-invalidate-orphans", "codesign-invalidate-orphans",
      "Invalidates the code-signing information of applications whose bundle\ncontainer is gone.\n",
      buildCodeSigningInvalidateOrphans},
+    {"upcall",
+     "upcall [--code-signing-id ID] [--container-id ID] [--application-id ID] [--uid N] [--persona N] "
+     "[--container-type N] [--app-group G ...] [--system-container ID] [--system-group G ...]",
+     R"(Asks for every container path of a process, as a sandbox launcher does
+before starting it, over DIR/run/quorvad/com.kelva.quorvad.upcall (root or
+the entitlement com.kelva.private.Quorva.kernelUpcall only). The data
+container is the one of --container-id, else of --code-signing-id;
+--container-type is 0 for an application (default), 1 for a plug-in;
+--persona is the kernel persona id (default: none). --app-group and
+--system-group may be given several times.
+
+Prints HomeDirectory, DataContainer, TempDirectory, AppGroups,
+SystemContainer, SystemGroups (what was found), Complete (every lookup
+succeeded) and ReturnCode = 0; a refused request prints only its
+ReturnCode (55 not entitled, 4 bad request, 5 unreadable item, -300
+malformed message) and exits with 1.
+)",
+     nullptr},
 };
 
 const Subcommand* findSubcommand(std::string_view name) {
@@ -629,6 +729,7 @@ int main(int argc, char** argv) {
     return kExitSuccess;
   }
 
+  if (!subcommand->buildRequest) return runUpcall(words, options);
   auto request = subcommand->buildRequest(words, options, &error);
   if (!request) return usageError(error);
   return sendAndPrint(options, *request);

@@ -21,6 +21,18 @@ struct QRVPersona {
   bool isSystem = false;
 };
 
+// The kernel's persona types as the upcall sees them. The persona list speaks
+// of the user identity's types instead (0 personal, 1 enterprise, anything
+// else no specific persona); an enterprise persona is the kernel's managed
+// persona and the personal one its default persona, the two kinds that have
+// a user identity of their own. Every other persona is a guest of the
+// device's personal user.
+enum : uint32_t {
+  QRVKernelPersonaTypeGuest = 1,
+  QRVKernelPersonaTypeManaged = 2,
+  QRVKernelPersonaTypeDefault = 5,
+};
+
 class QRVPersonaService {
  public:
   virtual ~QRVPersonaService() = default;
@@ -31,4 +43,19 @@ class QRVPersonaService {
   // Called after every change of the list.
   virtual void observe(std::function<void()> onChange) = 0;
   virtual uint64_t multiUserFlags() = 0;
+
+  // The kernel's type of persona `personaID`, or none when there is no such
+  // persona.
+  virtual std::optional<uint32_t> kernelPersonaType(uint32_t personaID) {
+    std::optional<QRVPersona> persona = personaForID(personaID);
+    if (!persona) return std::nullopt;
+    switch (persona->type) {
+      case 0:
+        return QRVKernelPersonaTypeDefault;
+      case 1:
+        return QRVKernelPersonaTypeManaged;
+      default:
+        return QRVKernelPersonaTypeGuest;
+    }
+  }
 };

@@ -20,6 +20,7 @@
 #include "platform/QRVSandbox.h"
 #include "platform/QRVSystemInfo.h"
 #include "platform/QRVTrustStore.h"
+#include "platform/QRVUpcallTransport.h"
 
 struct QRVPlatform {
   // Claimed before anything else: one daemon per root.
@@ -38,6 +39,8 @@ struct QRVPlatform {
   std::shared_ptr<QRVFileSystem> posixFileSystem;
   std::shared_ptr<QRVFileSystemExtras> fileSystem;
   std::shared_ptr<QRVApplicationTermination> applicationTermination;
+  // Where sandbox launchers ask for a process's container paths.
+  std::shared_ptr<QRVUpcallTransport> upcall;
 
   struct LinuxOptions {
     // How long a client may leave its replies unread before it is cut off.

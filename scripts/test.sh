@@ -41,6 +41,7 @@ ctest --test-dir "$build" --output-on-failure -j "$(nproc)" --timeout 300
 # (a restricted container) it is left out rather than run unfenced.
 if [[ $(id -u) -ne 0 ]] || unshare --mount --propagation private true 2>/dev/null; then
   fuzz request scripts/fuzz-requests.sh "${QUORVAD_FUZZ_SECONDS:-20}"
+  fuzz upcall env FUZZ_TARGET=upcall scripts/fuzz-requests.sh "${QUORVAD_FUZZ_SECONDS:-20}"
 else
-  echo "request fuzzing skipped: no private mount namespace here"
+  echo "request and upcall fuzzing skipped: no private mount namespace here"
 fi

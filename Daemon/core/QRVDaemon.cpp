@@ -76,7 +76,7 @@ void QRVDaemon::quorvad_init() {
   }
   sharedConnection_->quorvaSetup();
 
-  if (!upcallServer_.start(listenerQueue_)) QRVTerminate("Failed to initialize kernel upcall interface.");
+  if (!upcallServer_.QRVKernServerStart(listenerQueue_)) QRVTerminate("Failed to initialize kernel upcall interface.");
 
   int status = services_->platform.lockState->observe([this] { mainQueue_->async([this] { lockStateCallback(); }); });
   if (status != 0)

@@ -19,6 +19,7 @@
 #include "platform/QRVSandbox.h"
 #include "platform/QRVSystemInfo.h"
 #include "platform/QRVTrustStore.h"
+#include "platform/QRVUpcallTransport.h"
 
 class QRVFakeTrustStore : public QRVTrustStore {
  public:
@@ -227,4 +228,22 @@ class QRVFakeApplicationTermination : public QRVApplicationTermination {
   bool refuse = false;
   int held = 0;
   std::vector<std::string> terminated;
+};
+
+// An upcall transport that serves nobody: it keeps what the server checked
+// in, so a test can see that it did, or refuses the check-in.
+class QRVFakeUpcallTransport : public QRVUpcallTransport {
+ public:
+  bool refuseCheckIn = false;
+  std::string name;
+  std::shared_ptr<QRVSerialQueue> queue;
+  Handler handler;
+  bool checkIn(const std::string& serviceName, std::shared_ptr<QRVSerialQueue> serviceQueue, Handler serviceHandler,
+               QRVError* error) override {
+    if (refuseCheckIn) return QRVFail(error, QRV_POSIX_ERROR_QUIET(EADDRINUSE, "{} is taken", serviceName));
+    name = serviceName;
+    queue = std::move(serviceQueue);
+    handler = std::move(serviceHandler);
+    return true;
+  }
 };

@@ -19,6 +19,7 @@
 
 #include "base/QRVLog.h"
 #include "base/QRVWireFrame.h"
+#include "platform/linux/QRVUnixSocket.h"
 #include "platform/linux/QRVProcInfo.h"
 
 namespace {
@@ -383,19 +384,11 @@ bool QRVLinuxMessageService::openListeningSocket(const std::string& name, QRVErr
   }
 
   const std::string& path = options_.socketPath;
-  sockaddr_un addr{};
-  if (path.size() >= sizeof addr.sun_path)
-    return QRVFail(error, QRV_POSIX_ERROR(ENAMETOOLONG, "socket path too long: {}", path));
-  std::error_code ec;
-  std::filesystem::create_directories(std::filesystem::path(path).parent_path(), ec);
-  // A socket left by an earlier run would make bind fail.
-  struct stat st;
-  if (lstat(path.c_str(), &st) == 0 && S_ISSOCK(st.st_mode)) unlink(path.c_str());
+  sockaddr_un addr;
+  if (!QRVUnixSocket::prepareToBind(path, &addr, error)) return false;
 
   listenFd_ = socket(AF_UNIX, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0);
   if (listenFd_ < 0) return QRVFail(error, QRV_POSIX_ERROR(errno, "socket: {}", strerror(errno)));
-  addr.sun_family = AF_UNIX;
-  memcpy(addr.sun_path, path.c_str(), path.size() + 1);
   if (bind(listenFd_, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0 ||
       chmod(path.c_str(), 0666) != 0 || ::listen(listenFd_, SOMAXCONN) != 0) {
     int e = errno;
@@ -457,16 +450,8 @@ void QRVLinuxMessageService::workerLoop() {
 
 void QRVLinuxMessageService::acceptPending() {
   for (int accepted = 0; accepted < 64; accepted++) {
-    int fd = accept4(listenFd_, nullptr, nullptr, SOCK_NONBLOCK | SOCK_CLOEXEC);
-    if (fd < 0) {
-      if (errno == EINTR || errno == ECONNABORTED) continue;
-      if (errno != EAGAIN && errno != EWOULDBLOCK) {
-        QRVLogError("accept failed: {}", strerror(errno));
-        // Out of descriptors: give the clients that hold them a moment.
-        if (errno == EMFILE || errno == ENFILE) usleep(10'000);
-      }
-      break;
-    }
+    int fd = QRVUnixSocket::next(listenFd_, "com.kelva.quorvad");
+    if (fd < 0) break;
     ucred cred{};
     socklen_t len = sizeof cred;
     if (getsockopt(fd, SOL_SOCKET, SO_PEERCRED, &cred, &len) != 0) {
@@ -485,12 +470,7 @@ void QRVLinuxMessageService::acceptPending() {
     // The pidfd pins the peer's identity: if the process is gone by the time
     // its start time has been read, the pid may already be someone else's.
     int pidfd = static_cast<int>(syscall(SYS_pidfd_open, cred.pid, 0));
-    std::optional<uint64_t> start = QRVProcInfo::startTime(cred.pid);
-    if (pidfd >= 0) {
-      pollfd p{pidfd, POLLIN, 0};
-      if (poll(&p, 1, 0) == 1) start.reset();
-    }
-    QRVAuditToken token = QRVAuditToken::make(cred.uid, cred.gid, cred.pid, start.value_or(0));
+    QRVAuditToken token = QRVProcInfo::auditTokenForPeer(cred, pidfd);
     std::optional<uint32_t> persona = QRVProcInfo::personaFromCgroup(cred.pid);
     std::shared_ptr<Connection> connection;
     {

@@ -15,6 +15,7 @@
 #include "platform/linux/QRVLinuxSandbox.h"
 #include "platform/linux/QRVLinuxSystemInfo.h"
 #include "platform/linux/QRVLinuxTrustStore.h"
+#include "platform/linux/QRVLinuxUpcallTransport.h"
 
 QRVPlatform QRVPlatform::makeLinux(const std::string& root, const LinuxOptions& linuxOptions) {
   // Requests may carry multi-megabyte strings. By default the allocator
@@ -55,5 +56,11 @@ QRVPlatform QRVPlatform::makeLinux(const std::string& root, const LinuxOptions& 
   p.posixFileSystem = std::make_shared<QRVLinuxFileSystem>();
   p.fileSystem = std::make_shared<QRVLinuxFileSystemExtras>(p.lockState);
   p.applicationTermination = std::make_shared<QRVLinuxApplicationTermination>(under(linuxOptions.applicationSlice));
+  // Launchers reach the upcall socket through the group "quorva-launch" when
+  // the root's group file has it; otherwise only root does.
+  QRVLinuxUpcallTransport::Options upcallOptions;
+  upcallOptions.socketPath = under("/run/quorvad/com.kelva.quorvad.upcall");
+  upcallOptions.group = p.accounts->groupIDForName("quorva-launch");
+  p.upcall = std::make_shared<QRVLinuxUpcallTransport>(upcallOptions);
   return p;
 }

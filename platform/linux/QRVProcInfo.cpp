@@ -1,5 +1,6 @@
 #include "platform/linux/QRVProcInfo.h"
 
+#include <poll.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -37,6 +38,15 @@ std::optional<uint64_t> startTime(pid_t pid) {
   uint64_t start = 0;
   if (!(fields >> start)) return std::nullopt;
   return start;
+}
+
+QRVAuditToken auditTokenForPeer(const ucred& cred, int pidfd) {
+  std::optional<uint64_t> start = startTime(cred.pid);
+  if (pidfd >= 0) {
+    pollfd p{pidfd, POLLIN, 0};
+    if (poll(&p, 1, 0) == 1) start.reset();
+  }
+  return QRVAuditToken::make(cred.uid, cred.gid, cred.pid, start.value_or(0));
 }
 
 std::optional<FileId> executable(pid_t pid) {

@@ -3,16 +3,25 @@
 // to a particular process compare its start time (see QRVAuditToken).
 #pragma once
 
+#include <sys/socket.h>
 #include <sys/types.h>
 
 #include <cstdint>
 #include <optional>
 #include <string>
 
+#include "platform/QRVAuditToken.h"
+
 namespace QRVProcInfo {
 
 // Field 22 of /proc/<pid>/stat: clock ticks after boot at which it started.
 std::optional<uint64_t> startTime(pid_t pid);
+
+// The audit token of a socket peer with credentials `cred`. `pidfd` (-1 when
+// there is none) pins the process: when it has already exited by the time its
+// start time has been read, the pid may be someone else's by now, so the
+// token gets no start time and matches no trust-store entry.
+QRVAuditToken auditTokenForPeer(const ucred& cred, int pidfd);
 
 // Device and inode of the process's executable (/proc/<pid>/exe).
 struct FileId {

@@ -65,6 +65,7 @@ struct QRVTestServices {
   std::shared_ptr<QRVFakePersonaService> personas = std::make_shared<QRVFakePersonaService>();
   std::shared_ptr<QRVFakeApplicationTermination> applicationTermination =
       std::make_shared<QRVFakeApplicationTermination>();
+  std::shared_ptr<QRVFakeUpcallTransport> upcall = std::make_shared<QRVFakeUpcallTransport>();
   // The real file system under the fake lock state; classes are kept in memory
   // when the tests cannot write trusted extended attributes (not root).
   std::shared_ptr<QRVFakeFileSystemExtras> fileSystem = std::make_shared<QRVFakeFileSystemExtras>(
@@ -91,6 +92,7 @@ struct QRVTestServices {
     p.posixFileSystem = posixFileSystem;
     p.fileSystem = fileSystem;
     p.applicationTermination = applicationTermination;
+    p.upcall = upcall;
     fileSystem->setInMemoryProtectionClasses(geteuid() != 0);
     posixFileSystem->setRecordOwnership(geteuid() != 0);
     accounts->accounts = {{"root", 0, 0, "/private/var/root"},
