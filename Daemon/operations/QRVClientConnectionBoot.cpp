@@ -35,6 +35,11 @@ void QRVClientConnection::rebootQuorvaCleanupWithCompletion(std::function<void()
   // device-wide ones first.
   auto sentence = [&](const std::string& url, const char* failure) {
     QRVError error;
+    // The configuration makes these trees when it is asked for them: an
+    // empty one holds no container and is left, so that a boot without
+    // transient containers gives death row nothing to do.
+    std::optional<std::vector<std::string>> items = fm.urlsForItemsInDirectoryAtURL(url, &error);
+    if (items && items->empty()) return;
     if (!_moveItemAtURLToDeathRow(url, /*isDir=*/true, /*startDeletionThread=*/false, &error))
       QRVLogError(fmt::runtime(failure), url, error.description());
   };

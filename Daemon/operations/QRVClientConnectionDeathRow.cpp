@@ -42,6 +42,10 @@ bool QRVClientConnection::_moveItemAtURLToDeathRow(const std::string& url, bool 
     if (!(underlying.isPOSIX() && underlying.code() == ENOENT))
       return QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kDeathRowMoveFailed, underlying,
                                                  "Failed to move item at: {} to: {}", url, destination));
+    // Nothing to sentence: leave death row as it was, so that a start with
+    // nothing to delete has nothing to empty.
+    fm.removeItemAtURL(*unique, nullptr);
+    return true;
   }
   if (startDeletionThread) deleteContainersOnDeathRowWithCompletion(nullptr);
   return true;

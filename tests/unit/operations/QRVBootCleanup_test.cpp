@@ -69,11 +69,15 @@ TEST_F(BootCleanupTest, TransientTreesAndOrphansGoWhatIsNotTheDaemonsStays) {
   EXPECT_NE(log.text().find("Deleting orphaned data missing a metadata file at: " + orphan.string()),
             std::string::npos);
 
-  // Nothing left to do: a second boot finds nothing more and logs no error.
+  // Nothing left to do: a second boot finds nothing more, logs no error and
+  // gives death row nothing to empty.
   QRVError error;
   EXPECT_NE(lookup(live->containerIdentity(), &error), nullptr) << error.description();
+  const std::string deathRow = env_.services->globalConfiguration->deathrowDirectory();
+  fs::remove_all(deathRow);
   const size_t before = log.text().size();
   rebootCleanup();
+  EXPECT_TRUE(!fs::exists(deathRow) || fs::is_empty(deathRow));
   EXPECT_EQ(log.text().substr(before).find("<Error>"), std::string::npos) << log.text().substr(before);
   EXPECT_TRUE(fs::exists(live->url()));
 }
