@@ -5,7 +5,9 @@
 //
 // Points: create.staged, create.metadata-written, create.live;
 // replace.journal-written, replace.old-parked, replace.new-placed,
-// replace.cache-updated, replace.staging-removed; deathrow.item-removed.
+// replace.cache-updated, replace.staging-removed; deathrow.item-removed;
+// dataprotection.update-written, dataprotection.first-item-changed,
+// dataprotection.before-delete; boot.uuid-rolled, boot.restore-child-moved.
 #pragma once
 
 #include "core/QRVServices.h"

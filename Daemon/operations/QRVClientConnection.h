@@ -229,6 +229,17 @@ class QRVClientConnection {
                                          QRVError* error);
   bool _createSubDirectories(const std::string& url, const QRVMetadata& metadata, QRVError* error);
   uint32_t _dataProtectionClassForContainerMetadata(const QRVMetadata& metadata);
+  // Gives every system and system group container of this connection's user
+  // a new directory UUID (after a build upgrade, so that no process keeps
+  // reaching a container by a path it learned before), except the shared
+  // system group.
+  void _regenerateAllSystemContainerPaths();
+  // Restores the system and system group containers of a backup into their
+  // live containers, child by child. What cannot be restored ends in the
+  // backup's ".failed" tree; nothing is deleted.
+  void _restoreSystemContainersFromBackup();
+  void _moveSystemContainerIntoPlace(const std::string& entry, QRVContainerClass containerClass);
+  void _moveFailedPathAside(const std::string& item, const std::string& failedItems, const std::string& name);
   // Sends to death row every entry of `directories` that can be a container
   // of `containerClass` by its name but has no metadata file: what a crash
   // or an older system left. Other entries are left alone.

@@ -7,13 +7,187 @@
 #include "codesigning/QRVCodeSigningMapping.h"
 #include "core/QRVLocks.h"
 #include "dataprotection/QRVDataProtectionManager.h"
+#include "codesigning/QRVWhitelist.h"
+#include "core/QRVCrashPoints.h"
 #include "fs/QRVDictionaryAdditions.h"
+#include "fs/QRVPathComponents.h"
+#include "migration/QRVMigrationStatus.h"
 #include "fs/QRVPathComponents.h"
 #include "operations/QRVClientConnection.h"
 
 
+namespace {
+
+// The states of a backup tree: waiting ("Data"), being restored, and the
+// children that could not be restored.
+const std::string kInProgress = ".inprogress";
+const std::string kFailed = ".failed";
+
+bool endsWith(const std::string& text, const std::string& end) {
+  return text.size() > end.size() && text.compare(text.size() - end.size(), std::string::npos, end) == 0;
+}
+
+}  // namespace
+
 void QRVClientConnection::rebootQuorvaSetup() {
-  QRVLogNotice("reboot set-up does nothing yet: there is no container state to restore");
+  std::unique_ptr<QRVMigrationStatus> status = QRVMigrationStatus::initForSystemMigration(*services_);
+  if (status->isBuildUpgrade()) {
+    _regenerateAllSystemContainerPaths();
+    // The upgrade migrations of the container migrator belong here, before
+    // the build is recorded; the migrator is not built yet.
+    status->writeCurrentBuildInfoToDisk();
+  }
+  _restoreSystemContainersFromBackup();
+}
+
+void QRVClientConnection::_regenerateAllSystemContainerPaths() {
+  QRVLogNotice("Rolling system container directory UUIDs on disk");
+  const QRVUserIdentityRef& user = clientIdentity_->userIdentity();
+  for (QRVContainerClass containerClass : {QRVContainerClassSystemData, QRVContainerClassSystemGroup}) {
+    QRVError error;
+    std::optional<std::vector<QRVMetadataRef>> containers = services_->containerCache->allContainersForUserIdentity(
+        user, containerClass, /*transient=*/false, /*populateSandboxCache=*/false, &error);
+    if (!containers) {
+      QRVLogError("Failed to get list of system containers for migration: {}", error.description());
+      continue;
+    }
+    for (const QRVMetadataRef& container : *containers) {
+      if (container->identifier().empty()) continue;
+      // The shared system group is reached by its path from every process:
+      // it keeps it.
+      if (containerClass == QRVContainerClassSystemGroup &&
+          services_->wellKnownNames->systemGroupContainerIdIsWellknown(container->identifier()) &&
+          container->identifier() == QRVWhitelist::kSharedSystemGroupIdentifier)
+        continue;
+      if (!regenerateDirectoryUUIDWithContainerIdentity(container->containerIdentity(), &error))
+        QRVLogError("Failed to regenerate directory UUID for identifier: {}, class: {}", container->identifier(),
+                    containerClass);
+      QRVCrashPoint(*services_, "boot.uuid-rolled");
+    }
+  }
+}
+
+void QRVClientConnection::_restoreSystemContainersFromBackup() {
+  QRVFileManager& fm = *services_->fileManager;
+  const QRVUserIdentityRef user = services_->userIdentityCache->defaultUserIdentity();
+  std::shared_ptr<QRVPerUserConfiguration> perUser =
+      services_->globalConfiguration->getPerUserConfigurationForUserIdentity(user);
+  const std::string base = perUser->systemContainerBackupBaseDirectory();
+  const std::string data = perUser->systemContainerBackupDirectory();
+  const std::string shared = perUser->systemGroupContainerBackupDirectory();
+  const std::string dataInProgress = data + kInProgress;
+  const std::string sharedInProgress = shared + kInProgress;
+
+  // A backup being restored is first renamed aside, so that a restore cut
+  // short by a crash is taken up again from where it stood rather than
+  // mistaken for a new backup.
+  auto beginRestore = [&](const std::string& backup, const std::string& inProgress, const char* moveFailure) {
+    if (!fm.itemExistsAtURL(backup)) return;
+    QRVError error;
+    if (!fm.removeItemAtURL(inProgress, &error))
+      QRVLogError("Failed to remove existing inprogress system containers: {}", error.description());
+    if (!fm.moveItemAtURL(backup, inProgress, &error)) QRVLogError(fmt::runtime(moveFailure), error.description());
+  };
+  beginRestore(data, dataInProgress, "Failed to move system containers to inprogress: {}");
+  beginRestore(shared, sharedInProgress, "Failed to move shared system containers to inprogress: {}");
+  if (!fm.itemExistsAtURL(dataInProgress) && !fm.itemExistsAtURL(sharedInProgress)) return;
+
+  auto restoreAll = [&](const std::string& inProgress, QRVContainerClass containerClass, const char* listFailure) {
+    QRVError error;
+    std::optional<std::vector<std::string>> entries = fm.urlsForItemsInDirectoryAtURL(inProgress, &error);
+    if (!entries) {
+      QRVLogError(fmt::runtime(listFailure), inProgress, error.description());
+      return;
+    }
+    for (const std::string& entry : *entries) _moveSystemContainerIntoPlace(entry, containerClass);
+  };
+  QRVLogNotice("Installing system containers");
+  restoreAll(dataInProgress, QRVContainerClassSystemData, "Couldn't find any system containers at {}: {}");
+  QRVLogNotice("Installing system group containers");
+  restoreAll(sharedInProgress, QRVContainerClassSystemGroup, "Couldn't find any system shared containers at {}: {}");
+
+  // Internal images keep the backup for inspection. Elsewhere it goes, but
+  // for what could not be restored: that is nowhere else.
+  if (!services_->globalConfiguration->isInternalImage()) {
+    QRVError error;
+    bool keptFailures = false;
+    for (const std::string& item : fm.urlsForItemsInDirectoryAtURL(base, nullptr).value_or(std::vector<std::string>{})) {
+      if (endsWith(item, kFailed)) {
+        keptFailures = true;
+        continue;
+      }
+      if (!fm.removeItemAtURL(item, &error))
+        QRVLogError("Failed to remove system container base dir {}: {}", base, error.description());
+    }
+    if (!keptFailures && !fm.removeItemAtURL(base, &error))
+      QRVLogError("Failed to remove system container base dir {}: {}", base, error.description());
+  }
+}
+
+void QRVClientConnection::_moveSystemContainerIntoPlace(const std::string& entry, QRVContainerClass containerClass) {
+  QRVFileManager& fm = *services_->fileManager;
+  const std::string identifier = QRVLastPathComponent(entry);
+  // "Data.inprogress/<identifier>" fails into "Data.failed/<identifier>".
+  std::string backup = QRVPathComponents::parentDirectory(entry);
+  if (endsWith(backup, kInProgress)) backup.resize(backup.size() - kInProgress.size());
+  const std::string failedItems = QRVPathByAppendingComponent(backup + kFailed, identifier);
+  QRVError error;
+  // A backup is a tree of directories, one per container; anything else
+  // (a file, a link) is not restored but kept aside.
+  if (!fm.directoryExistsAtURL(entry)) {
+    QRVLogError("Not a backed-up container directory: {}", entry);
+    _moveFailedPathAside(entry, QRVPathComponents::parentDirectory(failedItems), identifier);
+    return;
+  }
+  QRVContainerIdentityRef identity = QRVContainerIdentity::containerIdentityWithIdentifier(
+      identifier, containerClass, *services_->userIdentityCache, &error);
+  if (!identity) {
+    QRVLogError("Failed to create container identity {}: {}", identifier, error.code());
+    return;
+  }
+  QRVMetadataRef live = createOrLookupContainerWithContainerIdentity(identity, /*createIfNecessary=*/true,
+                                                                     /*transient=*/false, /*useLocking=*/true, &error);
+  if (!live) {
+    QRVLogError("Failed to create system container {}: {}", identifier, error.code());
+    return;
+  }
+  QRVLogNotice("Restoring container for {} at {} to {}", identifier, entry, live->url());
+  std::optional<std::vector<std::string>> children = fm.urlsForItemsInDirectoryAtURL(entry, &error);
+  if (!children) {
+    QRVLogError("Failed to enumerate contents of restored system container {} at {}: {}", identifier, entry,
+                error.description());
+    return;
+  }
+  for (const std::string& child : *children) {
+    const std::string name = QRVLastPathComponent(child);
+    // The live container's own metadata is never replaced from a backup.
+    if (name == QRVMetadata::kFileName) continue;
+    const std::string destination = QRVPathByAppendingComponent(live->url(), name);
+    if (!fm.removeItemAtURL(destination, &error)) {
+      QRVLogError("Failed to remove destination {}:{}: {}", identifier, destination, error.description());
+      _moveFailedPathAside(child, failedItems, name);
+    } else if (!fm.moveItemAtURL(child, destination, &error)) {
+      QRVLogError("Failed to move file in restored system container {}:{} to destination {}: {}", identifier, child,
+                  destination, error.description());
+      _moveFailedPathAside(child, failedItems, name);
+    }
+    QRVCrashPoint(*services_, "boot.restore-child-moved");
+  }
+  if (!recreateDefaultStructureWithContainerIdentity(live->containerIdentity(), &error))
+    QRVLogError("Error processing restored system container {}: {}", identifier, error.code());
+}
+
+void QRVClientConnection::_moveFailedPathAside(const std::string& item, const std::string& failedItems,
+                                               const std::string& name) {
+  QRVFileManager& fm = *services_->fileManager;
+  QRVError error;
+  if (!fm.createDirectoryAtURL(failedItems, /*withIntermediateDirectories=*/true, 0777, &error)) {
+    QRVLogError("Failed to create {}: {}", failedItems, error.description());
+    return;
+  }
+  const std::string destination = QRVPathByAppendingComponent(failedItems, name);
+  if (!fm.moveItemAtURL(item, destination, &error))
+    QRVLogError("Failed to move {} to {}: {}", item, destination, error.description());
 }
 
 void QRVClientConnection::quorvaSetup() {
