@@ -11,6 +11,7 @@
 #include "client/QRVUpcallClient.h"
 #include "integration/QRVDaemonProcess.h"
 #include "integration/QRVRunAs.h"
+#include "support/QRVUpcallPeer.h"
 
 namespace {
 
@@ -88,6 +89,44 @@ TEST_F(UpcallIntegrationTest, LauncherGetsEveryPathAndOthersAreRefused) {
                                             "com.kelva.private.Quorva.kernelUpcall"));
   // Anyone else cannot reach the socket at all.
   EXPECT_EQ(askAs(kOutsiderUID, kOutsiderUID, process).uint64ForKey("Errno"), static_cast<uint64_t>(EACCES));
+}
+
+// The reply of the running daemon read byte by byte: the header, the sealed
+// region, and the items in the order of the tables (home, data, temp, each
+// group's identifier and path, the final status).
+TEST_F(UpcallIntegrationTest, TheDaemonsReplyIsExactItemByItem) {
+  using namespace QRVUpcallPeerSupport;
+  std::vector<uint8_t> b;
+  str(b, M::kRequestCodeSignatureID, "com.example.exact");
+  item(b, 1, M::kRequestUID, 501);
+  str(b, M::kRequestAppGroupID, "group.example.z");
+  str(b, M::kRequestAppGroupID, "group.example.a");
+  end(b);
+  Peer peer(daemon_.root() + "/run/quorvad/com.kelva.quorvad.upcall");
+  peer.send(request(static_cast<uint32_t>(b.size())), {memfd(b)});
+  Peer::Reply r = peer.receive();
+
+  auto reply = M::decodeComplex(r.message.data(), r.message.size());
+  ASSERT_TRUE(reply) << r.message.size() << " bytes";
+  EXPECT_EQ(reply->header.id, M::kGetProcessContainersID + 100);
+  EXPECT_EQ(reply->header.size, M::kMessageSize);
+  EXPECT_EQ(reply->descriptorCount, 1u);
+  EXPECT_EQ(reply->descriptorSize, r.region.size());
+  EXPECT_EQ(r.regions, 1);
+  EXPECT_EQ(r.seals & kAllSeals, kAllSeals);
+
+  std::vector<Item> got = items(r.region);
+  std::vector<uint16_t> types;
+  for (const Item& i : got) types.push_back(i.valueType);
+  ASSERT_EQ(types, (std::vector<uint16_t>{100, 1, 2, 3, 4, 3, 4, 0}));
+  EXPECT_EQ(got[0].text, daemon_.root() + "/private/var/mobile");
+  EXPECT_TRUE(std::filesystem::is_directory(got[1].text)) << got[1].text;
+  EXPECT_EQ(got[2].text, got[1].text + "/tmp");
+  EXPECT_EQ(got[3].text, "group.example.a") << "groups in order of their identifiers";
+  EXPECT_EQ(got[5].text, "group.example.z");
+  EXPECT_TRUE(std::filesystem::is_directory(got[4].text)) << got[4].text;
+  EXPECT_TRUE(std::filesystem::is_directory(got[6].text)) << got[6].text;
+  EXPECT_EQ(got[7].value, 1u) << "every lookup succeeded";
 }
 
 TEST_F(UpcallIntegrationTest, QuorvactlAsksAsRoot) {
