@@ -21,23 +21,6 @@ constexpr int32_t kForbiddenClass = 2;
 // for.
 constexpr int32_t kHighestThirdPartyClass = 3;
 
-// The container classes whose containers hold an application's data and so
-// have a protection class of their own.
-bool isDataProtectionContainerClass(QRVContainerClass c) {
-  switch (c) {
-    case QRVContainerClassAppData:
-    case QRVContainerClassPluginData:
-    case QRVContainerClassVPNPluginData:
-    case QRVContainerClassAppGroup:
-    case QRVContainerClassRelayServiceData:
-    case QRVContainerClassInternalDaemonData:
-    case QRVContainerClassTempDir:
-      return true;
-    default:
-      return false;
-  }
-}
-
 // The class named by an entitlement value; nothing for a name this daemon
 // does not know.
 std::optional<uint32_t> classForProtectionName(const std::string& name) {
@@ -98,7 +81,8 @@ void QRVDataProtectionManager::setDataProtectionOnDataContainerForContainerIdent
   std::shared_ptr<QRVServices> services = _services();
   if (!services) return fail(QRV_ERROR(QRVResultCode::kInvalidInput, "The daemon is shutting down"));
 
-  if (!containerIdentity || !isDataProtectionContainerClass(containerIdentity->containerClass()))
+  // Only data containers (the per-user classes) have a class of their own.
+  if (!containerIdentity || !QRVContainerClassIsPerUser(containerIdentity->containerClass()))
     return fail(QRV_ERROR(QRVResultCode::kInvalidObject, "Can't act on an invalid object: identity: {}",
                           containerIdentity ? containerIdentity->description() : std::string("(null)")));
 

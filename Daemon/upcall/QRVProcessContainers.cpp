@@ -226,30 +226,22 @@ QRVUserIdentityRef QRVProcessContainers::_userIdentityForRequest(const Request& 
 uint64_t QRVProcessContainers::_dataContainerClass(const std::string& identifier, uint32_t containerType) {
   uint64_t containerClass =
       services_->codeSigningMapping ? services_->codeSigningMapping->dataContainerTypeForIdentifier(identifier) : 0;
-  switch (containerClass) {
-    case QRVContainerClassAppData:
-    case QRVContainerClassPluginData:
-    case QRVContainerClassVPNPluginData:
-    case QRVContainerClassAppGroup:
-    case QRVContainerClassRelayServiceData:
-    case QRVContainerClassInternalDaemonData:
-    case QRVContainerClassTempDir:
-      // The sandbox knows what it starts: a plug-in gets a plug-in container
-      // whatever the installer recorded.
-      if (containerType == M::kContainerTypePlugin && containerClass != QRVContainerClassPluginData) {
-        QRVLogNotice("SB Type: {}, MI Type: {}.  Declaring this a plugin", containerType, containerClass);
-        return QRVContainerClassPluginData;
-      }
-      if (containerType == M::kContainerTypeApplication && containerClass != QRVContainerClassAppData)
-        QRVLogNotice("SB type is app, but MI type is {}", containerClass);
-      return containerClass;
-    default:
-      QRVLogNotice("Invalid data container class for {}: {}", identifier, containerClass);
-      containerClass =
-          containerType == M::kContainerTypePlugin ? QRVContainerClassPluginData : QRVContainerClassAppData;
-      QRVLogNotice("SB Type: {}, falling back to class: {}", containerType, containerClass);
-      return containerClass;
+  // The per-user classes are the data container classes.
+  if (QRVContainerClassIsPerUser(containerClass)) {
+    // The sandbox knows what it starts: a plug-in gets a plug-in container
+    // whatever the installer recorded.
+    if (containerType == M::kContainerTypePlugin && containerClass != QRVContainerClassPluginData) {
+      QRVLogNotice("SB Type: {}, MI Type: {}.  Declaring this a plugin", containerType, containerClass);
+      return QRVContainerClassPluginData;
+    }
+    if (containerType == M::kContainerTypeApplication && containerClass != QRVContainerClassAppData)
+      QRVLogNotice("SB type is app, but MI type is {}", containerClass);
+    return containerClass;
   }
+  QRVLogNotice("Invalid data container class for {}: {}", identifier, containerClass);
+  containerClass = containerType == M::kContainerTypePlugin ? QRVContainerClassPluginData : QRVContainerClassAppData;
+  QRVLogNotice("SB Type: {}, falling back to class: {}", containerType, containerClass);
+  return containerClass;
 }
 
 void QRVProcessContainers::_checkUID(const QRVClientConnection& connection, uint64_t containerClass, uint32_t uid) {

@@ -168,4 +168,29 @@ class Peer {
   int fd_ = -1;
 };
 
+// The items of a reply with paths, once its message has been checked: a
+// complex reply of the message size to the process-containers request, with
+// one sealed region of the size its descriptor gives.
+inline std::vector<Item> replyItems(const Peer::Reply& r) {
+  auto reply = M::decodeComplex(r.message.data(), r.message.size());
+  EXPECT_TRUE(reply) << r.message.size() << " bytes";
+  if (!reply) return {};
+  EXPECT_EQ(reply->header.bits & M::kComplex, M::kComplex);
+  EXPECT_EQ(reply->header.size, M::kMessageSize);
+  EXPECT_EQ(reply->header.id, M::kGetProcessContainersID + 100);
+  EXPECT_EQ(reply->descriptorCount, 1u);
+  EXPECT_EQ(reply->descriptorSize, reply->count);
+  EXPECT_EQ(reply->descriptorSize, r.region.size());
+  EXPECT_EQ(r.regions, 1);
+  EXPECT_EQ(r.seals & kAllSeals, kAllSeals);
+  return items(r.region);
+}
+
+// The value types of `items`, in order.
+inline std::vector<uint16_t> valueTypes(const std::vector<Item>& items) {
+  std::vector<uint16_t> types;
+  for (const Item& i : items) types.push_back(i.valueType);
+  return types;
+}
+
 }  // namespace QRVUpcallPeerSupport
