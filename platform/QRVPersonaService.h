@@ -43,6 +43,10 @@ class QRVPersonaService {
   // Called after every change of the list.
   virtual void observe(std::function<void()> onChange) = 0;
   virtual uint64_t multiUserFlags() = 0;
+  // The bit of multiUserFlags() that makes the host multi-user: every uid
+  // is then a user of its own.
+  static constexpr uint64_t kMultiUserHostBit = 0x80000000u;
+  bool isMultiUserHost() { return (multiUserFlags() & kMultiUserHostBit) != 0; }
 
   // The kernel's type of persona `personaID`, or none when there is no such
   // persona.

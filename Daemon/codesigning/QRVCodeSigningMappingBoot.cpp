@@ -306,7 +306,7 @@ void QRVCodeSigningMapping::performAllCodeSigningMigrationAndReconciliationWithC
   if (!services) return;
   // On a multi-user host other users' claims are not all in view, so
   // nothing that decides by claims alone runs there.
-  const bool multiUser = services->platform.personas && services->platform.personas->multiUserFlags() != 0;
+  const bool multiUser = services->platform.personas && services->platform.personas->isMultiUserHost();
   if (!multiUser) _migrateAppGroupIdsFromDataContainers();
   queue_->sync([&] { _onQueue_migrateDataFromLegacyEntitlementsFileToCodeSigningFile(); });
   _migrateCachedCodeSigningInfoFromBundleContainersToMapping();

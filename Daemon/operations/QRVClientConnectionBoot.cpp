@@ -5,6 +5,8 @@
 
 #include "base/QRVLog.h"
 #include "codesigning/QRVCodeSigningMapping.h"
+#include "codesigning/QRVGroupManager.h"
+#include "core/QRVCommandQueue.h"
 #include "core/QRVLocks.h"
 #include "dataprotection/QRVDataProtectionManager.h"
 #include "codesigning/QRVWhitelist.h"
@@ -38,6 +40,15 @@ void QRVClientConnection::rebootQuorvaSetup() {
     status->writeCurrentBuildInfoToDisk();
   }
   _restoreSystemContainersFromBackup();
+  // On a multi-user host every user's group claims are in view only now,
+  // at boot: group containers nobody claims any more go.
+  QRVPersonaService* personas = services_->platform.personas.get();
+  if (personas && personas->isMultiUserHost() && services_->groupManager) {
+    services_->groupManager->reconcileGroupContainersOfType(QRVGroupTypeApplication, *commandQueue_);
+    uint64_t result = QRVResultCode::kSuccess;
+    if (!commandQueue_->executeAllUntilExhaustedOrError(&result))
+      QRVLogError("Failed to delete unclaimed group containers: {}", result);
+  }
 }
 
 void QRVClientConnection::_regenerateAllSystemContainerPaths() {

@@ -11,10 +11,6 @@ namespace M = QRVUpcallMessage;
 
 namespace {
 
-// A host whose multi-user configuration has this bit set gives every uid its
-// own personal identity.
-constexpr uint64_t kMultiUserHost = 0x80000000u;
-
 // Releases a packed-buffer handle on every path.
 struct PackbuffDeleter {
   void operator()(sb_packbuff* pb) const { sb_packbuff_free(pb); }
@@ -201,7 +197,7 @@ QRVUserIdentityRef QRVProcessContainers::_userIdentityForRequest(const Request& 
   QRVUserIdentityCache& cache = *services_->userIdentityCache;
   QRVPersonaService* personas = services_->platform.personas.get();
   QRVUserIdentityRef identity;
-  if (personas && (personas->multiUserFlags() & kMultiUserHost)) {
+  if (personas && personas->isMultiUserHost()) {
     identity = cache.userIdentityForPersonalPersonaWithUID(request.uid, request.uid);
   } else if (request.personaID == M::kNoPersona) {
     identity = cache.userIdentityForPersonalPersona();

@@ -497,7 +497,7 @@ TEST_F(QRVCodeSigningMappingTest, BootCarriesOlderMetadataIntoTheDatabaseOnceAnd
   EXPECT_TRUE(status->hasMigrationOccurredForType(QRVMigrationStatus::kCodeSigningMigration));
 
   // A multi-user host sweeps no application groups.
-  env_.personas->flags = 1;
+  env_.personas->flags = QRVPersonaService::kMultiUserHostBit;
   QRVCommandQueue second;
   mapping().performAllCodeSigningMigrationAndReconciliationWithCommandQueue(second);
   EXPECT_EQ(second.pendingCount(), 0u);

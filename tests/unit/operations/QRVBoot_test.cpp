@@ -164,3 +164,18 @@ TEST_F(BootTest, ANewBuildRollsSystemContainerPathsOnce) {
   admin()->rebootQuorvaSetup();
   EXPECT_NE(urlOf(system), rolledSystem) << "the next build";
 }
+
+// Only on a multi-user host does the boot sweep group containers that no
+// installed application claims.
+TEST_F(BootTest, AMultiUserHostSweepsUnclaimedGroupsAtBoot) {
+  QRVMetadataRef group = create(identity("group.com.example.unclaimed", QRVContainerClassAppGroup));
+  ASSERT_NE(group, nullptr);
+  admin()->rebootQuorvaSetup();
+  QRVError error;
+  EXPECT_NE(lookup(group->containerIdentity(), &error), nullptr) << "a single-user host leaves it to the mapping";
+
+  env_.personas->flags = QRVPersonaService::kMultiUserHostBit;
+  admin()->rebootQuorvaSetup();
+  EXPECT_EQ(lookup(group->containerIdentity(), &error), nullptr);
+  EXPECT_FALSE(fs::exists(group->url()));
+}
