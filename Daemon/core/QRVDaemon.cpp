@@ -74,6 +74,11 @@ void QRVDaemon::quorvad_init() {
     QRVLogNotice("quorvad performing first boot initialization");
     sharedConnection_->rebootQuorvaSetup();
   }
+  // A change the set-up restarts may find the device locked and queue its
+  // retry at once: the lock-state queue must already be held by then, or the
+  // retry would run (and fail, and queue itself again) until the
+  // subscription below catches up.
+  lockStateCallback();
   sharedConnection_->quorvaSetup();
 
   if (!upcallServer_.QRVKernServerStart(listenerQueue_)) QRVTerminate("Failed to initialize kernel upcall interface.");

@@ -7,6 +7,9 @@
 #include <thread>
 
 #include "base/QRVLog.h"
+#include "dataprotection/QRVDataProtectionManager.h"
+#include "operations/QRVClientConnection.h"
+#include "support/QRVFiles.h"
 #include "support/QRVEventually.h"
 #include "support/QRVTestConnection.h"
 #include "support/QRVTestServices.h"
@@ -94,6 +97,46 @@ TEST_F(DaemonTest, StartsLockedWhenTheDeviceIsLockedAndFollowsNotifications) {
   // A change notification reaches the callback (on the main queue).
   env_.lockState->change(0);
   EXPECT_TRUE(QRVEventually([&] { return !daemon->lockStateQueue()->isSuspended(); }));
+}
+
+// A class change left by the previous run and restarted while the device is
+// locked waits for the unlock (once: no retry runs while locked, so the
+// application is not stopped yet), then finishes.
+TEST_F(DaemonTest, AChangeRestartedWhileLockedFinishesAfterTheUnlock) {
+  auto connection = QRVClientConnection::makeSharedClientConnection(env_.services);
+  QRVError error;
+  auto identity = QRVContainerIdentity::containerIdentityWithUserIdentity(
+      env_.services->userIdentityCache->userIdentityForPersonalPersonaWithUID(501, 501), "com.example.app",
+      QRVContainerClassAppData, &error);
+  QRVMetadataRef container = connection->createOrLookupContainerWithContainerIdentity(identity, true, false, true, &error);
+  ASSERT_NE(container, nullptr) << error.description();
+  QRVWriteText(container->url() + "/Documents/a", "data");
+  auto change = QRVDataProtectionChangeOperation::initWithContainerMetadata(
+      container, 1, /*retryingIfLocked=*/true, QRVDataProtectionChangeOperation::kChangeDirectories,
+      env_.services->dataProtectionManager->protectionOperationFileQueue(), env_.services);
+  ASSERT_TRUE(change->writeToDiskWithError(&error)) << error.description();
+  const std::string update = QRVDataProtectionChangeOperation::urlForProtectionOperationWithContainerIdentity(
+      *container->containerIdentity(), *env_.services);
+
+  env_.lockState->state = 1;
+  auto daemon = std::make_unique<QRVDaemon>(env_.services, QRVDaemon::Options{});
+  env_.messages->beginTransaction();
+  daemon->quorvad_init();
+  EXPECT_TRUE(daemon->lockStateQueue()->isSuspended());
+  std::this_thread::sleep_for(std::chrono::milliseconds(100));
+  const std::string log = QRVReadText(env_.root.path() + "/private/var/root/Library/Logs/Quorva/quorvad.log");
+  size_t retries = 0;
+  for (size_t at = log.find("Retrying container protection update"); at != std::string::npos;
+       at = log.find("Retrying container protection update", at + 1))
+    retries++;
+  EXPECT_EQ(retries, 1u);
+  EXPECT_TRUE(std::filesystem::exists(update));
+  EXPECT_TRUE(env_.applicationTermination->terminated.empty());
+
+  env_.lockState->change(0);
+  EXPECT_TRUE(QRVEventually([&] { return !std::filesystem::exists(update); }));
+  EXPECT_TRUE(QRVEventually([&] { return env_.messages->isIdle(); }));
+  EXPECT_EQ(env_.applicationTermination->held, 0);
 }
 
 TEST_F(DaemonTest, FailedLockStateRegistrationStillAppliesTheCurrentState) {
