@@ -63,17 +63,15 @@ double median(std::vector<double> v) {
   return v.empty() ? 0 : v[v.size() / 2];
 }
 
-// Items not at the target class; set, the walk only counts them.
-size_t* gMismatches = nullptr;
-
 // Reads the class of the open item and sets it to `target` where it
-// differs; counts the items seen.
-void setClass(int fd, uint32_t target, size_t* items) {
+// differs (or, given `mismatches`, only counts it there); counts the items
+// seen.
+void setClass(int fd, uint32_t target, size_t* items, size_t* mismatches) {
   uint8_t bytes[4] = {};
   ssize_t n = fgetxattr(fd, kAttribute, bytes, sizeof bytes);
   const uint32_t current = n == 4 ? uint32_t{bytes[0]} | uint32_t{bytes[1]} << 8 : 0;
-  if (current != target && gMismatches) {
-    (*gMismatches)++;
+  if (current != target && mismatches) {
+    (*mismatches)++;
   } else if (current != target) {
     const uint8_t wanted[4] = {static_cast<uint8_t>(target), 0, 0, 0};
     if (fsetxattr(fd, kAttribute, wanted, sizeof wanted, 0) != 0) {
@@ -85,7 +83,7 @@ void setClass(int fd, uint32_t target, size_t* items) {
 }
 
 // The raw walk below the open directory `dirfd`, which it closes.
-void rawWalk(int dirfd, uint32_t target, size_t* items) {
+void rawWalk(int dirfd, uint32_t target, size_t* items, size_t* mismatches) {
   DIR* dir = fdopendir(dirfd);
   if (!dir) abort();
   while (dirent* entry = readdir(dir)) {
@@ -94,26 +92,26 @@ void rawWalk(int dirfd, uint32_t target, size_t* items) {
     if (entry->d_type == DT_DIR) {
       int child = openat(dirfd, name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
       if (child < 0) abort();
-      rawWalk(child, target, items);
+      rawWalk(child, target, items, mismatches);
     } else if (entry->d_type == DT_REG) {
       int child = openat(dirfd, name, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC);
       if (child < 0) abort();
-      setClass(child, target, items);
+      setClass(child, target, items, mismatches);
       close(child);
     }
   }
   // Directories after their contents, as the daemon's walk does.
-  setClass(dirfd, target, items);
+  setClass(dirfd, target, items, mismatches);
   closedir(dir);
 }
 
-double timeRaw(const std::string& container, uint32_t target, size_t expected) {
+double timeRaw(const std::string& container, uint32_t target, size_t expected, size_t* mismatches = nullptr) {
   auto start = Clock::now();
   size_t items = 0;
   for (const char* item : {"Documents", "Library", "tmp"}) {
     int fd = open((container + "/" + item).c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
     if (fd < 0) abort();
-    rawWalk(fd, target, &items);
+    rawWalk(fd, target, &items, mismatches);
   }
   double ms = millisSince(start);
   if (items != expected) {
@@ -214,9 +212,7 @@ int main() {
     change.push_back(timeChange(1));
     // The change must have reached every item, or the comparison is void.
     size_t mismatches = 0;
-    gMismatches = &mismatches;
-    timeRaw(root, 1, expected);
-    gMismatches = nullptr;
+    timeRaw(root, 1, expected, &mismatches);
     if (mismatches != 0) {
       fprintf(stderr, "the change left %zu items in another class\n", mismatches);
       return 1;

@@ -25,10 +25,6 @@ namespace {
 const std::string kInProgress = ".inprogress";
 const std::string kFailed = ".failed";
 
-bool endsWith(const std::string& text, const std::string& end) {
-  return text.size() > end.size() && text.compare(text.size() - end.size(), std::string::npos, end) == 0;
-}
-
 }  // namespace
 
 void QRVClientConnection::rebootQuorvaSetup() {
@@ -67,7 +63,6 @@ void QRVClientConnection::_regenerateAllSystemContainerPaths() {
       // The shared system group is reached by its path from every process:
       // it keeps it.
       if (containerClass == QRVContainerClassSystemGroup &&
-          services_->wellKnownNames->systemGroupContainerIdIsWellknown(container->identifier()) &&
           container->identifier() == QRVWhitelist::kSharedSystemGroupIdentifier)
         continue;
       if (!regenerateDirectoryUUIDWithContainerIdentity(container->containerIdentity(), &error))
@@ -123,7 +118,7 @@ void QRVClientConnection::_restoreSystemContainersFromBackup() {
     QRVError error;
     bool keptFailures = false;
     for (const std::string& item : fm.urlsForItemsInDirectoryAtURL(base, nullptr).value_or(std::vector<std::string>{})) {
-      if (endsWith(item, kFailed)) {
+      if (item.ends_with(kFailed)) {
         keptFailures = true;
         continue;
       }
@@ -140,7 +135,7 @@ void QRVClientConnection::_moveSystemContainerIntoPlace(const std::string& entry
   const std::string identifier = QRVLastPathComponent(entry);
   // "Data.inprogress/<identifier>" fails into "Data.failed/<identifier>".
   std::string backup = QRVPathComponents::parentDirectory(entry);
-  if (endsWith(backup, kInProgress)) backup.resize(backup.size() - kInProgress.size());
+  if (backup.ends_with(kInProgress)) backup.resize(backup.size() - kInProgress.size());
   const std::string failedItems = QRVPathByAppendingComponent(backup + kFailed, identifier);
   QRVError error;
   // A backup is a tree of directories, one per container; anything else

@@ -91,25 +91,24 @@ int32_t QRVProcessContainers::replyForRequest(const uint8_t* bytes, size_t lengt
                                   "createOrLookupContainerForUser:(system container) Failed with error: {}");
     if (!found.system) found.allFound = false;
   }
-  if (!request.appGroupIDs.empty()) {
-    _checkUID(*connection, QRVContainerClassAppGroup, request.uid);
-    for (const std::string& group : request.appGroupIDs) {
-      auto path = _containerPath(*connection, userIdentity, group, QRVContainerClassAppGroup,
-                                 "createOrLookupGroupContainersForUser: Failed with error: {}");
-      if (path)
-        found.groups[group] = *path;
+  // Every group asked for, found or not; one that cannot be had leaves the
+  // rest of the answer standing.
+  auto lookUpGroups = [&](const std::vector<std::string>& identifiers, const QRVUserIdentityRef& user,
+                          QRVContainerClass groupClass, const char* failure, std::map<std::string, std::string>* into) {
+    for (const std::string& group : identifiers) {
+      if (auto path = _containerPath(*connection, user, group, groupClass, failure))
+        (*into)[group] = *path;
       else
         found.allFound = false;
     }
+  };
+  if (!request.appGroupIDs.empty()) {
+    _checkUID(*connection, QRVContainerClassAppGroup, request.uid);
+    lookUpGroups(request.appGroupIDs, userIdentity, QRVContainerClassAppGroup,
+                 "createOrLookupGroupContainersForUser: Failed with error: {}", &found.groups);
   }
-  for (const std::string& group : request.systemGroupIDs) {
-    auto path = _containerPath(*connection, nullptr, group, QRVContainerClassSystemGroup,
-                               "createOrLookupContainerForUser:(system group container) Failed with error: {}");
-    if (path)
-      found.systemGroups[group] = *path;
-    else
-      found.allFound = false;
-  }
+  lookUpGroups(request.systemGroupIDs, nullptr, QRVContainerClassSystemGroup,
+               "createOrLookupContainerForUser:(system group container) Failed with error: {}", &found.systemGroups);
   // Deferred steps the lookups queued run before the answer goes out.
   uint64_t ignored = 0;
   connection->completeWithError(&ignored);
