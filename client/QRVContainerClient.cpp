@@ -287,6 +287,10 @@ QRVPlist invalidateCodeSigningInfoForAppsWithoutBundleContainer() {
   return withCommand(C::invalidateCodeSigningInfoForAppsWithoutBundleContainer);
 }
 
+QRVPlist performDataMigration() { return withCommand(C::performDataMigration); }
+
+QRVPlist performPerUserDataMigration() { return withCommand(C::performPerUserDataMigration); }
+
 }  // namespace QRVContainerRequests
 
 QRVContainerClient::Result QRVContainerClient::call(const QRVPlist& request, QRVClientError* error) {
@@ -376,3 +380,7 @@ Result QRVContainerClient::codeSigningInfoForIdentifier(const std::string& ident
 Result QRVContainerClient::invalidateCodeSigningInfoForAppsWithoutBundleContainer(E* e) {
   return call(R::invalidateCodeSigningInfoForAppsWithoutBundleContainer(), e);
 }
+
+Result QRVContainerClient::performDataMigration(E* e) { return call(R::performDataMigration(), e); }
+
+Result QRVContainerClient::performPerUserDataMigration(E* e) { return call(R::performPerUserDataMigration(), e); }

@@ -118,6 +118,8 @@ QRVPlist processCodeSigningInfo(const std::string& identifier, const std::option
                                 const std::optional<QRVPlist>& options);
 QRVPlist codeSigningInfoForIdentifier(const std::string& identifier);
 QRVPlist invalidateCodeSigningInfoForAppsWithoutBundleContainer();
+QRVPlist performDataMigration();
+QRVPlist performPerUserDataMigration();
 }  // namespace QRVContainerRequests
 
 class QRVContainerClient {
@@ -174,6 +176,12 @@ class QRVContainerClient {
                                 const std::optional<QRVPlist>& options, QRVClientError* e);
   Result codeSigningInfoForIdentifier(const std::string& identifier, QRVClientError* e);
   Result invalidateCodeSigningInfoForAppsWithoutBundleContainer(QRVClientError* e);
+  // The one-time migrations after an upgrade or a restore: the data
+  // migrator's (system container ACLs, bundle ownership, code-signing data)
+  // and the per-user ones (default subdirectories, protection classes).
+  // Each answers when its work is done.
+  Result performDataMigration(QRVClientError* e);
+  Result performPerUserDataMigration(QRVClientError* e);
 
  private:
   QRVClient client_;

@@ -403,6 +403,8 @@ QRV_TYPED(buildCodeSigningGet, "--id", {
 })
 QRV_TYPED(buildCodeSigningInvalidateOrphans, "",
           { return R::invalidateCodeSigningInfoForAppsWithoutBundleContainer(); })
+QRV_TYPED(buildDataMigration, "", { return R::performDataMigration(); })
+QRV_TYPED(buildPerUserMigration, "", { return R::performPerUserDataMigration(); })
 
 #undef QRV_TYPED
 
@@ -595,6 +597,16 @@ Example:
     {"codesign-invalidate-orphans", "codesign-invalidate-orphans",
      "Invalidates the code-signing information of applications whose bundle\ncontainer is gone.\n",
      buildCodeSigningInvalidateOrphans},
+    {"data-migration", "data-migration",
+     "Runs the data migrator's one-time migrations: ACLs of system containers,\n"
+     "ownership of the bundle tree, code-signing data; then reconciles group and\n"
+     "system containers with the installed applications.\n",
+     buildDataMigration},
+    {"per-user-migration", "per-user-migration",
+     "Runs the per-user migrations: the default subdirectories of every user's\n"
+     "containers (once), and the protection class of data containers that have\n"
+     "no application.\n",
+     buildPerUserMigration},
     {"upcall",
      "upcall [--code-signing-id ID] [--container-id ID] [--application-id ID] [--uid N] [--persona N] "
      "[--container-type N] [--app-group G ...] [--system-container ID] [--system-group G ...]",

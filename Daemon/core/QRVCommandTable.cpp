@@ -7,6 +7,7 @@
 #include "core/QRVDataProtectionHandlers.h"
 #include "core/QRVDeleteHandlers.h"
 #include "core/QRVGroupHandlers.h"
+#include "core/QRVMigrationHandlers.h"
 
 namespace {
 
@@ -41,13 +42,13 @@ const QRVCommandTable kTable = {{
     {21, QRVHandleSetDataProtection,       kEntitlementAllowed,                _, _, _},  // setDataProtection
     {22, QRVHandleRecreateDefaultStructure, kEntitlementAllowed,                R, _, _},  // recreateDefaultStructureAgain
     {23, QRVHandleDiskUsage,                kEntitlementAllowed,                R, _, L},  // diskUsage
-    {24, nullptr,                           kEntitlementDataMigration,          R, _, _},  // performDataMigration
+    {24, QRVHandlePerformDataMigration,     kEntitlementDataMigration,          R, _, _},  // performDataMigration
     {25, QRVHandleRetryTest,                kEntitlementTestability,            R, _, _},  // retryTest
     {26, QRVHandleStageSharedContent,       kEntitlementStageSharedContent,     R, _, _},  // stageSharedContent
     {27, nullptr,                           kEntitlementAllowed,                R, _, _},  // retiredCommand: always invalid
     {28, QRVHandleUserManagedAssetsPath,    kEntitlementUserManagedAssets,      R, A, _},  // userManagedAssetsPath
     {29, QRVHandleDeleteUserManagedAsset,   kEntitlementUserManagedAssets,      R, _, _},  // deleteUserManagedAsset
-    {30, nullptr,                           kEntitlementAllowed,                R, _, _},  // performPerUserDataMigration
+    {30, QRVHandlePerformPerUserDataMigration, kEntitlementAllowed,                R, _, _},  // performPerUserDataMigration
     {31, QRVHandleSetTestLock,              kEntitlementTestability,            R, _, _},  // setTestLock
 }};
 // clang-format on

@@ -7,7 +7,10 @@
 // replace.journal-written, replace.old-parked, replace.new-placed,
 // replace.cache-updated, replace.staging-removed; deathrow.item-removed;
 // dataprotection.update-written, dataprotection.first-item-changed,
-// dataprotection.before-delete; boot.uuid-rolled, boot.restore-child-moved.
+// dataprotection.before-delete; boot.uuid-rolled, boot.restore-child-moved;
+// migration.log-moved, migration.bundles-relocated,
+// migration.acl-standardized, migration.bundle-owned,
+// migration.user-subdirectories-made.
 #pragma once
 
 #include "core/QRVServices.h"

@@ -52,9 +52,8 @@ QRVDaemon::StartResult QRVDaemon::start() {
 
 void QRVDaemon::quorvad_init() {
   QRVGlobalConfiguration& config = *services_->globalConfiguration;
-  const bool internal = config.isInternalImage();
   std::string logPath = config.logDirectory() + "/quorvad.log";
-  QRVLog::open("com.kelva.quorvad", logPath, options_.logLevel, internal ? 4 : 1, internal ? 262'144 : 102'400);
+  QRVLog::open("com.kelva.quorvad", logPath, options_.logLevel, config.logRotationCount(), config.logSizeLimit());
   QRVLogDebug("quorvad built at {} {} started", __DATE__, __TIME__);
 
   // The death-row and lock-state queues belong to the services, which every

@@ -3,6 +3,7 @@
 #include "codesigning/QRVBuiltInWellKnownNames.h"
 #include "codesigning/QRVGroupManager.h"
 #include "dataprotection/QRVDataProtectionManager.h"
+#include "migration/QRVContainerMigrator.h"
 
 std::shared_ptr<QRVServices> QRVServices::make(const std::string& root, QRVPlatform platform) {
   auto s = std::make_shared<QRVServices>();
@@ -40,6 +41,7 @@ std::shared_ptr<QRVServices> QRVServices::make(const std::string& root, QRVPlatf
   s->containerCache = std::make_shared<QRVContainerCache>(s->fileManager, s->globalConfiguration, s->userIdentityCache,
                                                           s->platform.sandbox, s->pluginParents, s->wellKnownNames);
   s->groupManager = std::make_shared<QRVGroupManager>(s);
+  s->containerMigrator = std::make_shared<QRVContainerMigrator>(std::weak_ptr<QRVServices>(s));
   return s;
 }
 

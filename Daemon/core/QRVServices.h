@@ -16,6 +16,7 @@
 #include "platform/QRVPlatform.h"
 #include "users/QRVUserIdentityCache.h"
 
+class QRVContainerMigrator;
 class QRVDataProtectionManager;
 class QRVGroupManager;
 
@@ -51,6 +52,8 @@ struct QRVServices {
   // Changes of data containers' protection classes; it also answers the
   // data-protection seam above.
   std::shared_ptr<QRVDataProtectionManager> dataProtectionManager;
+  // The one-time migrations of an older on-disk layout.
+  std::shared_ptr<QRVContainerMigrator> containerMigrator;
 
   // Runs `job` on `queue` inside a keep-alive transaction, so the daemon is
   // not considered idle until it has finished.

@@ -106,6 +106,27 @@ bool QRVFileManager::removeItemAtURL(const std::string& url, QRVError* error) {
   return true;
 }
 
+bool QRVFileManager::removeEmptyDirectoryTreeAtURL(const std::string& url, QRVError* error) {
+  std::vector<std::string> deepestFirst;
+  const bool walked = traverseItemAtURLWithoutFollowingLinks(url, error, [&](const QRVDirectoryEntry& entry,
+                                                                            QRVError* walkError) {
+    switch (entry.kind) {
+      case QRVDirectoryEntry::Kind::kDirectory:
+        return true;
+      case QRVDirectoryEntry::Kind::kDirectoryPostOrder:
+        deepestFirst.emplace_back(entry.path);
+        return true;
+      default:
+        return QRVFail(walkError, QRV_POSIX_ERROR_QUIET(ENOTEMPTY, "{} holds more than directories", url));
+    }
+  });
+  if (!walked) return false;
+  for (const std::string& directory : deepestFirst)
+    if (int e = files_->unlink(AT_FDCWD, directory, AT_REMOVEDIR); e && e != ENOENT)
+      return QRVFail(error, QRV_POSIX_ERROR(e, "rmdir of {} failed: {}", directory, errnoText(e)));
+  return true;
+}
+
 // Called for each entry the removal could not remove; true when the entry is
 // gone after all.
 bool QRVFileManager::_removalError(const QRVFileSystemExtras::RemovalFailure& failure) {

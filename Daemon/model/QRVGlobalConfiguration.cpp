@@ -180,7 +180,8 @@ bool QRVGlobalConfiguration::isInternalImage() {
 }
 
 void QRVGlobalConfiguration::setIsInternalImage(bool internal) {
-  // A value set before the first query is replaced by that query.
+  // The override holds from now on: the first query must not replace it.
+  std::call_once(internalOnce_, [] {});
   QRVMutexLock lock(&internalMutex_);
   isInternalImage_ = internal;
 }

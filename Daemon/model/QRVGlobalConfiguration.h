@@ -86,6 +86,11 @@ class QRVGlobalConfiguration {
   uid_t currentMobileUserId() const { return mobileUID_; }
   gid_t currentMobileGroupId() const { return mobileGID_; }
 
+  // How many older log files the log writer keeps, and the size at which it
+  // starts a new one: more on an internal image, for diagnosis.
+  long logRotationCount() { return isInternalImage() ? 4 : 1; }
+  size_t logSizeLimit() { return isInternalImage() ? 262'144 : 102'400; }
+
   // Asked of the build variant once; `setIsInternalImage` overrides it.
   bool isInternalImage();
   void setIsInternalImage(bool internal);

@@ -6,17 +6,16 @@
 #include "base/QRVLog.h"
 #include "codesigning/QRVCodeSigningMapping.h"
 #include "codesigning/QRVGroupManager.h"
+#include "codesigning/QRVWhitelist.h"
 #include "core/QRVCommandQueue.h"
+#include "core/QRVCrashPoints.h"
 #include "core/QRVLocks.h"
 #include "dataprotection/QRVDataProtectionManager.h"
-#include "codesigning/QRVWhitelist.h"
-#include "core/QRVCrashPoints.h"
 #include "fs/QRVDictionaryAdditions.h"
 #include "fs/QRVPathComponents.h"
+#include "migration/QRVContainerMigrator.h"
 #include "migration/QRVMigrationStatus.h"
-#include "fs/QRVPathComponents.h"
 #include "operations/QRVClientConnection.h"
-
 
 namespace {
 
@@ -28,11 +27,17 @@ const std::string kFailed = ".failed";
 }  // namespace
 
 void QRVClientConnection::rebootQuorvaSetup() {
+  // An unreadable status (logged) tells nothing about the build: no
+  // upgrade work runs on a guess.
   std::unique_ptr<QRVMigrationStatus> status = QRVMigrationStatus::initForSystemMigration(*services_);
-  if (status->isBuildUpgrade()) {
+  if (status && status->isBuildUpgrade()) {
     _regenerateAllSystemContainerPaths();
-    // The upgrade migrations of the container migrator belong here, before
-    // the build is recorded; the migrator is not built yet.
+    QRVError error;
+    if (!services_->containerMigrator->performSynchronousBuildUpgradeMigration(*status, &error))
+      QRVLogError("Failed to perform build upgrade migration : {}", error.description());
+    // Recorded even after a failure: the failed steps are not recorded and
+    // run at the next upgrade, and rolling the paths again at every boot
+    // meanwhile would help nobody.
     status->writeCurrentBuildInfoToDisk();
   }
   _restoreSystemContainersFromBackup();
