@@ -71,9 +71,12 @@ const RightHolder kRightHolders[] = {
     {"stageSharedContent", 2415, kStagerID},
 };
 
+QRVPlist str(const std::string& value) { return QRVPlist::string(value); }
+QRVPlist num(uint64_t value) { return QRVPlist::uinteger(value); }
+
 QRVPlist strings(std::initializer_list<const char*> values) {
   QRVPlist array = QRVPlist::array();
-  for (const char* v : values) array.append(QRVPlist::string(v));
+  for (const char* v : values) array.append(str(v));
   return array;
 }
 
@@ -92,33 +95,30 @@ QRVPlist container(uid_t uid, const std::string& identifier, uint64_t containerC
 // A command on the bundle container `identifier`, named with its UUID.
 QRVPlist onBundle(uint64_t command, const char* identifier = kBundleID) {
   return QRVRequest(command)
-      .set("Identifier", QRVPlist::string(identifier))
-      .set("ContainerClass", QRVPlist::uinteger(1))
+      .set("Identifier", str(identifier))
+      .set("ContainerClass", num(1))
       .set("UUID", QRVPlist::data(container(kAllowedUID, identifier, 1).dataForKey("ReplyUUID")));
 }
 
-QRVPlist setInfoValue() { return onBundle(5).set("Key", QRVPlist::string("k")).set("Value", QRVPlist::string("v")); }
+QRVPlist setInfoValue() { return onBundle(5).set("Key", str("k")).set("Value", str("v")); }
 
 // The plain caller's code signing as the installer hands it over: it claims
 // one application group.
 void installPlainCaller() {
   QRVPlist claims = QRVPlist::dictionary().set("com.kelva.security.application-groups", strings({kAppGroup}));
   QRVPlist info = QRVPlist::dictionary().set("com.kelva.Quorva.Entitlements", claims);
-  QRVPlist reply =
-      ask(kAllowedUID, QRVRequest(18).set("Identifier", QRVPlist::string(kPlainID)).set("CodeSigningInfo", info));
+  QRVPlist reply = ask(kAllowedUID, QRVRequest(18).set("Identifier", str(kPlainID)).set("CodeSigningInfo", info));
   EXPECT_EQ(code(reply), 1u) << reply.description();
 }
 
 QRVPlist groupsOfPlain(uint64_t command) {
   installPlainCaller();
-  return QRVRequest(command).set("Identifier", QRVPlist::string(kPlainID)).set("ContainerClass", QRVPlist::uinteger(7));
+  return QRVRequest(command).set("Identifier", str(kPlainID)).set("ContainerClass", num(7));
 }
 
 // Command 28 for the assets right holder's own application data container.
 QRVPlist assetsPath() {
-  return QRVRequest(28)
-      .set("Identifier", QRVPlist::string(kAssetsID))
-      .set("CreateIfNecessary", QRVPlist::boolean(true));
+  return QRVRequest(28).set("Identifier", str(kAssetsID)).set("CreateIfNecessary", QRVPlist::boolean(true));
 }
 
 int gFreshName = 0;
@@ -132,9 +132,6 @@ struct Row {
   std::function<QRVPlist(uid_t)> request;                // built anew for each caller, who is passed in
   std::function<void(const QRVPlist&)> check = nullptr;  // more about a successful reply
 };
-
-QRVPlist str(const std::string& value) { return QRVPlist::string(value); }
-QRVPlist num(uint64_t value) { return QRVPlist::uinteger(value); }
 
 // clang-format off
 const std::vector<Row>& rows() {
@@ -379,7 +376,9 @@ TEST_F(CatalogueIntegrationTest, NumbersPastTheTableAreInvalidForEveryCaller) {
   std::vector<QRVPlist> requests;
   for (uint64_t n : {uint64_t{32}, uint64_t{33}, uint64_t{1} << 32, std::numeric_limits<uint64_t>::max()})
     requests.push_back(QRVRequest(n));
-  for (uid_t uid : {kStrangerUID, kPlainUID, kOtherIdUID, kLookupUID, kAllowedUID, uid_t{2414}})
+  std::vector<uid_t> callers = {kStrangerUID, kPlainUID, kOtherIdUID, kLookupUID, kAllowedUID};
+  for (const RightHolder& holder : kRightHolders) callers.push_back(holder.uid);
+  for (uid_t uid : callers)
     for (const QRVPlist& reply : QRVRepliesAs(*gDaemon, uid, requests)) {
       EXPECT_EQ(code(reply), 49u) << "from uid " << uid;
       EXPECT_EQ(keysOf(reply), std::set<std::string>({"ReplyError"})) << "from uid " << uid;
