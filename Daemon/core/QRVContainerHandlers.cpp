@@ -26,8 +26,10 @@ void QRVHandleCreateOrLookupContainer(const QRVPlist& request, const std::shared
   out.set("ReplyExisted", QRVPlist::boolean(metadata->existed()));
   out.set("ReplyPath", QRVPlist::string(metadata->url()));
   out.set("ReplyIdentifier", QRVPlist::string(metadata->identifier()));
-  const std::string& persona = metadata->userIdentity()->personaUniqueString();
-  if (!persona.empty()) out.set("ReplyPersonaUniqueString", QRVPlist::string(persona));
+  // Always present, empty for a user without a persona, as in the parallel
+  // arrays of command 1: clients read the key without first asking whether
+  // the container's user has one.
+  out.set("ReplyPersonaUniqueString", QRVPlist::string(metadata->userIdentity()->personaUniqueString()));
   if (auto token = QRVRequestUnpacking::issueSandboxExtension(connection, *metadata))
     out.set("SandboxToken", QRVPlist::string(*token));
 }
