@@ -162,7 +162,23 @@ TEST_F(BootTest, ANewBuildRollsSystemContainerPathsOnce) {
   EXPECT_EQ(urlOf(system), rolledSystem) << "the same build again";
   env_.systemInfo->build = "1A200";
   admin()->rebootQuorvaSetup();
-  EXPECT_NE(urlOf(system), rolledSystem) << "the next build";
+  const std::string rolledAgain = urlOf(system);
+  EXPECT_NE(rolledAgain, rolledSystem) << "the next build";
+
+  // A status file that cannot be read says nothing about the build: nothing
+  // is rolled on a guess, and the rest of the set-up still runs.
+  const std::string statusFile =
+      env_.services->globalConfiguration->libraryDirectory() + "/qrv_migration_status.plist";
+  fs::remove(statusFile);
+  fs::create_directories(statusFile);
+  const std::string backup = env_.root.path() + "/private/var/mobile/Library/Backup/SystemContainers/Data";
+  file(backup + "/com.example.sys/Library/restored");
+  env_.systemInfo->build = "1A300";
+  QRVLogCapture log(env_.root.path());
+  admin()->rebootQuorvaSetup();
+  EXPECT_EQ(urlOf(system), rolledAgain);
+  EXPECT_TRUE(fs::exists(rolledAgain + "/Library/restored"));
+  EXPECT_NE(log.text().find("Error reading system migration file from disk.  This is bad"), std::string::npos);
 }
 
 // Only on a multi-user host does the boot sweep group containers that no
