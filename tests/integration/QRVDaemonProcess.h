@@ -33,7 +33,8 @@ class QRVDaemonProcess {
   void trustEntry(const std::string& name, const QRVPlist& entry);
 
   // Starts the daemon with `extraArguments` and waits until it answers on its
-  // socket. Returns the time that took.
+  // socket, or until it died in start-up (then waitForExit gives its status).
+  // Returns the time that took.
   std::chrono::milliseconds start(const std::vector<std::string>& extraArguments = {});
   // Stops it (SIGTERM, then SIGKILL) and reaps it.
   void stop();
@@ -41,6 +42,11 @@ class QRVDaemonProcess {
   std::optional<int> waitForExit(std::chrono::milliseconds timeout);
   bool isRunning();
   pid_t pid() const { return pid_; }
+  // Stops the daemon and forgets the root's first-boot marker, as a device
+  // reboot would: the next start does the once-per-boot work again.
+  void simulateReboot();
+  // Whether the daemon recorded this boot's once-per-boot work as done.
+  bool bootWorkRecorded() const;
 
   std::string readLog() const;
   // Waits until the log contains `text`.
@@ -49,4 +55,6 @@ class QRVDaemonProcess {
  private:
   std::string root_;
   pid_t pid_ = -1;
+  // The wait status of a daemon that start() saw die, for waitForExit.
+  std::optional<int> exitStatus_;
 };
