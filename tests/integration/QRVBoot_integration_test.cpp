@@ -88,11 +88,11 @@ void writePlist(const std::string& path, const QRVPlist& plist) {
   std::ofstream(path) << plist.toXML();
 }
 
-// A file's text, a link's target ("-> target"), "dir", or nothing.
-std::optional<std::string> describe(const std::string& path) {
+// A file's text, a link's target ("-> target"), "dir", or "(nothing)".
+std::string describe(const std::string& path) {
   std::error_code ec;
   fs::file_status status = fs::symlink_status(path, ec);
-  if (ec || !fs::exists(status)) return std::nullopt;
+  if (ec || !fs::exists(status)) return "(nothing)";
   if (fs::is_symlink(status)) return "-> " + fs::read_symlink(path).string();
   if (fs::is_directory(status)) return "dir";
   return QRVReadText(path);
@@ -403,7 +403,7 @@ class BootIntegrationTest : public testing::Test {
     const std::string base = root() + kBackupBase;
     std::map<std::string, std::string> left;
     for (auto it = fs::recursive_directory_iterator(base); it != fs::recursive_directory_iterator(); ++it)
-      left[it->path().string().substr(base.size())] = *describe(it->path().string());
+      left[it->path().string().substr(base.size())] = describe(it->path().string());
     std::map<std::string, std::string> expected = {
         {"/Data.failed", "dir"},
         {"/Data.failed/com.example.linked", "-> " + root() + kOutside},
