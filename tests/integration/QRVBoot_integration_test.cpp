@@ -83,11 +83,6 @@ void writeFile(const std::string& path, const std::string& text) {
   QRVWriteText(path, text);
 }
 
-void writePlist(const std::string& path, const QRVPlist& plist) {
-  fs::create_directories(fs::path(path).parent_path());
-  std::ofstream(path) << plist.toXML();
-}
-
 // A file's text, a link's target ("-> target"), "dir", or "(nothing)".
 std::string describe(const std::string& path) {
   std::error_code ec;
@@ -148,16 +143,6 @@ void releaseAppendOnly(const std::string& root) {
   }
 }
 
-QRVPlist persona(uint64_t id, uint64_t type, const std::string& uniqueString, const std::string& home) {
-  return QRVPlist::dictionary()
-      .set("PersonaID", QRVPlist::uinteger(id))
-      .set("UID", QRVPlist::uinteger(501))
-      .set("GID", QRVPlist::uinteger(501))
-      .set("Type", QRVPlist::uinteger(type))
-      .set("UniqueString", QRVPlist::string(uniqueString))
-      .set("Home", QRVPlist::string(home));
-}
-
 // The backup of system containers in the default user's home: containers
 // with directories, files and a link out of the tree among their children,
 // a plain file and a link where a container directory is expected.
@@ -190,15 +175,16 @@ void layOutBackup(const std::string& root, OlderDevice& device) {
         device.backedUpChildren += std::distance(fs::directory_iterator(entry), fs::directory_iterator());
 }
 
-// Lays out `root` as an older device leaves it for its first start under
-// this daemon: no record of the last build, live system containers, a
-// backup to restore, transient containers of every tree, orphaned container
-// directories and staging leftovers. Whatever else an upgrade from an older
-// release finds on disk joins the picture here.
-OlderDevice layOutOlderDevice(const std::string& root) {
+// Lays out the daemon's root as an older device leaves it for its first
+// start under this daemon: two users, no record of the last build, live
+// system containers, a backup to restore, transient containers of every
+// tree, orphaned container directories and staging leftovers. Whatever else
+// an upgrade from an older release finds on disk joins the picture here.
+OlderDevice layOutOlderDevice(QRVDaemonProcess& daemon) {
+  const std::string root = daemon.root();
   OlderDevice device;
-  writePlist(root + "/etc/quorva/personas.plist",
-             QRVPlist::array({persona(1000, 0, "PERSONAL", kMobileHome), persona(1001, 1, "WORK", kWorkHome)}));
+  daemon.writePersonas({QRVDaemonProcess::persona(1000, 0, "PERSONAL", kMobileHome),
+                        QRVDaemonProcess::persona(1001, 1, "WORK", kWorkHome)});
   // What a link in the backup points at; owned and protected so that a walk
   // following the link would show.
   writeFile(root + kOutside + "/secret.txt", "outside");
@@ -290,8 +276,8 @@ void expectNothingOfTheBackupLost(const std::string& root, const OlderDevice& de
 
 // Every path under `root` with its kind (and a link's target), without what
 // changes on every start whatever the boot work does: the socket and the log.
-std::map<std::string, std::string> listing(const std::string& root) {
-  std::map<std::string, std::string> out;
+QRVListing listing(const std::string& root) {
+  QRVListing out;
   for (auto it = fs::recursive_directory_iterator(root); it != fs::recursive_directory_iterator(); ++it) {
     const std::string relative = it->path().string().substr(root.size());
     if (relative == "/run" || relative == "/private/var/root/Library/Logs") {
@@ -304,25 +290,12 @@ std::map<std::string, std::string> listing(const std::string& root) {
   return out;
 }
 
-std::string differences(const std::map<std::string, std::string>& before,
-                        const std::map<std::string, std::string>& after) {
-  std::string out;
-  for (const auto& [path, kind] : before) {
-    auto it = after.find(path);
-    if (it == after.end()) out += "gone: " + path + "\n";
-    else if (it->second != kind) out += "changed: " + path + "\n";
-  }
-  for (const auto& [path, kind] : after)
-    if (!before.count(path)) out += "new: " + path + "\n";
-  return out;
-}
-
 class BootIntegrationTest : public testing::Test {
  protected:
   void SetUp() override {
     if (geteuid() != 0) GTEST_SKIP() << "needs root: clients run under other uids";
     daemon_.trustUID(kInstallerUID, "com.example.installer", QRVEntitlements({"allowed"}));
-    device_ = layOutOlderDevice(daemon_.root());
+    device_ = layOutOlderDevice(daemon_);
   }
   void TearDown() override {
     daemon_.stop();
@@ -464,7 +437,7 @@ TEST_F(BootIntegrationTest, AnOlderDeviceIsSetUpAtItsFirstStartAndLeftAsItIsAtTh
     remade += "new: " + tree + "\n";
     EXPECT_EQ(QRVEntriesIn(root() + tree), 0u) << tree;
   }
-  EXPECT_EQ(differences(before, listing(root())), remade);
+  EXPECT_EQ(QRVListingDifferences(before, listing(root())), remade);
 }
 
 TEST_F(BootIntegrationTest, ANewBuildRollsSystemContainerPathsOnceExceptTheSharedGroups) {
@@ -485,7 +458,7 @@ TEST_F(BootIntegrationTest, ANewBuildRollsSystemContainerPathsOnceExceptTheShare
     ASSERT_NE(c.path, "") << c.identifier;
   }
   daemon_.stop();
-  std::map<std::string, std::map<std::string, std::string>> contents;
+  std::map<std::string, QRVListing> contents;
   for (const Container& c : containers) contents[c.identifier] = listing(c.path);
 
   // A new build after a reboot.
@@ -502,7 +475,7 @@ TEST_F(BootIntegrationTest, ANewBuildRollsSystemContainerPathsOnceExceptTheShare
       EXPECT_NE(rolled, c.path);
       EXPECT_FALSE(fs::exists(c.path));
     }
-    EXPECT_EQ(differences(contents[c.identifier], listing(rolled)), "") << "the contents move with the container";
+    EXPECT_EQ(QRVListingDifferences(contents[c.identifier], listing(rolled)), "") << "the contents move with the container";
     c.path = rolled;
   }
   for (uint64_t containerClass : {kSystemClass, kSystemGroupClass})
@@ -515,7 +488,7 @@ TEST_F(BootIntegrationTest, ANewBuildRollsSystemContainerPathsOnceExceptTheShare
   startAndWaitForBootWork();
   for (const Container& c : containers) EXPECT_EQ(lookUp(c.identifier, c.containerClass), c.path) << c.identifier;
   daemon_.stop();
-  EXPECT_EQ(differences(before, listing(root())), "");
+  EXPECT_EQ(QRVListingDifferences(before, listing(root())), "");
 }
 
 // Stopped dead after each child the restore moves, one start after another:

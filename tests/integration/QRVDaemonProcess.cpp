@@ -8,6 +8,7 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <filesystem>
@@ -45,6 +46,23 @@ void QRVDaemonProcess::trustUID(uid_t uid, const std::string& signingIdentifier,
 
 void QRVDaemonProcess::trustEntry(const std::string& name, const QRVPlist& entry) {
   std::ofstream(root_ + "/etc/quorva/clients.d/" + name + ".plist") << entry.toXML();
+}
+
+QRVPlist QRVDaemonProcess::persona(uint64_t personaID, uint64_t type, const std::string& uniqueString,
+                                   const std::string& home) {
+  return QRVPlist::dictionary()
+      .set("PersonaID", QRVPlist::uinteger(personaID))
+      .set("UID", QRVPlist::uinteger(501))
+      .set("GID", QRVPlist::uinteger(501))
+      .set("Type", QRVPlist::uinteger(type))
+      .set("UniqueString", QRVPlist::string(uniqueString))
+      .set("Home", QRVPlist::string(home));
+}
+
+void QRVDaemonProcess::writePersonas(QRVPlist::Array personas) {
+  const std::string path = root_ + "/etc/quorva/personas.plist";
+  std::ofstream(path + ".new") << QRVPlist::array(std::move(personas)).toXML();
+  if (std::rename((path + ".new").c_str(), path.c_str()) != 0) abort();
 }
 
 namespace {

@@ -32,6 +32,13 @@ class QRVDaemonProcess {
   // A trust-store entry as given, stored as `name`.plist.
   void trustEntry(const std::string& name, const QRVPlist& entry);
 
+  // An entry of the persona list: a persona of uid 501 whose home, under
+  // the root, is `home`. Type 0 is the personal persona.
+  static QRVPlist persona(uint64_t personaID, uint64_t type, const std::string& uniqueString, const std::string& home);
+  // Replaces the root's persona list as a writer of it would: a new file
+  // renamed over it, so a running daemon never reads half of one.
+  void writePersonas(QRVPlist::Array personas);
+
   // Starts the daemon with `extraArguments` and waits until it answers on its
   // socket, or until it died in start-up (then waitForExit gives its status).
   // Returns the time that took.
