@@ -15,8 +15,8 @@
 #include <filesystem>
 #include <fstream>
 #include <map>
-#include <sstream>
 #include <optional>
+#include <sstream>
 #include <string>
 #include <vector>
 
@@ -255,7 +255,7 @@ std::map<std::string, std::string> liveContainersOnDisk(const std::string& root,
 // restore), live in its container, or kept aside as not restorable. Nothing
 // when it is nowhere, or nowhere with its content.
 std::optional<std::string> whereIs(const std::string& root, const BackedUpItem& item) {
-  const std::string tree = std::string(root) + kBackupBase + "/" + item.tree;
+  const std::string tree = root + kBackupBase + "/" + item.tree;
   for (const char* state : {"", ".inprogress", ".failed"})
     if (describe(tree + state + "/" + item.relative) == item.content) return tree + state + "/" + item.relative;
   const size_t slash = item.relative.find('/');
@@ -284,8 +284,8 @@ QRVListing listing(const std::string& root) {
       it.disable_recursion_pending();
       continue;
     }
-    out[relative] = it->is_symlink() ? "-> " + fs::read_symlink(it->path()).string()
-                                     : (it->is_directory() ? "dir" : "file");
+    out[relative] =
+        it->is_symlink() ? "-> " + fs::read_symlink(it->path()).string() : (it->is_directory() ? "dir" : "file");
   }
   return out;
 }
@@ -385,10 +385,10 @@ class BootIntegrationTest : public testing::Test {
         {"/Data.failed/stray-file", "not a container"},
     };
     if (internalImage)
-      for (const char* emptied : {"/Data.inprogress", "/Data.inprogress/com.example.fresh",
-                                  "/Data.inprogress/com.example.settings", "/Shared.inprogress",
-                                  "/Shared.inprogress/systemgroup.com.example.group",
-                                  "/Shared.inprogress/systemgroup.com.kelva.quorva.shared"})
+      for (const char* emptied :
+           {"/Data.inprogress", "/Data.inprogress/com.example.fresh", "/Data.inprogress/com.example.settings",
+            "/Shared.inprogress", "/Shared.inprogress/systemgroup.com.example.group",
+            "/Shared.inprogress/systemgroup.com.kelva.quorva.shared"})
         expected[emptied] = "dir";
     EXPECT_EQ(left, expected);
     expectNothingOfTheBackupLost(root(), device_);
@@ -400,7 +400,11 @@ class BootIntegrationTest : public testing::Test {
     EXPECT_EQ(st.st_mode & 07777, 0700u);
     EXPECT_EQ(QRVEntriesIn(root() + kOutside), 1u);
 
+    // Gone from where they were and not moved anywhere else either: death
+    // row removed them.
     for (const std::string& path : device_.sentenced) EXPECT_FALSE(fs::exists(path)) << path << " is still there";
+    for (const auto& entry : fs::recursive_directory_iterator(root()))
+      EXPECT_NE(entry.path().filename(), "leftover") << entry.path() << " survived";
     for (const std::string& path : device_.kept) EXPECT_TRUE(fs::exists(path)) << path << " is gone";
     EXPECT_EQ(QRVEntriesIn(root() + kDeathRow), 0u);
   }
@@ -475,7 +479,8 @@ TEST_F(BootIntegrationTest, ANewBuildRollsSystemContainerPathsOnceExceptTheShare
       EXPECT_NE(rolled, c.path);
       EXPECT_FALSE(fs::exists(c.path));
     }
-    EXPECT_EQ(QRVListingDifferences(contents[c.identifier], listing(rolled)), "") << "the contents move with the container";
+    EXPECT_EQ(QRVListingDifferences(contents[c.identifier], listing(rolled)), "")
+        << "the contents move with the container";
     c.path = rolled;
   }
   for (uint64_t containerClass : {kSystemClass, kSystemGroupClass})

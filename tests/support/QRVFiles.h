@@ -31,8 +31,10 @@ inline std::string QRVListingDifferences(const QRVListing& before, const QRVList
   std::string out;
   for (const auto& [path, entry] : before) {
     auto it = after.find(path);
-    if (it == after.end()) out += "gone: " + path + "\n";
-    else if (it->second != entry) out += "changed: " + path + "\n";
+    if (it == after.end())
+      out += "gone: " + path + "\n";
+    else if (it->second != entry)
+      out += "changed: " + path + "\n";
   }
   for (const auto& [path, entry] : after)
     if (!before.count(path)) out += "new: " + path + "\n";
