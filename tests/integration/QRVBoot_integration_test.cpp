@@ -16,6 +16,7 @@
 #include <fstream>
 #include <map>
 #include <optional>
+#include <set>
 #include <sstream>
 #include <string>
 #include <vector>
@@ -539,4 +540,30 @@ TEST_F(BootIntegrationTest, AUUIDRollKilledMidwayIsFinishedAtTheNextStart) {
   EXPECT_EQ(liveContainersOnDisk(root(), kSystemClass).size(), 3u);
   EXPECT_EQ(liveContainersOnDisk(root(), kSystemGroupClass).size(), 2u);
   EXPECT_TRUE(daemon_.bootWorkRecorded());
+}
+
+// A later backup whose children cannot be restored either, under the names
+// that earlier failures already hold in the failed-items tree: the earlier
+// ones are not replaced and the later ones are not lost when the backup
+// goes.
+TEST_F(BootIntegrationTest, FailuresOfALaterRestoreAreKeptBesideEarlierOnes) {
+  setOsRelease("VARIANT_ID", "customer");
+  startAndWaitForBootWork();
+  daemon_.stop();
+  const std::string data = root() + kBackupBase + "/Data";
+  ASSERT_EQ(describe(data + ".failed/com.example.settings/Pinned"), "backed-up pin");
+  ASSERT_EQ(describe(data + ".failed/stray-file"), "not a container");
+  // The live container's "Pinned" still cannot be removed; this time the
+  // backup holds a directory of that name.
+  writeFile(data + "/com.example.settings/Pinned/inner.txt", "second pin");
+  writeFile(data + "/stray-file", "second stray");
+  daemon_.simulateReboot();
+  startAndWaitForBootWork();
+
+  std::multiset<std::string> failed;
+  for (const auto& entry : fs::recursive_directory_iterator(data + ".failed"))
+    if (entry.is_regular_file()) failed.insert(QRVReadText(entry.path().string()));
+  EXPECT_EQ(failed, (std::multiset<std::string>{"backed-up pin", "not a container", "second pin", "second stray"}));
+  EXPECT_FALSE(fs::exists(data));
+  EXPECT_FALSE(fs::exists(data + ".inprogress"));
 }
