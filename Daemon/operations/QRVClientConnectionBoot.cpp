@@ -196,7 +196,17 @@ void QRVClientConnection::_moveFailedPathAside(const std::string& item, const st
     QRVLogError("Failed to create {}: {}", failedItems, error.description());
     return;
   }
-  const std::string destination = QRVPathByAppendingComponent(failedItems, name);
+  // An earlier restore may have kept aside an item of the same name: a
+  // rename would replace it, or fail and leave this one in a backup that is
+  // about to go. Each is kept, the later one under a numbered name.
+  std::string destination = QRVPathByAppendingComponent(failedItems, name);
+  for (int n = 1; !fm.itemDoesNotExistAtURL(destination); n++) {
+    if (n > 1000) {
+      QRVLogError("Failed to move {} to {}: no free name", item, failedItems);
+      return;
+    }
+    destination = QRVPathByAppendingComponent(failedItems, fmt::format("{}.{}", name, n));
+  }
   if (!fm.moveItemAtURL(item, destination, &error))
     QRVLogError("Failed to move {} to {}: {}", item, destination, error.description());
 }

@@ -18,12 +18,18 @@ inline void QRVStartArmed(QRVDaemonProcess& daemon, const char* point) {
   unsetenv("QUORVAD_CRASH_AT");
 }
 
+// Checks that an armed daemon stopped dead at its point: exit status 70.
+// For a point in start-up work, right after QRVStartArmed.
+inline void QRVExpectStoppedDead(QRVDaemonProcess& daemon) {
+  std::optional<int> status = daemon.waitForExit(std::chrono::seconds(5));
+  ASSERT_TRUE(status.has_value()) << "the daemon did not stop";
+  EXPECT_TRUE(WIFEXITED(*status) && WEXITSTATUS(*status) == 70) << "wait status " << *status;
+}
+
 // Sends `request` from a process of `uid` to an armed daemon and checks that
 // it stopped dead: no reply, exit status 70.
 inline void QRVExpectStoppedDeadBy(QRVDaemonProcess& daemon, uid_t uid, const QRVPlist& request) {
   QRVPlist reply = QRVRepliesAs(daemon, uid, {request})[0];
   EXPECT_EQ(QRVClient::resultCode(reply), 0u) << "the daemon answered instead of stopping";
-  std::optional<int> status = daemon.waitForExit(std::chrono::seconds(5));
-  ASSERT_TRUE(status.has_value());
-  EXPECT_TRUE(WIFEXITED(*status) && WEXITSTATUS(*status) == 70);
+  QRVExpectStoppedDead(daemon);
 }

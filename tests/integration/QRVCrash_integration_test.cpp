@@ -51,7 +51,7 @@ bool isEmptyOrAbsent(const std::string& path) { return !fs::exists(path) || fs::
 
 // Everything under the root that a crash and the recovery must leave alone:
 // relative path -> kind, mode, owner and, for files, the contents.
-using Snapshot = std::map<std::string, std::string>;
+using Snapshot = QRVListing;
 
 Snapshot snapshotOf(const std::string& root, const std::vector<std::string>& skipped) {
   // What the daemon rightly changes on every start (its socket, its log) and
@@ -76,19 +76,6 @@ Snapshot snapshotOf(const std::string& root, const std::vector<std::string>& ski
     snapshot[relative] = entry;
   }
   return snapshot;
-}
-
-// The entries that differ, one per line, for a readable failure.
-std::string differences(const Snapshot& before, const Snapshot& after) {
-  std::string out;
-  for (const auto& [path, entry] : before) {
-    auto it = after.find(path);
-    if (it == after.end()) out += "gone: " + path + "\n";
-    else if (it->second != entry) out += "changed: " + path + "\n";
-  }
-  for (const auto& [path, entry] : after)
-    if (!before.count(path)) out += "new: " + path + "\n";
-  return out;
 }
 
 // A daemon on a fresh root that trusts the installer with every command.
@@ -177,7 +164,7 @@ TEST(CrashIntegrationTest, AReplaceKilledAtAnyStepLeavesOneWholeContainer) {
       }
       EXPECT_EQ(containers, 2u);
       involved.push_back(live.substr(daemon.root().size()));
-      EXPECT_EQ(differences(before, snapshotOf(daemon.root(), involved)), "");
+      EXPECT_EQ(QRVListingDifferences(before, snapshotOf(daemon.root(), involved)), "");
     }
   }
 }
@@ -252,7 +239,7 @@ TEST(CrashIntegrationTest, DeathRowEmptyingKilledHalfwayIsFinishedAtTheNextStart
   EXPECT_EQ(QRVClient::resultCode(found[0]), 21u);
   EXPECT_EQ(QRVClient::resultCode(found[1]), 21u);
   EXPECT_EQ(QRVClient::resultCode(found[2]), 1u);
-  EXPECT_EQ(differences(before, snapshotOf(daemon.root(), {})), "");
+  EXPECT_EQ(QRVListingDifferences(before, snapshotOf(daemon.root(), {})), "");
 }
 
 // Journals written by hand in each state a replace can be caught in: the

@@ -8,12 +8,14 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <filesystem>
 #include <fstream>
 #include <sstream>
 #include <thread>
+#include <utility>
 
 #include "client/QRVClient.h"
 #include "platform/linux/QRVLinuxFirstBootMarker.h"
@@ -29,8 +31,7 @@ QRVDaemonProcess::QRVDaemonProcess() {
 }
 
 QRVDaemonProcess::~QRVDaemonProcess() {
-  stop();
-  sem_unlink(("/" + QRVLinuxFirstBootMarker(root_).name()).c_str());
+  simulateReboot();
   std::error_code ec;
   std::filesystem::remove_all(root_, ec);
 }
@@ -45,6 +46,23 @@ void QRVDaemonProcess::trustUID(uid_t uid, const std::string& signingIdentifier,
 
 void QRVDaemonProcess::trustEntry(const std::string& name, const QRVPlist& entry) {
   std::ofstream(root_ + "/etc/quorva/clients.d/" + name + ".plist") << entry.toXML();
+}
+
+QRVPlist QRVDaemonProcess::persona(uint64_t personaID, uint64_t type, const std::string& uniqueString,
+                                   const std::string& home) {
+  return QRVPlist::dictionary()
+      .set("PersonaID", QRVPlist::uinteger(personaID))
+      .set("UID", QRVPlist::uinteger(501))
+      .set("GID", QRVPlist::uinteger(501))
+      .set("Type", QRVPlist::uinteger(type))
+      .set("UniqueString", QRVPlist::string(uniqueString))
+      .set("Home", QRVPlist::string(home));
+}
+
+void QRVDaemonProcess::writePersonas(QRVPlist::Array personas) {
+  const std::string path = root_ + "/etc/quorva/personas.plist";
+  std::ofstream(path + ".new") << QRVPlist::array(std::move(personas)).toXML();
+  if (std::rename((path + ".new").c_str(), path.c_str()) != 0) abort();
 }
 
 namespace {
@@ -63,6 +81,7 @@ bool answers(const std::string& socketPath) {
 
 std::chrono::milliseconds QRVDaemonProcess::start(const std::vector<std::string>& extraArguments) {
   auto begin = std::chrono::steady_clock::now();
+  exitStatus_.reset();
   std::vector<std::string> args = {QUORVAD_BINARY, "--root", root_, "--log-level", "7"};
   args.insert(args.end(), extraArguments.begin(), extraArguments.end());
   pid_ = fork();
@@ -76,8 +95,14 @@ std::chrono::milliseconds QRVDaemonProcess::start(const std::vector<std::string>
     _exit(127);
   }
   // The socket is bound before start-up runs, but the first answer comes
-  // only after it: wait for one.
+  // only after it: wait for one, unless the daemon died on the way.
   for (int i = 0; i < 2000; i++) {
+    int status = 0;
+    if (waitpid(pid_, &status, WNOHANG) == pid_) {
+      exitStatus_ = status;
+      pid_ = -1;
+      break;
+    }
     if (answers(socketPath())) {
       QRVClientError error;
       auto client = QRVClient::connectToSocket(socketPath(), &error);
@@ -101,6 +126,9 @@ void QRVDaemonProcess::stop() {
 }
 
 std::optional<int> QRVDaemonProcess::waitForExit(std::chrono::milliseconds timeout) {
+  // Already reaped by start(); and with no daemon, waitpid(-1) would reap
+  // some other child of the test.
+  if (pid_ <= 0) return std::exchange(exitStatus_, std::nullopt);
   auto deadline = std::chrono::steady_clock::now() + timeout;
   while (std::chrono::steady_clock::now() < deadline) {
     int status = 0;
@@ -112,6 +140,13 @@ std::optional<int> QRVDaemonProcess::waitForExit(std::chrono::milliseconds timeo
   }
   return std::nullopt;
 }
+
+void QRVDaemonProcess::simulateReboot() {
+  stop();
+  sem_unlink(("/" + QRVLinuxFirstBootMarker(root_).name()).c_str());
+}
+
+bool QRVDaemonProcess::bootWorkRecorded() const { return QRVLinuxFirstBootMarker(root_).exists(); }
 
 bool QRVDaemonProcess::isRunning() {
   if (pid_ <= 0) return false;

@@ -32,8 +32,16 @@ class QRVDaemonProcess {
   // A trust-store entry as given, stored as `name`.plist.
   void trustEntry(const std::string& name, const QRVPlist& entry);
 
+  // An entry of the persona list: a persona of uid 501 whose home, under
+  // the root, is `home`. Type 0 is the personal persona.
+  static QRVPlist persona(uint64_t personaID, uint64_t type, const std::string& uniqueString, const std::string& home);
+  // Replaces the root's persona list as a writer of it would: a new file
+  // renamed over it, so a running daemon never reads half of one.
+  void writePersonas(QRVPlist::Array personas);
+
   // Starts the daemon with `extraArguments` and waits until it answers on its
-  // socket. Returns the time that took.
+  // socket, or until it died in start-up (then waitForExit gives its status).
+  // Returns the time that took.
   std::chrono::milliseconds start(const std::vector<std::string>& extraArguments = {});
   // Stops it (SIGTERM, then SIGKILL) and reaps it.
   void stop();
@@ -41,6 +49,11 @@ class QRVDaemonProcess {
   std::optional<int> waitForExit(std::chrono::milliseconds timeout);
   bool isRunning();
   pid_t pid() const { return pid_; }
+  // Stops the daemon and forgets the root's first-boot marker, as a device
+  // reboot would: the next start does the once-per-boot work again.
+  void simulateReboot();
+  // Whether the daemon recorded this boot's once-per-boot work as done.
+  bool bootWorkRecorded() const;
 
   std::string readLog() const;
   // Waits until the log contains `text`.
@@ -49,4 +62,6 @@ class QRVDaemonProcess {
  private:
   std::string root_;
   pid_t pid_ = -1;
+  // The wait status of a daemon that start() saw die, for waitForExit.
+  std::optional<int> exitStatus_;
 };

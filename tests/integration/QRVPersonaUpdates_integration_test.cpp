@@ -17,13 +17,7 @@ namespace {
 constexpr uid_t kInstallerUID = 2201;
 
 QRVPlist persona(uint64_t id, uint64_t type, const std::string& uniqueString, const std::string& home) {
-  return QRVPlist::dictionary()
-      .set("PersonaID", QRVPlist::uinteger(id))
-      .set("UID", QRVPlist::uinteger(501))
-      .set("GID", QRVPlist::uinteger(501))
-      .set("Type", QRVPlist::uinteger(type))
-      .set("UniqueString", QRVPlist::string(uniqueString))
-      .set("Home", QRVPlist::string(home));
+  return QRVDaemonProcess::persona(id, type, uniqueString, home);
 }
 
 class PersonaUpdatesTest : public QRVDaemonTest {
@@ -33,12 +27,7 @@ class PersonaUpdatesTest : public QRVDaemonTest {
     startDaemon({{kInstallerUID, "com.example.installer", QRVEntitlements({"allowed"})}});
   }
 
-  // Replaces the file as a writer of it would: a new file renamed over it.
-  void writePersonas(QRVPlist::Array personas) {
-    std::string path = daemon_.root() + "/etc/quorva/personas.plist";
-    std::ofstream(path + ".new") << QRVPlist::array(std::move(personas)).toXML();
-    ASSERT_EQ(std::rename((path + ".new").c_str(), path.c_str()), 0);
-  }
+  void writePersonas(QRVPlist::Array personas) { daemon_.writePersonas(std::move(personas)); }
 
   uint64_t createInPersona(const std::string& uniqueString) {
     QRVPlist request =
