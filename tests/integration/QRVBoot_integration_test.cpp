@@ -56,6 +56,15 @@ constexpr const char* kCaches = "/private/var/root/Library/Caches/com.kelva.quor
 constexpr const char* kDeathRow = "/private/var/root/Library/Caches/com.kelva.quorvad/Dead";
 // Outside every container tree: what a link in the backup points at.
 constexpr const char* kOutside = "/private/var/outside";
+// Where an older layout kept what the first start on this build migrates.
+constexpr const char* kOldLogs = "/private/var/mobile/Library/Logs/Quorva";
+constexpr const char* kLogs = "/private/var/root/Library/Logs/Quorva";
+constexpr const char* kOldBundles = "/private/var/mobile/Containers/Bundle";
+constexpr const char* kLibrary = "/private/var/root/Library/Quorva";
+constexpr const char* kBundleIdentifier = "com.example.installed";
+constexpr const char* kMarkers[] = {"qrv_bundle_migration_complete.plist", "qrv_acl2_migration_complete.plist",
+                                    "qrv_group_id_migration_complete.plist",
+                                    "qrv_code_signing_migration_complete.plist"};
 
 // One leaf of the backup: a file (its text) or a link (its target) at
 // `relative` under the tree `tree` ("Data" or "Shared").
@@ -79,6 +88,12 @@ struct OlderDevice {
   size_t backedUpChildren = 0;
 };
 
+size_t occurrences(const std::string& text, const std::string& what) {
+  size_t count = 0;
+  for (size_t at = text.find(what); at != std::string::npos; at = text.find(what, at + 1)) ++count;
+  return count;
+}
+
 void writeFile(const std::string& path, const std::string& text) {
   fs::create_directories(fs::path(path).parent_path());
   QRVWriteText(path, text);
@@ -94,24 +109,35 @@ std::string describe(const std::string& path) {
   return QRVReadText(path);
 }
 
-// A live system container as an older system made it: its directory named
-// by its UUID, its metadata file and default subdirectories.
-std::string makeLiveSystemContainer(const std::string& root, const std::string& identifier, uint64_t containerClass) {
+void writePlist(const std::string& path, const QRVPlist& plist) {
+  fs::create_directories(fs::path(path).parent_path());
+  QRVPlist::Bytes bytes = plist.toBinary();
+  std::ofstream(path, std::ios::binary)
+      .write(reinterpret_cast<const char*>(bytes.data()), static_cast<std::streamsize>(bytes.size()));
+}
+
+// A container as an older system made it in `directory`: its directory
+// named by its UUID, its metadata file and default subdirectories.
+std::string makeContainerIn(const std::string& directory, const std::string& identifier, uint64_t containerClass) {
   const std::string uuid = QRVUUID::random().string();
-  const std::string path =
-      root + (containerClass == kSystemClass ? kSystemDirectory : kSystemGroupDirectory) + "/" + uuid;
-  fs::create_directories(path + "/Library");
+  const std::string path = directory + "/" + uuid;
+  fs::create_directories(path);
+  if (containerClass == kSystemClass || containerClass == kSystemGroupClass) fs::create_directories(path + "/Library");
   if (containerClass == kSystemClass) fs::create_directories(path + "/tmp");
-  QRVPlist::Bytes metadata = QRVPlist::dictionary()
-                                 .set("QRVMetadataIdentifier", QRVPlist::string(identifier))
-                                 .set("QRVMetadataUUID", QRVPlist::string(uuid))
-                                 .set("QRVMetadataContentClass", QRVPlist::uinteger(containerClass))
-                                 .set("QRVMetadataVersion", QRVPlist::string("2"))
-                                 .toBinary();
-  std::ofstream(path + "/" + kMetadataFile, std::ios::binary)
-      .write(reinterpret_cast<const char*>(metadata.data()), static_cast<std::streamsize>(metadata.size()));
+  writePlist(path + "/" + kMetadataFile, QRVPlist::dictionary()
+                                             .set("QRVMetadataIdentifier", QRVPlist::string(identifier))
+                                             .set("QRVMetadataUUID", QRVPlist::string(uuid))
+                                             .set("QRVMetadataContentClass", QRVPlist::uinteger(containerClass))
+                                             .set("QRVMetadataVersion", QRVPlist::string("2")));
   return path;
 }
+
+// A live system container as an older system made it.
+std::string makeLiveSystemContainer(const std::string& root, const std::string& identifier, uint64_t containerClass) {
+  return makeContainerIn(root + (containerClass == kSystemClass ? kSystemDirectory : kSystemGroupDirectory),
+                         identifier, containerClass);
+}
+
 
 // Sets or clears the append-only flag: an append-only file cannot be
 // unlinked, even by root, and the daemon's removal only knows how to lift
@@ -220,9 +246,21 @@ OlderDevice layOutOlderDevice(QRVDaemonProcess& daemon) {
   }
   sentence(root + kCaches + "/Temp/Data/System/" + QRVUUID::random().string());
   sentence(root + kTransientBundles + "/Bundle/Application/" + QRVUUID::random().string());
-  sentence(root + kBundleDirectory + "/" + QRVUUID::random().string());
   sentence(root + kSystemDirectory + "/" + QRVUUID::random().string());
   sentence(root + kCaches + "/Staging/" + QRVUUID::random().string());
+  // What the first start on this build migrates: the log in the user's home
+  // (one file too old to keep on a customer image), the bundle tree in the
+  // user's home (an installed application, and an orphan without metadata
+  // that the cleanup then finds in its new place), the marker files of
+  // completed migrations. No build is recorded yet.
+  writeFile(root + kOldLogs + "/quorvad.log", "current");
+  writeFile(root + kOldLogs + "/quorvad.log.0", "previous");
+  writeFile(root + kOldLogs + "/quorvad.log.1", "older");
+  writeFile(makeContainerIn(root + kOldBundles + "/Application", kBundleIdentifier, 1) + "/App.app/binary", "app");
+  sentence(root + kOldBundles + "/Application/" + QRVUUID::random().string());
+  for (const char* marker : kMarkers)
+    writePlist(root + kLibrary + "/" + marker,
+               QRVPlist::dictionary().set("QRVMigrationVersionNumber", QRVPlist::string("OLD1")));
   // Not a container's name: someone else's.
   writeFile(root + kMobileHome + "/Containers/Data/Application/notes/readme.txt", "mine");
   device.kept.push_back(root + kMobileHome + "/Containers/Data/Application/notes/readme.txt");
@@ -394,6 +432,19 @@ class BootIntegrationTest : public testing::Test {
     EXPECT_EQ(left, expected);
     expectNothingOfTheBackupLost(root(), device_);
 
+    // The older layout's leftovers are migrated: the newest log files kept
+    // one number older, the bundle tree in its place, the markers folded
+    // into the status file.
+    EXPECT_EQ(describe(root() + kLogs + "/quorvad.1"), "current");
+    EXPECT_EQ(describe(root() + kLogs + "/quorvad.log.1"), "previous");
+    EXPECT_EQ(describe(root() + kLogs + "/quorvad.log.2"), internalImage ? "older" : "(nothing)");
+    EXPECT_FALSE(fs::exists(root() + kOldLogs));
+    const std::string bundle = lookUp(kBundleIdentifier, 1);
+    EXPECT_EQ(bundle.rfind(root() + kBundleDirectory + "/", 0), 0u) << bundle;
+    EXPECT_EQ(describe(bundle + "/App.app/binary"), "app");
+    EXPECT_FALSE(fs::exists(root() + kOldBundles));
+    for (const char* marker : kMarkers) EXPECT_FALSE(fs::exists(root() + kLibrary + "/" + marker)) << marker;
+
     // What the links point at is untouched.
     struct stat st {};
     ASSERT_EQ(stat((root() + kOutside).c_str(), &st), 0);
@@ -443,6 +494,10 @@ TEST_F(BootIntegrationTest, AnOlderDeviceIsSetUpAtItsFirstStartAndLeftAsItIsAtTh
     EXPECT_EQ(QRVEntriesIn(root() + tree), 0u) << tree;
   }
   EXPECT_EQ(QRVListingDifferences(before, listing(root())), remade);
+  const std::string everything = daemon_.readLog();
+  for (const char* once : {"Migrating from many marker files down to one", "Migrated log files on",
+                           "Moving bundle containers from user to system location"})
+    EXPECT_EQ(occurrences(everything, once), 1u) << once;
 }
 
 TEST_F(BootIntegrationTest, ANewBuildRollsSystemContainerPathsOnceExceptTheSharedGroups) {
@@ -566,4 +621,65 @@ TEST_F(BootIntegrationTest, FailuresOfALaterRestoreAreKeptBesideEarlierOnes) {
   EXPECT_EQ(failed, (std::multiset<std::string>{"backed-up pin", "not a container", "second pin", "second stray"}));
   EXPECT_FALSE(fs::exists(data));
   EXPECT_FALSE(fs::exists(data + ".inprogress"));
+}
+
+// Stopped dead after each old log file moved, then after the bundle tree
+// moved: every start takes the upgrade migration up again, nothing of the
+// log or the bundles is lost or moved twice, and the start that gets
+// through leaves what an uninterrupted one would.
+TEST_F(BootIntegrationTest, AnUpgradeMigrationKilledAfterAnyMoveIsFinishedAtTheNextStart) {
+  const std::vector<std::string> oldNames = {"quorvad.log", "quorvad.log.0", "quorvad.log.1"};
+  for (size_t kills = 1; kills <= oldNames.size(); ++kills) {
+    SCOPED_TRACE("kill " + std::to_string(kills));
+    QRVStartArmed(daemon_, "migration.log-moved");
+    QRVExpectStoppedDead(daemon_);
+    EXPECT_FALSE(daemon_.bootWorkRecorded());
+    EXPECT_EQ(QRVEntriesIn(root() + kOldLogs), oldNames.size() - kills);
+    EXPECT_EQ(QRVEntriesIn(root() + kLogs) - (fs::exists(root() + kLogs + "/quorvad.log") ? 1 : 0), kills);
+  }
+  QRVStartArmed(daemon_, "migration.bundles-relocated");
+  QRVExpectStoppedDead(daemon_);
+  EXPECT_FALSE(fs::exists(root() + kOldLogs));
+  EXPECT_FALSE(fs::exists(root() + kOldBundles));
+  EXPECT_EQ(QRVEntriesIn(root() + kBundleDirectory), 2u) << "the application and the orphan, moved whole";
+
+  startAndWaitForBootWork();
+  expectOlderDeviceSetUp(/*internalImage=*/true);
+  EXPECT_TRUE(daemon_.bootWorkRecorded());
+}
+
+// Command 30 stopped dead after the first user's subdirectories: the next
+// request does them all and records the migration; the one after that does
+// nothing more.
+TEST_F(BootIntegrationTest, APerUserMigrationKilledAfterOneUserIsFinishedByTheNextRequest) {
+  startAndWaitForBootWork();
+  QRVPlist made = QRVRepliesAs(daemon_, kInstallerUID,
+                               {QRVCreateRequest("com.example.app", 2)
+                                    .set("PersonaUniqueString", QRVPlist::string("WORK"))})[0];
+  ASSERT_EQ(QRVClient::resultCode(made), 1u) << made.description();
+  const std::string caches = made.stringForKey("ReplyPath") + "/Library/Caches";
+  ASSERT_TRUE(fs::is_directory(caches)) << caches;
+  fs::remove(caches);
+  daemon_.stop();
+
+  QRVStartArmed(daemon_, "migration.user-subdirectories-made");
+  QRVExpectStoppedDeadBy(daemon_, kInstallerUID, QRVRequest(30));
+  const std::string status = root() + kMobileHome + "/Library/Quorva/qrv_user_migration_status.plist";
+  EXPECT_FALSE(fs::exists(status)) << "recorded although cut short";
+
+  daemon_.start();
+  QRVPlist reply = QRVRepliesAs(daemon_, kInstallerUID, {QRVRequest(30)})[0];
+  EXPECT_EQ(QRVClient::resultCode(reply), 1u) << reply.description();
+  EXPECT_TRUE(fs::is_directory(caches)) << caches;
+  EXPECT_EQ(occurrences(daemon_.readLog(), "Completed Per User Subdirectory Migration for"), 3u)
+      << "one user before the kill, both after it";
+  const std::string bytes = QRVReadText(status);
+  std::optional<QRVPlist> recorded = QRVPlist::fromBinary(reinterpret_cast<const uint8_t*>(bytes.data()), bytes.size());
+  ASSERT_TRUE(recorded.has_value());
+  EXPECT_NE(recorded->get("SubdirectoryMigration"), nullptr);
+
+  fs::remove(caches);
+  reply = QRVRepliesAs(daemon_, kInstallerUID, {QRVRequest(30)})[0];
+  EXPECT_EQ(QRVClient::resultCode(reply), 1u);
+  EXPECT_FALSE(fs::exists(caches)) << "recorded: never again";
 }
