@@ -97,7 +97,14 @@ TEST_F(QuorvactlIntegrationTest, LookupFeedsTypedCallsListsAndRefuses) {
   EXPECT_EQ(refused.out.find("\"ReplyError\": 1,"), std::string::npos) << refused.out;
   EXPECT_EQ(refused.out.find("ReplyPath"), std::string::npos) << refused.out;
 
+  // The migrations answer when done; "allowed" may run both.
+  EXPECT_EQ(quorvactl(root_ + " per-user-migration").status, 0);
+  ToolRun migrator = quorvactl(root_ + " --json data-migration");
+  EXPECT_EQ(migrator.status, 0) << migrator.out;
+  EXPECT_NE(migrator.out.find("\"ReplyError\": 1"), std::string::npos) << migrator.out;
+
   // Usage errors never reach the daemon.
+  EXPECT_EQ(quorvactl(root_ + " per-user-migration --id x").status, 2);
   EXPECT_EQ(quorvactl(root_ + " lookup --class 1").status, 2);
   EXPECT_EQ(quorvactl(root_ + " list --class 1 --uuid x").status, 2);
 }
