@@ -47,6 +47,7 @@
 #include <string>
 #include <vector>
 
+#include "QRVBenchTiming.h"
 #include "base/QRVLog.h"
 #include "base/QRVUUID.h"
 #include "fs/QRVDictionaryAdditions.h"
@@ -59,7 +60,9 @@
 #include "support/QRVTestServices.h"
 
 namespace fs = std::filesystem;
-using Clock = std::chrono::steady_clock;
+using Clock = QRVBench::Clock;
+using QRVBench::median;
+using QRVBench::millisSince;
 
 namespace {
 
@@ -69,15 +72,6 @@ constexpr int kSystemContainers = 195;
 constexpr int kSystemGroupContainers = 5;
 constexpr uint32_t kApplicationProtectionClass = 3;
 constexpr const char* kAttribute = QRVLinuxFileSystemExtras::kProtectionClassAttribute;
-
-double millisSince(Clock::time_point start) {
-  return std::chrono::duration<double, std::milli>(Clock::now() - start).count();
-}
-
-double median(std::vector<double> v) {
-  std::sort(v.begin(), v.end());
-  return v.empty() ? 0 : v[v.size() / 2];
-}
 
 [[noreturn]] void die(const std::string& what) {
   fprintf(stderr, "%s\n", what.c_str());
@@ -232,8 +226,7 @@ std::vector<std::string> systemContainerNames(const std::vector<std::string>& sy
 }  // namespace
 
 int main() {
-  const char* repetitionsText = getenv("QRV_BENCH_REPETITIONS");
-  const int repetitions = repetitionsText ? std::max(1, atoi(repetitionsText)) : 7;
+  const int repetitions = QRVBench::repetitions(7);
   QRVLog::setLevel(QRVLogLevel::kError);
   if (geteuid() != 0) die("run as root: owners and the trusted class attribute");
 
