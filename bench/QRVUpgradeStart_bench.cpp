@@ -31,7 +31,9 @@
 //
 // Each figure is the median of $QRV_BENCH_REPETITIONS (default 7) rounds,
 // after one untimed round of each, printed with the ratio of the medians.
-// Run as root (owners and the trusted class attribute).
+// Run as root (owners and the trusted class attribute). With TMPDIR on
+// /dev/shm it measures the system calls and the CPU; on a disk, the disk's
+// metadata path sets the time and the rounds spread widely.
 #include <dirent.h>
 #include <fcntl.h>
 #include <stdio.h>
