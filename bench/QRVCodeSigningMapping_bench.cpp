@@ -31,6 +31,7 @@
 #include <string>
 #include <vector>
 
+#include "QRVBenchTiming.h"
 #include "codesigning/QRVCodeSigningMapping.h"
 #include "codesigning/QRVGroupManager.h"
 #include "codesigning/QRVSQLiteDB.h"
@@ -39,7 +40,9 @@
 #include "support/QRVTestServices.h"
 
 namespace fs = std::filesystem;
-using Clock = std::chrono::steady_clock;
+using Clock = QRVBench::Clock;
+using QRVBench::median;
+using QRVBench::millisSince;
 
 namespace {
 
@@ -63,15 +66,6 @@ QRVPlist codeSigningInfo(int i, bool changed) {
 }
 
 QRVPlist options() { return QRVPlist::dictionary().set(kQRVDataContainerClassOption, QRVPlist::uinteger(2)); }
-
-double millisSince(Clock::time_point start) {
-  return std::chrono::duration<double, std::milli>(Clock::now() - start).count();
-}
-
-double median(std::vector<double> v) {
-  std::sort(v.begin(), v.end());
-  return v.empty() ? 0 : v[v.size() / 2];
-}
 
 // The floor: every row read and its dictionary decoded, with plain SQLite.
 double rawFullRead(const fs::path& file) {
@@ -104,8 +98,7 @@ double rawFullRead(const fs::path& file) {
 }  // namespace
 
 int main() {
-  const char* repetitionsText = getenv("QRV_BENCH_REPETITIONS");
-  const int repetitions = repetitionsText ? std::max(1, atoi(repetitionsText)) : 7;
+  const int repetitions = QRVBench::repetitions(7);
   QRVLog::setLevel(QRVLogLevel::kError);
 
   QRVTestServices env;

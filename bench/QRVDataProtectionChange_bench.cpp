@@ -37,6 +37,7 @@
 #include <string>
 #include <vector>
 
+#include "QRVBenchTiming.h"
 #include "base/QRVLog.h"
 #include "dataprotection/QRVDataProtectionManager.h"
 #include "operations/QRVClientConnection.h"
@@ -46,22 +47,15 @@
 #include "support/QRVTestServices.h"
 
 namespace fs = std::filesystem;
-using Clock = std::chrono::steady_clock;
+using Clock = QRVBench::Clock;
+using QRVBench::median;
+using QRVBench::millisSince;
 
 namespace {
 
 constexpr int kDirectories = 1'000;
 constexpr int kFilesPerDirectory = 100;
 constexpr const char* kAttribute = QRVLinuxFileSystemExtras::kProtectionClassAttribute;
-
-double millisSince(Clock::time_point start) {
-  return std::chrono::duration<double, std::milli>(Clock::now() - start).count();
-}
-
-double median(std::vector<double> v) {
-  std::sort(v.begin(), v.end());
-  return v.empty() ? 0 : v[v.size() / 2];
-}
 
 // Reads the class of the open item and sets it to `target` where it
 // differs (or, given `mismatches`, only counts it there); counts the items
@@ -124,8 +118,7 @@ double timeRaw(const std::string& container, uint32_t target, size_t expected, s
 }  // namespace
 
 int main() {
-  const char* repetitionsText = getenv("QRV_BENCH_REPETITIONS");
-  const int repetitions = repetitionsText ? std::max(1, atoi(repetitionsText)) : 7;
+  const int repetitions = QRVBench::repetitions(7);
   QRVLog::setLevel(QRVLogLevel::kError);
   if (geteuid() != 0) {
     fprintf(stderr, "run as root: the class attribute is a trusted extended attribute\n");

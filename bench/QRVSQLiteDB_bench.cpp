@@ -27,6 +27,7 @@
 #include <string>
 #include <vector>
 
+#include "QRVBenchTiming.h"
 #include "codesigning/QRVSQLiteDB.h"
 
 namespace fs = std::filesystem;
@@ -244,8 +245,7 @@ class RatioReporter : public benchmark::ConsoleReporter {
 // interleaved order so that a change in the machine's load hits every
 // variant alike; the figures are the medians.
 int main(int argc, char** argv) {
-  const char* repetitionsText = getenv("QRV_BENCH_REPETITIONS");
-  const int repetitions = repetitionsText ? std::max(1, atoi(repetitionsText)) : 5;
+  const int repetitions = QRVBench::repetitions(5);
   workload();  // built once, before anything is timed
   for (const char* op : {"Insert", "Update"}) {
     const bool updates = std::string(op) == "Update";

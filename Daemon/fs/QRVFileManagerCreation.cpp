@@ -35,6 +35,12 @@ int QRVFileManager::_makeDirectory(const std::string& path, mode_t mode, bool* c
 // The directory and its missing parents, each made with `mode`. EEXIST when
 // the directory itself was there already.
 int QRVFileManager::_makePath(const std::string& path, mode_t mode, bool* created) {
+  // The configuration asks for its directories on every access, and they
+  // are nearly always there: one mkdir of the directory itself says so.
+  // Only a missing parent sends the walk down from the root, which would
+  // otherwise try every ancestor each time.
+  int first = _makeDirectory(path, mode, created);
+  if (first != ENOENT || *created) return first;
   for (size_t slash = path.find('/', 1); slash != std::string::npos; slash = path.find('/', slash + 1)) {
     if (path[slash - 1] == '/') continue;
     bool ignored = false;

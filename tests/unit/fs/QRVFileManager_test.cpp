@@ -247,6 +247,17 @@ TEST_F(FileManagerTest, DirectoriesGetExactModeOwnerAsGroupAndClassAndFailuresCa
   umask(old);
   EXPECT_EQ(lstatOf(at("m/n/o")).st_mode & 07777, 0751u);
   EXPECT_EQ(lstatOf(at("m")).st_mode & 07777, 0751u);
+  // Over a path that is all there, and one whose middle is missing: what was
+  // there keeps its mode, what is new gets the one asked for.
+  ASSERT_EQ(mkdir(at("p").c_str(), 0755), 0);
+  EXPECT_TRUE(fm.createDirectoryAtURL(at("p"), true, 0700, &error));
+  EXPECT_TRUE(fm.createDirectoryAtURL(at("p/q/r"), true, 0750, &error));
+  EXPECT_EQ(lstatOf(at("p")).st_mode & 07777, 0755u);
+  EXPECT_EQ(lstatOf(at("p/q")).st_mode & 07777, 0750u);
+  EXPECT_EQ(lstatOf(at("p/q/r")).st_mode & 07777, 0750u);
+  ASSERT_TRUE(fm.createDirectoryAtURLWithOwner(at("p/q/r"), true, 0700, 1000, &error));
+  EXPECT_EQ(lstatOf(at("p/q/r")).st_mode & 07777, 0750u);
+  EXPECT_EQ(ownerOf(at("p/q/r")).st_uid, 1000u);
   ASSERT_TRUE(fm.createDirectoryAtURLWithOwner(at("owned"), false, 0755, 1000, &error));
   EXPECT_EQ(ownerOf(at("owned")).st_uid, 1000u);
   EXPECT_EQ(ownerOf(at("owned")).st_gid, 1000u);
