@@ -436,3 +436,46 @@ TEST(CrashIntegrationTest, KillsUnderMixedLoadAlwaysRestartConsistent) {
   EXPECT_GT(succeeded, static_cast<size_t>(rounds)) << "the clients' requests hardly ever got through";
   std::printf("kill loop: %d rounds, %zu requests succeeded\n", rounds, succeeded);
 }
+
+// The data migrator stopped dead after the system-container ACLs, then after
+// the bundle ownership: neither step is recorded before it has finished, so
+// the next request runs it again, and the one after that finds both done.
+TEST(CrashIntegrationTest, ADataMigrationKilledAfterAnyStepIsFinishedByTheNextRequest) {
+  if (geteuid() != 0) GTEST_SKIP() << "needs root: clients run under other uids";
+  QRVDaemonProcess daemon;
+  trustInstaller(daemon);
+  daemon.start();
+  std::vector<QRVPlist> made =
+      QRVRepliesAs(daemon, kInstallerUID,
+                   {QRVCreateRequest("com.example.sys", 12), QRVCreateRequest("com.example.app", 1)});
+  for (const QRVPlist& reply : made) ASSERT_EQ(QRVClient::resultCode(reply), 1u) << reply.description();
+  const std::string binary = made[1].stringForKey("ReplyPath") + "/App.app/binary";
+  fs::create_directories(fs::path(binary).parent_path());
+  QRVWriteText(binary, "app");
+  daemon.stop();
+  // A device that had no system containers at its last upgrade recorded the
+  // ACLs as done; this one has them now and has not.
+  const std::string status = daemon.root() + "/private/var/root/Library/Quorva/qrv_migration_status.plist";
+  fs::remove(status);
+  auto recorded = [&](const char* type) {
+    const std::string bytes = fs::exists(status) ? QRVReadText(status) : std::string();
+    std::optional<QRVPlist> plist = QRVPlist::fromBinary(reinterpret_cast<const uint8_t*>(bytes.data()), bytes.size());
+    return plist && plist->get(type) != nullptr;
+  };
+
+  QRVStartArmed(daemon, "migration.acl-standardized");
+  QRVExpectStoppedDeadBy(daemon, kInstallerUID, QRVRequest(24));
+  EXPECT_FALSE(recorded("ACLMigration"));
+  QRVStartArmed(daemon, "migration.bundle-owned");
+  QRVExpectStoppedDeadBy(daemon, kInstallerUID, QRVRequest(24));
+  EXPECT_TRUE(recorded("ACLMigration"));
+  EXPECT_FALSE(recorded("BundleMigration"));
+
+  daemon.start();
+  EXPECT_EQ(QRVClient::resultCode(QRVRepliesAs(daemon, kInstallerUID, {QRVRequest(24)})[0]), 1u);
+  EXPECT_TRUE(recorded("BundleMigration"));
+  struct stat st {};
+  ASSERT_EQ(lstat(binary.c_str(), &st), 0);
+  EXPECT_EQ(st.st_uid, 33u);
+  EXPECT_EQ(QRVReadText(binary), "app");
+}
