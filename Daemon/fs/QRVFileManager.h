@@ -193,6 +193,8 @@ class QRVFileManager {
   // remains fails the removal once the rest has been removed. An empty path
   // fails with code 14 of the daemon's domain.
   bool removeItemAtURL(const std::string& url, QRVError* error);
+  // fsync(2) of the directory `url`: the entries made in it are on disk.
+  bool synchronizeDirectoryAtURL(const std::string& url, QRVError* error);
   // Removes the directory `url` when it holds nothing but (empty)
   // directories, deepest first; anything else below it fails the removal
   // with ENOTEMPTY before anything is removed. A missing `url` is success.

@@ -106,6 +106,12 @@ bool QRVFileManager::removeItemAtURL(const std::string& url, QRVError* error) {
   return true;
 }
 
+bool QRVFileManager::synchronizeDirectoryAtURL(const std::string& url, QRVError* error) {
+  if (int e = _syncDirectory(url))
+    return QRVFail(error, QRV_POSIX_ERROR(e, "fsync of {} failed: {}", url, errnoText(e)));
+  return true;
+}
+
 bool QRVFileManager::removeEmptyDirectoryTreeAtURL(const std::string& url, QRVError* error) {
   std::vector<std::string> deepestFirst;
   const bool walked = traverseItemAtURLWithoutFollowingLinks(url, error, [&](const QRVDirectoryEntry& entry,

@@ -228,6 +228,7 @@ class QRVClientConnection {
   bool _createTopLevelContainerDirectory(const std::string& url, QRVContainerClass containerClass, uid_t owner,
                                          QRVError* error);
   bool _createSubDirectories(const std::string& url, const QRVMetadata& metadata, QRVError* error);
+  bool _synchronizeSubDirectories(const std::string& url, QRVContainerClass containerClass, QRVError* error);
   uint32_t _dataProtectionClassForContainerMetadata(const QRVMetadata& metadata);
   // Gives every system and system group container of this connection's user
   // a new directory UUID (after a build upgrade, so that no process keeps

@@ -84,6 +84,27 @@ bool QRVClientConnection::_createSubDirectories(const std::string& url, const QR
   return true;
 }
 
+// The new subdirectories' entries reach the disk before the container goes
+// live: after a power loss a live container has its whole structure. Every
+// directory that received one is flushed, the container's own last.
+bool QRVClientConnection::_synchronizeSubDirectories(const std::string& url, QRVContainerClass containerClass,
+                                                     QRVError* error) {
+  std::set<std::string> parents;
+  for (const std::string& name : services_->platform.fileSystem->defaultSubdirectories(containerClass))
+    for (size_t slash = name.find('/'); slash != std::string::npos; slash = name.find('/', slash + 1))
+      parents.insert(name.substr(0, slash));
+  std::vector<std::string> directories;
+  for (const std::string& parent : parents) directories.push_back(url + "/" + parent);
+  directories.push_back(url);
+  for (const std::string& directory : directories) {
+    QRVError underlying;
+    if (!services_->fileManager->synchronizeDirectoryAtURL(directory, &underlying))
+      return QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kSubdirectoryNotCreated, underlying,
+                                                 "Failed to flush the subdirectories at {}", directory));
+  }
+  return true;
+}
+
 QRVMetadataRef QRVClientConnection::createOrLookupContainerWithContainerIdentity(
     const QRVContainerIdentityRef& containerIdentity, bool createIfNecessary, bool transient, bool useLocking,
     QRVError* error) {
@@ -190,7 +211,8 @@ QRVMetadataRef QRVClientConnection::createOrLookupContainerWithContainerIdentity
     QRVMetadataRef metadata = QRVMetadata::make(*concrete, QRVPlist(), staging, "");
     if (!metadata->writeMetadataToDisk(fm, config, &step) ||
         (QRVContainerClassIsSystem(containerClass) && !fm.setTopLevelSystemContainerACLAtURL(staging, &step)) ||
-        !_createSubDirectories(staging, *metadata, &step)) {
+        !_createSubDirectories(staging, *metadata, &step) ||
+        !_synchronizeSubDirectories(staging, containerClass, &step)) {
       QRVFail(error, step);
       discardStaging(nullptr);
       return nullptr;

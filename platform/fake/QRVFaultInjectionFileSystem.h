@@ -88,6 +88,22 @@ class QRVFaultInjectionFileSystem : public QRVFileSystem {
     std::lock_guard<std::mutex> l(m_);
     return recordOwnership_;
   }
+  // Every operation from now on, in order, with the path it names (a
+  // descriptor's is the path it was opened with), for tests of the order in
+  // which durable steps happen.
+  struct TracedCall {
+    Operation op;
+    std::string path, otherPath;
+  };
+  void startTracing() {
+    std::lock_guard<std::mutex> l(m_);
+    tracing_ = true;
+    trace_.clear();
+  }
+  std::vector<TracedCall> trace() {
+    std::lock_guard<std::mutex> l(m_);
+    return trace_;
+  }
 
   int open(int directoryFD, const std::string& path, int flags, mode_t mode, int* fd) override {
     if (int e = enter(Operation::kOpen, path)) return e;
@@ -202,6 +218,7 @@ class QRVFaultInjectionFileSystem : public QRVFileSystem {
   int enter(Operation op, const std::string& path, const std::string& otherPath = "") {
     std::lock_guard<std::mutex> l(m_);
     calls_[op]++;
+    if (tracing_) trace_.push_back({op, path, otherPath});
     for (auto it = faults_.begin(); it != faults_.end(); ++it) {
       Fault& f = it->fault;
       if (it->op != op) continue;
@@ -251,5 +268,7 @@ class QRVFaultInjectionFileSystem : public QRVFileSystem {
   std::map<Operation, int> calls_;
   std::map<int, std::string> paths_;  // open descriptors -> the path they were opened with
   bool recordOwnership_ = false;
+  bool tracing_ = false;
+  std::vector<TracedCall> trace_;
   std::map<std::pair<dev_t, ino_t>, std::pair<uid_t, gid_t>> owners_;
 };

@@ -221,4 +221,46 @@ TEST_F(CreateOrLookupTest, FailuresLeaveNothingLive) {
   EXPECT_EQ(cls, 0u);
 }
 
+// After a power loss a live container must have its default
+// subdirectories: every directory that received one is flushed after the
+// last of them is made and before the rename that puts the container live.
+TEST_F(CreateOrLookupTest, ANewContainersStructureIsOnDiskBeforeItGoesLive) {
+  using Op = QRVFaultInjectionFileSystem::Operation;
+  env_.posixFileSystem->startTracing();
+  auto made = get(identity("com.example.durable", QRVContainerClassAppData));
+  ASSERT_NE(made, nullptr) << error_.description();
+  const auto trace = env_.posixFileSystem->trace();
+  auto live = std::find_if(trace.begin(), trace.end(),
+                           [&](const auto& call) { return call.op == Op::kRename && call.otherPath == made->url(); });
+  ASSERT_NE(live, trace.end());
+  const std::string staging = live->path;
+  // The structure is made relative to the container's descriptor, one
+  // component at a time; the configuration's own directories by full path.
+  auto lastMade = std::find_if(std::make_reverse_iterator(live), trace.rend(), [](const auto& call) {
+    return call.op == Op::kMakeDirectory && !call.path.empty() && call.path[0] != '/';
+  });
+  ASSERT_NE(lastMade, trace.rend());
+  for (const std::string& directory : {staging, staging + "/Library"}) {
+    EXPECT_TRUE(std::any_of(lastMade.base(), live, [&](const auto& call) {
+      return call.op == Op::kSynchronize && call.path == directory;
+    })) << directory << " is not flushed between its last new entry and the move live";
+  }
+  // A flush of the structure that fails fails the creation: nothing goes
+  // live. The failure is aimed at the same flush of the next creation.
+  auto isStagingFlush = [](const auto& call) {
+    return call.op == Op::kSynchronize && call.path.find("/Staging/") != std::string::npos;
+  };
+  auto libraryFlush = std::find_if(lastMade.base(), live, [&](const auto& call) {
+    return call.op == Op::kSynchronize && call.path == staging + "/Library";
+  });
+  ASSERT_NE(libraryFlush, live);
+  const int nth = static_cast<int>(std::count_if(trace.begin(), libraryFlush + 1, isStagingFlush));
+  env_.posixFileSystem->inject(Op::kSynchronize, {EIO, nth, 1, "/Staging/"});
+  EXPECT_EQ(get(identity("com.example.unflushed", QRVContainerClassAppData)), nullptr);
+  EXPECT_EQ(error_.code(), 6u) << error_.description();
+  EXPECT_TRUE(!fs::exists(mobilePath("Staging")) || fs::is_empty(mobilePath("Staging")));
+  EXPECT_EQ(fs::path(made->url()).parent_path(), fs::path(mobilePath("Data/Application")));
+  EXPECT_EQ(std::distance(fs::directory_iterator(mobilePath("Data/Application")), fs::directory_iterator()), 1);
+}
+
 }  // namespace
