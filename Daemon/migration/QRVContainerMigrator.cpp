@@ -54,20 +54,6 @@ bool namesItself(QRVFileManager& fileManager, const std::string& path, const std
          *realPath == *realBase + path.substr(base.size());
 }
 
-// Runs `body`; an exception becomes 40, and on an internal image the crash
-// report, which does not return.
-template <typename Body>
-bool guarded(QRVServices& services, QRVError* error, Body body) {
-  try {
-    body();
-    return true;
-  } catch (...) {
-    if (services.globalConfiguration->isInternalImage()) QRVReportUncaughtException(std::current_exception());
-    return QRVFail(error, QRV_ERROR(QRVResultCode::kException, "Got exception: {} : {}",
-                                    QRVExceptionDescription(std::current_exception()), "(no call stack)"));
-  }
-}
-
 }  // namespace
 
 QRVContainerMigrator::QRVContainerMigrator(std::weak_ptr<QRVServices> services) : services_(std::move(services)) {}
@@ -193,7 +179,10 @@ bool QRVContainerMigrator::performDataMigratorMigrationForClientConnection(QRVCl
                                                                           QRVError* error) {
   std::shared_ptr<QRVServices> services = _services(error);
   if (!services) return false;
-  return guarded(*services, error, [&] { _performDataMigratorSteps(*services, connection); });
+  return QRVGuarded(services->globalConfiguration->isInternalImage(), error, false, [&] {
+    _performDataMigratorSteps(*services, connection);
+    return true;
+  });
 }
 
 void QRVContainerMigrator::_performDataMigratorSteps(QRVServices& services, QRVClientConnection& connection) {
@@ -263,9 +252,10 @@ bool QRVContainerMigrator::_performBundleContainerOwnershipMigrationWithError(QR
 bool QRVContainerMigrator::performPerUserDataMigrationForClientConnection(QRVClientConnection&, QRVError* error) {
   std::shared_ptr<QRVServices> services = _services(error);
   if (!services) return false;
-  return guarded(*services, error, [&] {
+  return QRVGuarded(services->globalConfiguration->isInternalImage(), error, false, [&] {
     _performSubdirectoryMigration(services);
     _performDataProtectionMigration(services);
+    return true;
   });
 }
 
@@ -288,19 +278,14 @@ bool QRVContainerMigrator::_migrateSubdirectoriesForUserIdentity(const std::shar
   const std::string build = QRVMigrationStatus::currentBuildVersion(*services);
   QRVLogNotice("Performing Per User Subdirectory Migration for {} on {}", who, build);
   std::shared_ptr<QRVClientConnection> connection = QRVClientConnection::makePrivilegedClientConnection(user, services);
-  bool succeeded = true;
-  for (QRVContainerClass containerClass = 1; containerClass < QRVContainerClassMax; ++containerClass) {
-    if (!QRVContainerClassIsPerUser(containerClass)) continue;
-    std::optional<std::vector<QRVMetadataRef>> containers = _containersOfUser(*services, user, containerClass);
-    if (!containers) {
-      succeeded = false;
-      continue;
-    }
-    QRVError error;
-    for (const QRVMetadataRef& container : *containers)
-      if (!connection->recreateDefaultStructureWithContainerIdentity(container->containerIdentity(), &error))
-        succeeded = false;
-  }
+  std::vector<QRVContainerClass> perUserClasses;
+  for (QRVContainerClass c = 1; c < QRVContainerClassMax; ++c)
+    if (QRVContainerClassIsPerUser(c)) perUserClasses.push_back(c);
+  const bool succeeded =
+      _forEachContainerOfUserIdentity(*services, user, perUserClasses, [&](const QRVMetadataRef& container) {
+        QRVError error;
+        return connection->recreateDefaultStructureWithContainerIdentity(container->containerIdentity(), &error);
+      });
   QRVLogNotice("Completed Per User Subdirectory Migration for {} on {} : Success: {}", who, build,
                succeeded ? 'Y' : 'N');
   QRVCrashPoint(*services, "migration.user-subdirectories-made");
@@ -318,29 +303,32 @@ void QRVContainerMigrator::_migrateDataProtectionForUserIdentity(const std::shar
   const std::string build = QRVMigrationStatus::currentBuildVersion(*services);
   QRVLogNotice("Performing User Data Protection Migration for {} on {}", who, build);
   std::shared_ptr<QRVClientConnection> connection = QRVClientConnection::makePrivilegedClientConnection(user, services);
-  bool succeeded = true;
-  for (QRVContainerClass dataClass : {QRVContainerClassAppData, QRVContainerClassPluginData}) {
-    std::optional<std::vector<QRVMetadataRef>> containers = _containersOfUser(*services, user, dataClass);
-    if (!containers) {
-      succeeded = false;
-      continue;
-    }
-    for (const QRVMetadataRef& container : *containers) _setDataProtectionIfNecessaryOnContainer(*connection, container);
-  }
+  const bool succeeded = _forEachContainerOfUserIdentity(
+      *services, user, {QRVContainerClassAppData, QRVContainerClassPluginData}, [&](const QRVMetadataRef& container) {
+        _setDataProtectionIfNecessaryOnContainer(*connection, container);
+        return true;
+      });
   QRVLogNotice("Completed User Data Protection Migration for {} on {} : Success: {}", who, build,
                succeeded ? 'Y' : 'N');
 }
 
-std::optional<std::vector<QRVMetadataRef>> QRVContainerMigrator::_containersOfUser(QRVServices& services,
-                                                                                  const QRVUserIdentityRef& user,
-                                                                                  QRVContainerClass containerClass) {
-  QRVError error;
-  std::optional<std::vector<QRVMetadataRef>> containers =
-      services.containerCache->allContainersForUserIdentity(user, containerClass, false, &error);
-  if (!containers)
-    QRVLogError("Failed to fetch list of data containers for userIdentity: {}, class: {}: {}", user->description(),
-                static_cast<long>(containerClass), error.description());
-  return containers;
+bool QRVContainerMigrator::_forEachContainerOfUserIdentity(QRVServices& services, const QRVUserIdentityRef& user,
+                                                           const std::vector<QRVContainerClass>& classes,
+                                                           const std::function<bool(const QRVMetadataRef&)>& body) {
+  bool succeeded = true;
+  for (QRVContainerClass containerClass : classes) {
+    QRVError error;
+    std::optional<std::vector<QRVMetadataRef>> containers =
+        services.containerCache->allContainersForUserIdentity(user, containerClass, false, &error);
+    if (!containers) {
+      QRVLogError("Failed to fetch list of data containers for userIdentity: {}, class: {}: {}", user->description(),
+                  static_cast<long>(containerClass), error.description());
+      succeeded = false;
+      continue;
+    }
+    for (const QRVMetadataRef& container : *containers) succeeded = body(container) && succeeded;
+  }
+  return succeeded;
 }
 
 // An installed application's bundle container: the same identifier, class

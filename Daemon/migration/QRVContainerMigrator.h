@@ -8,6 +8,7 @@
 // at the next opportunity. The migrator keeps no state of its own.
 #pragma once
 
+#include <functional>
 #include <memory>
 #include <optional>
 #include <string>
@@ -62,9 +63,11 @@ class QRVContainerMigrator {
   void _performDataProtectionMigration(const std::shared_ptr<QRVServices>& services);
   void _migrateDataProtectionForUserIdentity(const std::shared_ptr<QRVServices>& services,
                                              const QRVUserIdentityRef& user);
-  // The user's live containers of a class; a failure is logged.
-  std::optional<std::vector<QRVMetadataRef>> _containersOfUser(QRVServices& services, const QRVUserIdentityRef& user,
-                                                               QRVContainerClass containerClass);
+  // Calls `body` on each of the user's live containers of `classes`; false
+  // when a listing failed (logged) or a call did.
+  bool _forEachContainerOfUserIdentity(QRVServices& services, const QRVUserIdentityRef& user,
+                                       const std::vector<QRVContainerClass>& classes,
+                                       const std::function<bool(const QRVMetadataRef&)>& body);
   QRVMetadataRef _bundleContainerForDataContainer(QRVClientConnection& connection, const QRVMetadata& dataContainer,
                                                   QRVError* error);
   void _setDataProtectionIfNecessaryOnContainer(QRVClientConnection& connection, const QRVMetadataRef& container);

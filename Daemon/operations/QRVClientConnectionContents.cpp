@@ -38,19 +38,10 @@ std::string deletingLastPathComponent(const std::string& path) {
   return slash == std::string::npos ? std::string() : path.substr(0, slash);
 }
 
-// Runs `body`; an exception becomes 40 (and on an internal image the crash
-// report, which does not return).
+// Runs `body`; an exception becomes 40 (see QRVGuarded).
 template <typename Result, typename Body>
 Result guarded(QRVClientConnection& connection, QRVError* error, Result failed, Body body) {
-  try {
-    return body();
-  } catch (...) {
-    if (connection.services().globalConfiguration->isInternalImage())
-      QRVReportUncaughtException(std::current_exception());
-    QRVFail(error, QRV_ERROR(QRVResultCode::kException, "Got exception: {} : {}",
-                             QRVExceptionDescription(std::current_exception()), "(no call stack)"));
-    return failed;
-  }
+  return QRVGuarded(connection.services().globalConfiguration->isInternalImage(), error, std::move(failed), body);
 }
 
 }  // namespace
