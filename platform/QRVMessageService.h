@@ -62,6 +62,18 @@ class QRVReply {
   bool sent_ = false;
 };
 
+// What a peer process can change about itself after it connected, as far as
+// the trust store and the sandbox facility look at it: the executable it
+// runs (an exec replaces it) and whether it has confined itself (which it
+// can never undo). Everything else they read is fixed for the connection's
+// life (its credentials) or belongs to them (their own configuration).
+struct QRVPeerProcessState {
+  uint64_t executableDevice = 0;
+  uint64_t executableInode = 0;
+  bool confined = false;
+  bool operator==(const QRVPeerProcessState&) const = default;
+};
+
 class QRVConnection : public std::enable_shared_from_this<QRVConnection> {
  public:
   using EventHandler =
@@ -75,6 +87,11 @@ class QRVConnection : public std::enable_shared_from_this<QRVConnection> {
   virtual const QRVAuditToken& auditToken() const = 0;
   // The persona the peer runs in, if any.
   virtual std::optional<uint32_t> personaID() const = 0;
+  // The peer's state now, read through descriptors kept for the connection
+  // (one or two system calls, no lock). None when the peer has exited, or
+  // when the platform cannot tell: the caller must then identify the peer
+  // from scratch. Called by one thread at a time, like the event handler.
+  virtual std::optional<QRVPeerProcessState> peerProcessState() { return std::nullopt; }
 
   // Installs the handler; must precede `resume`.
   virtual void setEventHandler(EventHandler handler) = 0;

@@ -2,6 +2,7 @@
 // identifier) and what it may do (its entitlements), keyed by audit token.
 #pragma once
 
+#include <cstdint>
 #include <optional>
 #include <string>
 
@@ -29,4 +30,10 @@ class QRVTrustStore {
   virtual std::optional<std::string> executablePathForUnlistedAuditToken(const QRVAuditToken& token) {
     return std::nullopt;
   }
+  // A number that changes whenever the store's own entries change, so that
+  // an answer given for a peer whose QRVPeerProcessState has not changed
+  // since may be kept while it stays the same. None when the store cannot
+  // tell: every answer must then be asked for anew. Cheap (at most one
+  // system call) and safe on any thread.
+  virtual std::optional<uint64_t> changeCount() { return std::nullopt; }
 };

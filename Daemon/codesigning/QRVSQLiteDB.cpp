@@ -3,6 +3,7 @@
 #include <cxxabi.h>
 #include <sqlite3.h>
 
+#include <atomic>
 #include <cstdlib>
 #include <new>
 #include <typeinfo>
@@ -36,7 +37,18 @@ std::string describeException(std::exception_ptr exception) {
   }
 }
 
+std::atomic<uint64_t> gChangeCount{0};
+
+// Counts a change when the write it guards has finished, committed or not:
+// whoever read the count before the write and the database after it looks
+// again at the next count.
+struct CountsChange {
+  ~CountsChange() { gChangeCount++; }
+};
+
 }  // namespace
+
+uint64_t QRVSQLiteDB::changeCount() { return gChangeCount.load(); }
 
 sqlite3* QRVSQLiteDB::openDBWithURL(const std::filesystem::path& url) { return QRVSQLiteSchema::openDBWithURL(url); }
 
@@ -69,12 +81,15 @@ std::unique_ptr<QRVSQLiteDB> QRVSQLiteDB::initWithParentDirectoryURL(const std::
 }
 
 QRVSQLiteDB::QRVSQLiteDB(sqlite3* db, std::filesystem::path url, ExceptionReporter exceptionReporter)
-    : db_(db), url_(std::move(url)), exceptionReporter_(std::move(exceptionReporter)) {}
+    : db_(db), url_(std::move(url)), exceptionReporter_(std::move(exceptionReporter)) {
+  gChangeCount++;
+}
 
 QRVSQLiteDB::~QRVSQLiteDB() { closeDB(); }
 
 void QRVSQLiteDB::closeDB() {
   if (!db_) return;
+  CountsChange counted;
   QRVLogDebug("closing {}", url_.native());
   int rc = sqlite3_close(db_);
   if (rc != SQLITE_OK) QRVLogError("sqlite3_close for {} failed: {}", url_.native(), rc);
@@ -322,6 +337,7 @@ bool QRVSQLiteDB::_failInsideTransaction(std::exception_ptr exception, QRVError*
 
 bool QRVSQLiteDB::addCodeSigningEntry(const QRVCodeSigningEntry* entry, std::optional<std::string_view> identifier,
                                       QRVError* error) {
+  CountsChange counted;
   if (!entry || !identifier) {
     return QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidInput, "codeSigningEntry {} and identifier {} cannot be nil",
                                     entry ? entry->description() : "(null)", orNull(identifier)));
@@ -361,6 +377,7 @@ bool QRVSQLiteDB::addCodeSigningEntry(const QRVCodeSigningEntry* entry, std::opt
 }
 
 bool QRVSQLiteDB::deleteCodeSigningEntryWithIdentifier(std::optional<std::string_view> identifier, QRVError* error) {
+  CountsChange counted;
   if (!identifier) {
     return QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidInput, "\bidentifier {} cannot be nil", "(null)"));
   }
@@ -414,6 +431,7 @@ std::shared_ptr<const QRVCodeSigningEntry> QRVSQLiteDB::codeSigningEntryWithIden
 }
 
 bool QRVSQLiteDB::invalidateCodeSigningWithIdentifier(std::string_view identifier, QRVError* error) {
+  CountsChange counted;
   QRVError queryError;
   if (!_performSingleParameterQuery(kInvalidateSQL, identifier, &queryError)) {
     return QRVFail(error, QRV_ERROR_UNDERLYING(QRVResultCode::kDatabaseFailed, queryError,
@@ -423,6 +441,7 @@ bool QRVSQLiteDB::invalidateCodeSigningWithIdentifier(std::string_view identifie
 }
 
 bool QRVSQLiteDB::invalidateCodeSigningForIdentifierAndAllChildren(std::string_view identifier, QRVError* error) {
+  CountsChange counted;
   std::vector<std::string> identifiers{std::string(identifier)};
   QRVError childError;
   if (auto children = childIdentifiersForParentIdentifier(identifier, &childError)) {
@@ -620,6 +639,7 @@ std::optional<std::string> QRVSQLiteDB::parentIdentifierForChildIdentifier(std::
 }
 
 bool QRVSQLiteDB::deleteAllAdvanceCopiesOfCodeSigningEntriesWithError(QRVError* error) {
+  CountsChange counted;
   const std::string& path = url_.native();
   QRVSQLiteStatement statement(db_, kDeleteAdvanceCopiesSQL, path);
   if (!statement.prepared()) {

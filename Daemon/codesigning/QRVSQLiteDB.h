@@ -78,6 +78,11 @@ class QRVSQLiteDB {
   QRVSQLiteDB(const QRVSQLiteDB&) = delete;
   QRVSQLiteDB& operator=(const QRVSQLiteDB&) = delete;
 
+  // Counts up after every write to any code-signing database of this
+  // process, and whenever one is opened or closed, so that what was derived
+  // from a database may be kept while the count stays the same. Any thread.
+  static uint64_t changeCount();
+
   // The open connection (null once closed) and the database file.
   sqlite3* db() const { return db_; }
   const std::filesystem::path& url() const { return url_; }

@@ -27,7 +27,7 @@ QRVClientIdentity::QRVClientIdentity(std::string bundleIdentifier, uid_t uid, gi
       auditToken_(auditToken) {}
 
 std::shared_ptr<const QRVClientIdentity> QRVClientIdentity::clientIdentityWithRelayConnection(
-    const QRVConnection& connection, QRVServices& services) {
+    const QRVConnection& connection, QRVServices& services, bool* keepable) {
   const QRVAuditToken& token = connection.auditToken();
   QRVUserIdentityRef userIdentity =
       services.userIdentityCache->userIdentityForCurrentContextWithUID(connection.euid(), connection.egid());
@@ -50,6 +50,7 @@ std::shared_ptr<const QRVClientIdentity> QRVClientIdentity::clientIdentityWithRe
     }
   }
   const bool isInstaller = !bundleEntitlements && signingIdentifier && *signingIdentifier == kInstallerIdentifier;
+  if (keepable) *keepable = signingIdentifier && !bundleEntitlements;
 
   std::shared_ptr<const QRVClientIdentity> identity;
   bool cached = false;

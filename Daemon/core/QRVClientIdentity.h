@@ -1,5 +1,6 @@
-// Who sent a request: the immutable record of a calling process, built anew
-// for every message from the connection's credentials and the trust store.
+// Who sent a request: the immutable record of a calling process, built from
+// the connection's credentials and the trust store, and built anew whenever
+// anything it was built from may have changed (see QRVRelayPeer).
 //
 // The daemon's own work uses a privileged identity that it makes for itself.
 #pragma once
@@ -27,9 +28,13 @@ class QRVClientIdentity {
                     QRVPlist entitlements, bool sandboxed, QRVAuditToken auditToken);
 
   // The identity of the peer of `connection`, or null when the peer's
-  // signing identifier cannot be read (it then holds no powers).
+  // signing identifier cannot be read (it then holds no powers). With
+  // `keepable`, says whether the identity follows from the peer's process
+  // state, the trust store and the user identity alone (so that it may be
+  // kept while those stay the same; see QRVRelayPeer): true for a peer the
+  // trust store lists.
   static std::shared_ptr<const QRVClientIdentity> clientIdentityWithRelayConnection(
-      const QRVConnection& connection, QRVServices& services);
+      const QRVConnection& connection, QRVServices& services, bool* keepable = nullptr);
   // The daemon itself acting for `userIdentity`: "com.kelva.quorvad.internal",
   // ids 0, no entitlements, not sandboxed, an all-zero audit token.
   static std::shared_ptr<const QRVClientIdentity> privilegedClientIdentityWithUserIdentity(

@@ -4,6 +4,7 @@
 
 #include "base/QRVLog.h"
 #include "base/QRVResultCode.h"
+#include "codesigning/QRVSQLiteDB.h"
 #include "core/QRVExceptionReporter.h"
 #include "platform/QRVNotificationService.h"
 
@@ -20,7 +21,8 @@ QRVDaemon::QRVDaemon(std::shared_ptr<QRVServices> services, Options options)
         std::shared_ptr<QRVCodeSigningMapping> m = mapping.lock();
         if (!m || identifier.empty()) return QRVResultCode::kSuccess;
         return m->processCallerRegisteredEntitlements(entitlements, identifier, queue);
-      });
+      },
+      [] { return QRVSQLiteDB::changeCount(); });
 }
 
 QRVDaemon::StartResult QRVDaemon::start() {
@@ -40,9 +42,11 @@ QRVDaemon::StartResult QRVDaemon::start() {
   bool listening = messages.listen(
       "com.kelva.quorvad", listenerQueue_,
       [this](const std::shared_ptr<QRVConnection>& connection) {
-        connection->setEventHandler([this](const std::shared_ptr<QRVConnection>& c, const QRVConnectionEvent& e) {
-          dispatcher_.QRVProcessRelayEvent(c, e);
-        });
+        auto peer = std::make_shared<QRVRelayPeer>();
+        connection->setEventHandler(
+            [this, peer](const std::shared_ptr<QRVConnection>& c, const QRVConnectionEvent& e) {
+              dispatcher_.QRVProcessRelayEvent(c, e, peer.get());
+            });
         connection->resume();
       },
       &error);

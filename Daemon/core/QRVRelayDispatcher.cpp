@@ -41,7 +41,7 @@ QRVRelayDispatcher::QRVRelayDispatcher(std::shared_ptr<QRVServices> services, co
     : services_(std::move(services)), table_(table) {}
 
 void QRVRelayDispatcher::QRVProcessRelayEvent(const std::shared_ptr<QRVConnection>& connection,
-                                              const QRVConnectionEvent& event) {
+                                              const QRVConnectionEvent& event, QRVRelayPeer* peer) {
   if (event.kind == QRVConnectionEvent::Kind::kConnectionInvalid) return;
 
   const QRVPlist& request = event.message.body;
@@ -69,7 +69,8 @@ void QRVRelayDispatcher::QRVProcessRelayEvent(const std::shared_ptr<QRVConnectio
   QRVCurrentPersona::Scope persona(connection->personaID());
   auto commandQueue = std::make_shared<QRVCommandQueue>();
   std::shared_ptr<const QRVClientIdentity> identity =
-      QRVClientIdentity::clientIdentityWithRelayConnection(*connection, *services_);
+      peer ? peer->clientIdentity(*connection, *services_)
+           : QRVClientIdentity::clientIdentityWithRelayConnection(*connection, *services_);
   // A caller without a signing identifier has no name: the log lines say
   // "(null)", as they would of any missing object.
   const std::string clientName =
@@ -80,8 +81,11 @@ void QRVRelayDispatcher::QRVProcessRelayEvent(const std::shared_ptr<QRVConnectio
   } else {
     QRVCallerPowers powers = QRVCallerPowersForCommand(*entry, identity.get());
     if (powers.mayConnect(*entry) && identity && processRegisteredEntitlements_) {
-      uint64_t code = processRegisteredEntitlements_(identity->entitlements(), identity->bundleIdentifier(),
-                                                     *commandQueue);
+      uint64_t code =
+          peer && registrationChangeCount_
+              ? peer->registerEntitlements(identity, processRegisteredEntitlements_, registrationChangeCount_(),
+                                           *commandQueue)
+              : processRegisteredEntitlements_(identity->entitlements(), identity->bundleIdentifier(), *commandQueue);
       if (code != QRVResultCode::kSuccess)
         QRVLogError("Error processing entitlements for {} : {}", identity->bundleIdentifier(), code);
     }

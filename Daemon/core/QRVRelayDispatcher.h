@@ -11,6 +11,7 @@
 #include "core/QRVClientIdentity.h"
 #include "core/QRVCommandQueue.h"
 #include "core/QRVCommandTable.h"
+#include "core/QRVRelayPeer.h"
 #include "core/QRVServices.h"
 #include "platform/QRVMessageService.h"
 
@@ -42,12 +43,20 @@ class QRVRelayDispatcher {
   explicit QRVRelayDispatcher(std::shared_ptr<QRVServices> services,
                               const QRVCommandTable& table = QRVDefaultCommandTable());
 
-  void setRegisteredEntitlementsProcessor(RegisteredEntitlementsProcessor processor) {
+  // `changeCount`, when given, counts the changes of everything the
+  // processor reads: a caller's registration that succeeded is not repeated
+  // on its connection until the count moves (or its identity changes).
+  void setRegisteredEntitlementsProcessor(RegisteredEntitlementsProcessor processor,
+                                          std::function<uint64_t()> changeCount = nullptr) {
     processRegisteredEntitlements_ = std::move(processor);
+    registrationChangeCount_ = std::move(changeCount);
   }
 
-  // The per-connection event handler.
-  void QRVProcessRelayEvent(const std::shared_ptr<QRVConnection>& connection, const QRVConnectionEvent& event);
+  // The per-connection event handler. `peer` is what the connection keeps
+  // between its requests; without one, every request identifies its caller
+  // from scratch.
+  void QRVProcessRelayEvent(const std::shared_ptr<QRVConnection>& connection, const QRVConnectionEvent& event,
+                            QRVRelayPeer* peer = nullptr);
 
  private:
   void runHandler(const QRVCommandTableEntry& entry, const QRVPlist& request, const std::shared_ptr<QRVReply>& reply,
@@ -56,4 +65,5 @@ class QRVRelayDispatcher {
   const std::shared_ptr<QRVServices> services_;
   const QRVCommandTable& table_;
   RegisteredEntitlementsProcessor processRegisteredEntitlements_;
+  std::function<uint64_t()> registrationChangeCount_;
 };

@@ -2,6 +2,7 @@
 // state that a test sets and inspects; none restates the real logic.
 #pragma once
 
+#include <atomic>
 #include <cerrno>
 #include <map>
 #include <mutex>
@@ -30,7 +31,9 @@ class QRVFakeTrustStore : public QRVTrustStore {
   void setClient(pid_t pid, Client client) {
     std::lock_guard<std::mutex> l(m_);
     clients_[pid] = std::move(client);
+    changes_++;
   }
+  std::optional<uint64_t> changeCount() override { return changes_.load(); }
   std::optional<std::string> signingIdentifierForAuditToken(const QRVAuditToken& token, QRVError* error) override {
     std::lock_guard<std::mutex> l(m_);
     auto it = clients_.find(token.pid());
@@ -49,6 +52,7 @@ class QRVFakeTrustStore : public QRVTrustStore {
  private:
   std::mutex m_;
   std::map<pid_t, Client> clients_;
+  std::atomic<uint64_t> changes_{0};
 };
 
 class QRVFakeLockStateService : public QRVLockStateService {

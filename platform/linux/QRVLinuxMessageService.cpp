@@ -20,6 +20,7 @@
 #include "base/QRVLog.h"
 #include "base/QRVWireFrame.h"
 #include "platform/linux/QRVUnixSocket.h"
+#include "platform/linux/QRVPeerProcess.h"
 #include "platform/linux/QRVProcInfo.h"
 
 namespace {
@@ -42,8 +43,15 @@ int64_t nowMillis() {
 class QRVLinuxMessageService::Connection : public QRVConnection {
  public:
   Connection(QRVLinuxMessageService* service, uint64_t id, int fd, const ucred& cred, QRVAuditToken token,
-             int pidfd, std::optional<uint32_t> persona)
-      : service_(service), id_(id), fd_(fd), pidfd_(pidfd), cred_(cred), token_(token), persona_(persona) {}
+             int pidfd, std::optional<uint32_t> persona, std::unique_ptr<QRVPeerProcess> peer)
+      : service_(service),
+        id_(id),
+        fd_(fd),
+        pidfd_(pidfd),
+        cred_(cred),
+        token_(token),
+        persona_(persona),
+        peer_(std::move(peer)) {}
 
   ~Connection() override {
     if (fd_ >= 0) ::close(fd_);
@@ -61,6 +69,7 @@ class QRVLinuxMessageService::Connection : public QRVConnection {
   gid_t egid() const override { return cred_.gid; }
   const QRVAuditToken& auditToken() const override { return token_; }
   std::optional<uint32_t> personaID() const override { return persona_; }
+  std::optional<QRVPeerProcessState> peerProcessState() override { return peer_->state(); }
 
   void setEventHandler(EventHandler handler) override {
     QRVMutexLock lock(&mutex_);
@@ -323,6 +332,8 @@ class QRVLinuxMessageService::Connection : public QRVConnection {
   const ucred cred_;
   const QRVAuditToken token_;
   const std::optional<uint32_t> persona_;
+  // Used only by the thread that delivers the connection's events.
+  const std::unique_ptr<QRVPeerProcess> peer_;
 
   QRVMutex mutex_;
   EventHandler handler_ GUARDED_BY(mutex_);
@@ -472,11 +483,12 @@ void QRVLinuxMessageService::acceptPending() {
     int pidfd = static_cast<int>(syscall(SYS_pidfd_open, cred.pid, 0));
     QRVAuditToken token = QRVProcInfo::auditTokenForPeer(cred, pidfd);
     std::optional<uint32_t> persona = QRVProcInfo::personaFromCgroup(cred.pid);
+    auto peer = std::make_unique<QRVPeerProcess>(cred.pid, pidfd);
     std::shared_ptr<Connection> connection;
     {
       QRVMutexLock lock(&mutex_);
       uint64_t id = nextConnectionId_++;
-      connection = std::make_shared<Connection>(this, id, fd, cred, token, pidfd, persona);
+      connection = std::make_shared<Connection>(this, id, fd, cred, token, pidfd, persona, std::move(peer));
       connections_[id] = connection;
     }
     if (onConnection_) onConnection_(connection);

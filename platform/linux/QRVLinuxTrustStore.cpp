@@ -34,10 +34,26 @@ void QRVLinuxTrustStore::reloadIfChangedLocked() {
     loadLocked();
     return;
   }
-  bool changed = !loaded_;
+  bool changed = drainEvents();
+  if (reloadNeeded_.exchange(false)) changed = true;
+  if (changed || !loaded_) loadLocked();
+}
+
+bool QRVLinuxTrustStore::drainEvents() {
+  bool any = false;
   alignas(inotify_event) char buf[4096];
-  while (read(inotifyFd_, buf, sizeof buf) > 0) changed = true;
-  if (changed) loadLocked();
+  while (read(inotifyFd_, buf, sizeof buf) > 0) any = true;
+  if (any) {
+    reloadNeeded_ = true;
+    changes_++;
+  }
+  return any;
+}
+
+std::optional<uint64_t> QRVLinuxTrustStore::changeCount() {
+  if (inotifyFd_ < 0) return std::nullopt;
+  drainEvents();
+  return changes_.load();
 }
 
 void QRVLinuxTrustStore::loadLocked() {

@@ -8,6 +8,7 @@
 // a change, so look-ups cost no file I/O in the steady state.
 #pragma once
 
+#include <atomic>
 #include <string>
 #include <vector>
 
@@ -24,6 +25,8 @@ class QRVLinuxTrustStore : public QRVTrustStore {
                                                             QRVError* error) override;
   std::optional<QRVPlist> entitlementsForAuditToken(const QRVAuditToken& token) override;
   std::optional<std::string> executablePathForUnlistedAuditToken(const QRVAuditToken& token) override;
+  // Reads the directory's pending change events without taking the lock.
+  std::optional<uint64_t> changeCount() override;
 
  private:
   struct Entry {
@@ -38,11 +41,17 @@ class QRVLinuxTrustStore : public QRVTrustStore {
   // The entry for the live process behind `token`, or null.
   const Entry* match(const QRVAuditToken& token) REQUIRES(mutex_);
   void reloadIfChangedLocked() REQUIRES(mutex_);
+  // Consumes pending change events; true when there were any.
+  bool drainEvents();
   void loadLocked() REQUIRES(mutex_);
 
   const std::string directory_;
   QRVMutex mutex_;
   int inotifyFd_ = -1;
+  // Set (before changes_ counts up) when changeCount() consumed events that
+  // the next look-up must act on.
+  std::atomic<bool> reloadNeeded_{false};
+  std::atomic<uint64_t> changes_{0};
   bool loaded_ GUARDED_BY(mutex_) = false;
   std::vector<Entry> entries_ GUARDED_BY(mutex_);
 };

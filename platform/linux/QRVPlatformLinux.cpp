@@ -1,4 +1,5 @@
 #include <malloc.h>
+#include <sys/resource.h>
 
 #include "platform/QRVPlatform.h"
 #include "platform/linux/QRVLinuxAccounts.h"
@@ -27,6 +28,17 @@ QRVPlatform QRVPlatform::makeLinux(const std::string& root, const LinuxOptions& 
   // to the system when freed.
   mallopt(M_MMAP_THRESHOLD, 256 * 1024);
   mallopt(M_TRIM_THRESHOLD, 1024 * 1024);
+
+  // Each open connection holds four descriptors (the socket, a pidfd and two
+  // into the peer's /proc directory), the upcall server and the walks more:
+  // the customary soft limit of 1024 (kept low for select(), which the
+  // daemon never uses) would run out near the connection bound. The hard
+  // limit is the administrator's.
+  rlimit files{};
+  if (getrlimit(RLIMIT_NOFILE, &files) == 0 && files.rlim_cur < files.rlim_max) {
+    files.rlim_cur = files.rlim_max;
+    setrlimit(RLIMIT_NOFILE, &files);
+  }
 
   std::string r = root;
   while (r.size() > 1 && r.back() == '/') r.pop_back();

@@ -4,7 +4,6 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include <cstdlib>
 #include <fstream>
 #include <sstream>
 #include <string>
@@ -71,14 +70,20 @@ std::optional<std::string> executablePath(pid_t pid) {
   return target;
 }
 
-bool isSandboxed(pid_t pid) {
-  std::istringstream status(readFile(procPath(pid, "status")));
-  bool noNewPrivs = false, seccompFilter = false;
-  for (std::string line; std::getline(status, line);) {
-    if (line.rfind("NoNewPrivs:", 0) == 0) noNewPrivs = atoi(line.c_str() + 11) == 1;
-    if (line.rfind("Seccomp:", 0) == 0) seccompFilter = atoi(line.c_str() + 8) == 2;
-  }
-  return noNewPrivs && seccompFilter;
+bool isSandboxed(pid_t pid) { return statusShowsConfinement(readFile(procPath(pid, "status"))); }
+
+bool statusShowsConfinement(std::string_view status) {
+  // "NoNewPrivs:\t1" and "Seccomp:\t2" (a filter), each at a line's start.
+  auto fieldIs = [&](std::string_view name, char value) {
+    for (size_t at = status.find(name); at != std::string_view::npos; at = status.find(name, at + 1)) {
+      if (at != 0 && status[at - 1] != '\n') continue;
+      size_t v = status.find_first_not_of(" \t", at + name.size());
+      return v != std::string_view::npos && status[v] == value &&
+             (v + 1 == status.size() || status[v + 1] == '\n');
+    }
+    return false;
+  };
+  return fieldIs("NoNewPrivs:", '1') && fieldIs("Seccomp:", '2');
 }
 
 std::optional<uint32_t> personaFromCgroup(pid_t pid) {

@@ -9,6 +9,7 @@
 #include <cstdint>
 #include <optional>
 #include <string>
+#include <string_view>
 
 #include "platform/QRVAuditToken.h"
 
@@ -37,6 +38,8 @@ std::optional<std::string> executablePath(pid_t pid);
 
 // Runs with no_new_privs and a seccomp filter: how a sandboxed process shows.
 bool isSandboxed(pid_t pid);
+// The same, read from the text of /proc/<pid>/status.
+bool statusShowsConfinement(std::string_view status);
 
 // The numeric id of a "persona-<id>.slice" component of the process's cgroup
 // path, if any.

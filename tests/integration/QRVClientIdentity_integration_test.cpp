@@ -1,10 +1,25 @@
 // Requests are attributed to the right client: by executable, by uid, and
-// the installer's identity is rebuilt when its process restarts.
+// the installer's identity is rebuilt when its process restarts. A
+// connection keeps its peer's identity between requests only while the peer
+// stays what it was: an exec, a confinement or a trust-store change shows at
+// the very next request on the same connection.
 #include <gtest/gtest.h>
 
+#include <linux/filter.h>
+#include <linux/seccomp.h>
+#include <signal.h>
+#include <stdlib.h>
+#include <sys/prctl.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/un.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
+#include <chrono>
+#include <cstring>
 #include <regex>
+#include <thread>
 
 #include "client/QRVClient.h"
 #include "integration/QRVDaemonProcess.h"
@@ -26,6 +41,97 @@ std::vector<std::string> loggedIdentities(const std::string& log, const std::str
   for (auto it = std::sregex_iterator(log.begin(), log.end(), line); it != std::sregex_iterator(); ++it)
     out.push_back((*it)[1]);
   return out;
+}
+
+// The "isSandboxed" field of each identity logged for `identifier`.
+std::vector<std::string> loggedSandboxFlags(const std::string& log, const std::string& identifier) {
+  std::vector<std::string> out;
+  std::regex line("\\[" + identifier + "\\] Relay client identity: <QRVClientIdentity: [^\n]*isSandboxed = ([01])");
+  for (auto it = std::sregex_iterator(log.begin(), log.end(), line); it != std::sregex_iterator(); ++it)
+    out.push_back((*it)[1]);
+  return out;
+}
+
+// A peer process that connects to the daemon under `uid` and then runs
+// `afterConnect` (which may exec). The test keeps its own descriptor of the
+// same socket, so it speaks on the peer's connection: the daemon attributes
+// what it reads there to the process that connected.
+class ConnectedPeer {
+ public:
+  ConnectedPeer(const QRVDaemonProcess& daemon, uid_t uid, const std::function<void()>& afterConnect) {
+    fd_ = socket(AF_UNIX, SOCK_STREAM, 0);
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    std::string path = daemon.socketPath();
+    memcpy(address.sun_path, path.c_str(), path.size() + 1);
+    int connected[2];
+    if (fd_ < 0 || pipe(connected) != 0) return;
+    pid_ = fork();
+    if (pid_ == 0) {
+      close(connected[0]);
+      if (setgid(uid) != 0 || setuid(uid) != 0 ||
+          connect(fd_, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0)
+        _exit(1);
+      if (write(connected[1], "c", 1) != 1) _exit(1);
+      close(connected[1]);
+      afterConnect();
+      _exit(0);
+    }
+    close(connected[1]);
+    char c;
+    bool ok = pid_ > 0 && read(connected[0], &c, 1) == 1;
+    close(connected[0]);
+    if (ok) client_.emplace(QRVClient::adoptSocket(fd_));
+    fd_ = -1;
+  }
+  ~ConnectedPeer() {
+    client_.reset();
+    if (fd_ >= 0) close(fd_);
+    if (pid_ > 0) {
+      kill(pid_, SIGKILL);
+      waitpid(pid_, nullptr, 0);
+    }
+  }
+
+  pid_t pid() const { return pid_; }
+  uint64_t resultOf(const QRVPlist& request) {
+    if (!client_) return 0;
+    QRVClientError error;
+    std::optional<QRVPlist> reply = client_->sendRequest(request, std::chrono::seconds(10), &error);
+    return reply ? QRVClient::resultCode(*reply) : 0;
+  }
+  // Waits until the peer runs the executable at `path`.
+  bool eventuallyRuns(const std::string& path) {
+    struct stat want;
+    if (stat(path.c_str(), &want) != 0) return false;
+    std::string exe = "/proc/" + std::to_string(pid_) + "/exe";
+    for (int i = 0; i < 500; i++) {
+      struct stat running;
+      if (stat(exe.c_str(), &running) == 0 && running.st_dev == want.st_dev && running.st_ino == want.st_ino)
+        return true;
+      std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    }
+    return false;
+  }
+
+ private:
+  int fd_ = -1;
+  pid_t pid_ = -1;
+  std::optional<QRVClient> client_;
+};
+
+QRVPlist testabilityEntitlements(bool granted) {
+  QRVPlist e = QRVPlist::dictionary();
+  if (granted) e.set("com.kelva.private.Quorva.testability", QRVPlist::boolean(true));
+  return e;
+}
+
+QRVPlist executableEntry(const std::string& identifier, const std::string& executable, uid_t uid, bool granted) {
+  return QRVPlist::dictionary()
+      .set("SigningIdentifier", QRVPlist::string(identifier))
+      .set("Executable", QRVPlist::string(executable))
+      .set("UID", QRVPlist::uinteger(uid))
+      .set("Entitlements", testabilityEntitlements(granted));
 }
 
 class ClientIdentityIntegrationTest : public testing::Test {
@@ -85,6 +191,80 @@ TEST_F(ClientIdentityIntegrationTest, RestartedInstallerGetsAFreshIdentity) {
   EXPECT_EQ(ids[1], ids[2]);
   EXPECT_EQ(ids[3], ids[4]);
   EXPECT_NE(ids[2], ids[3]);
+}
+
+TEST_F(ClientIdentityIntegrationTest, AConnectedPeerIsIdentifiedAnewWhenItExecsOrTheTrustStoreChanges) {
+  char* shell = realpath("/bin/sh", nullptr);
+  char* sleeper = realpath("/bin/sleep", nullptr);
+  ASSERT_TRUE(shell && sleeper);
+  const std::string shellPath = shell, sleeperPath = sleeper;
+  free(shell);
+  free(sleeper);
+  daemon_.trustEntry("shell", executableEntry("com.example.shell", shellPath, 3020, true));
+  daemon_.trustEntry("sleeper", executableEntry("com.example.sleeper", sleeperPath, 3020, false));
+  daemon_.start();
+
+  // The peer connects, then runs a shell that waits for a line on its input
+  // and then execs another program, on the same connection.
+  int line[2];
+  ASSERT_EQ(pipe(line), 0);
+  ConnectedPeer peer(daemon_, 3020, [&] {
+    dup2(line[0], STDIN_FILENO);
+    close(line[1]);
+    execl(shellPath.c_str(), "sh", "-c", "read x; exec sleep 60", static_cast<char*>(nullptr));
+  });
+  close(line[0]);
+  ASSERT_TRUE(peer.eventuallyRuns(shellPath));
+  EXPECT_EQ(peer.resultOf(QRVRequest(25)), 1u);
+  EXPECT_EQ(peer.resultOf(QRVRequest(25)), 1u);
+  // An unchanged peer keeps its identity between requests.
+  std::vector<std::string> shellIdentities = loggedIdentities(daemon_.readLog(), "com.example.shell");
+  ASSERT_EQ(shellIdentities.size(), 2u);
+  EXPECT_EQ(shellIdentities[0], shellIdentities[1]);
+
+  ASSERT_EQ(write(line[1], "go\n", 3), 3);
+  close(line[1]);
+  ASSERT_TRUE(peer.eventuallyRuns(sleeperPath));
+  EXPECT_EQ(peer.resultOf(QRVRequest(25)), 55u);
+  EXPECT_EQ(loggedIdentities(daemon_.readLog(), "com.example.sleeper").size(), 1u);
+
+  // A trust-store change reaches a connection that is already open.
+  daemon_.trustEntry("sleeper", executableEntry("com.example.sleeper", sleeperPath, 3020, true));
+  EXPECT_EQ(peer.resultOf(QRVRequest(25)), 1u);
+  daemon_.trustEntry("sleeper", executableEntry("com.example.sleeper", sleeperPath, 3020, false));
+  EXPECT_EQ(peer.resultOf(QRVRequest(25)), 55u);
+}
+
+TEST_F(ClientIdentityIntegrationTest, APeerThatConfinesItselfAfterConnectingShowsSandboxed) {
+  daemon_.trustEntry("self", executableEntry("com.example.confining", selfExecutable(), 3021, true));
+  daemon_.start();
+  int go[2], done[2];
+  ASSERT_EQ(pipe(go), 0);
+  ASSERT_EQ(pipe(done), 0);
+  ConnectedPeer peer(daemon_, 3021, [&] {
+    char c;
+    if (read(go[0], &c, 1) != 1) _exit(1);
+    // What a sandbox does to a process: no new privileges and a seccomp
+    // filter (this one allows everything).
+    sock_filter allow = BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ALLOW);
+    sock_fprog program{1, &allow};
+    if (prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0) != 0 || prctl(PR_SET_SECCOMP, SECCOMP_MODE_FILTER, &program) != 0)
+      _exit(1);
+    if (write(done[1], "d", 1) != 1) _exit(1);
+    pause();
+  });
+  close(go[0]);
+  close(done[1]);
+  EXPECT_EQ(peer.resultOf(QRVRequest(25)), 1u);
+  ASSERT_EQ(write(go[1], "g", 1), 1);
+  char c;
+  ASSERT_EQ(read(done[0], &c, 1), 1);
+  EXPECT_EQ(peer.resultOf(QRVRequest(25)), 1u);
+  EXPECT_EQ(peer.resultOf(QRVRequest(25)), 1u);
+  close(go[1]);
+  close(done[0]);
+  EXPECT_EQ(loggedSandboxFlags(daemon_.readLog(), "com.example.confining"),
+            (std::vector<std::string>{"0", "1", "1"}));
 }
 
 }  // namespace

@@ -20,6 +20,7 @@ class QRVTestConnection : public QRVConnection {
   gid_t egid() const override { return gid_; }
   const QRVAuditToken& auditToken() const override { return token_; }
   std::optional<uint32_t> personaID() const override { return persona; }
+  std::optional<QRVPeerProcessState> peerProcessState() override { return state; }
   void setEventHandler(EventHandler) override {}
   void resume() override {}
   void cancel() override { cancelled = true; }
@@ -39,6 +40,9 @@ class QRVTestConnection : public QRVConnection {
   }
 
   std::optional<uint32_t> persona;
+  // What the peer's process looks like now; none (the default) keeps the
+  // daemon from keeping anything between requests.
+  std::optional<QRVPeerProcessState> state;
   bool cancelled = false;
   std::vector<std::pair<uint64_t, QRVPlist>> replies;
 

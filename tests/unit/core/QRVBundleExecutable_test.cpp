@@ -63,9 +63,10 @@ class BundleExecutableTest : public QRVContainerTest {
     env_.services->platform.trustStore = store_;
   }
   std::string trustDirectory() { return env_.root.path() + "/etc/quorva/clients.d"; }
-  std::shared_ptr<const QRVClientIdentity> identityOf(const RunningProgram& program) {
+  // `keepable` receives whether the identity may be kept between requests.
+  std::shared_ptr<const QRVClientIdentity> identityOf(const RunningProgram& program, bool* keepable = nullptr) {
     QRVTestConnection connection(program.pid(), getuid(), getgid(), program.token().startTime());
-    return QRVClientIdentity::clientIdentityWithRelayConnection(connection, *env_.services);
+    return QRVClientIdentity::clientIdentityWithRelayConnection(connection, *env_.services, keepable);
   }
   std::shared_ptr<QRVLinuxTrustStore> store_;
 };
@@ -95,9 +96,12 @@ TEST_F(BundleExecutableTest, AProgramInsideABundleContainerIsThatContainer) {
   ASSERT_EQ(env_.services->codeSigningMapping->processCallerRegisteredEntitlements(
                 QRVPlist::dictionary().set("com.example.flag", QRVPlist::boolean(true)), "com.example.bundled", queue),
             1u);
-  client = identityOf(program);
+  // Which is why such an identity is never kept between requests.
+  bool keepable = true;
+  client = identityOf(program, &keepable);
   ASSERT_NE(client, nullptr);
   EXPECT_TRUE(client->boolValueOfEntitlement("com.example.flag"));
+  EXPECT_FALSE(keepable);
 
   RunningProgram pluginProgram(plugin->url() + "/x");
   auto pluginOwner = QRVBundleExecutable::ownerOfExecutablePath(
@@ -111,7 +115,8 @@ TEST_F(BundleExecutableTest, AProgramInsideABundleContainerIsThatContainer) {
                                                   .set("Executable", QRVPlist::string(*path))
                                                   .toXML());
   EXPECT_EQ(store_->executablePathForUnlistedAuditToken(program.token()), std::nullopt);
-  ASSERT_NE(identityOf(program), nullptr);
+  ASSERT_NE(identityOf(program, &keepable), nullptr);
+  EXPECT_TRUE(keepable);
   EXPECT_EQ(identityOf(program)->bundleIdentifier(), "com.example.listed");
 
   // A process that is gone is nobody, even if its pid were reused.
