@@ -333,8 +333,8 @@ class QRVFileManager {
   void _close(int fd);
   void _standardizeMode(const std::string& path, const struct stat& st);
   // The rest of makeDirectory/makePath for createDirectoryAtURL.
-  int _makeDirectory(const std::string& path, mode_t mode, bool* created);
-  int _makePath(const std::string& path, mode_t mode, bool* created);
+  int _makeDirectory(const std::string& path, mode_t mode, bool* created, int* fd);
+  int _makePath(const std::string& path, mode_t mode, bool* created, int* fd);
   struct Walk;
   struct DescriptorWalk;
   bool _walk(Walk* walk, const std::string& path, int level, const struct stat& st);

@@ -21,55 +21,69 @@ bool containsMetadataFileName(std::string_view path) {
 // mkdir with exactly `mode`: the umask must not narrow what the caller asked
 // for. Sets *created when this call made the directory. The directory is
 // made private and given its mode through a descriptor that did not follow
-// a link, so that a link swapped in for it meanwhile gets nothing.
-int QRVFileManager::_makeDirectory(const std::string& path, mode_t mode, bool* created) {
+// a link, so that a link swapped in for it meanwhile gets nothing. With
+// `fd`, a directory this call made is left open there for the caller.
+int QRVFileManager::_makeDirectory(const std::string& path, mode_t mode, bool* created, int* fd) {
   if (int e = files_->makeDirectory(AT_FDCWD, path, 0700)) return e;
   *created = true;
-  int fd = -1;
-  if (int e = _openDirectoryNoFollow(AT_FDCWD, path, &fd)) return e;
-  int e = files_->changeModeOfFD(fd, mode);
-  _close(fd);
+  int opened = -1;
+  if (int e = _openDirectoryNoFollow(AT_FDCWD, path, &opened)) return e;
+  int e = files_->changeModeOfFD(opened, mode);
+  if (e || !fd) {
+    _close(opened);
+  } else {
+    *fd = opened;
+  }
   return e;
 }
 
 // The directory and its missing parents, each made with `mode`. EEXIST when
-// the directory itself was there already.
-int QRVFileManager::_makePath(const std::string& path, mode_t mode, bool* created) {
+// the directory itself was there already. `fd` as for _makeDirectory.
+int QRVFileManager::_makePath(const std::string& path, mode_t mode, bool* created, int* fd) {
   // The configuration asks for its directories on every access, and they
   // are nearly always there: one mkdir of the directory itself says so.
   // Only a missing parent sends the walk down from the root, which would
   // otherwise try every ancestor each time.
-  int first = _makeDirectory(path, mode, created);
+  int first = _makeDirectory(path, mode, created, fd);
   if (first != ENOENT || *created) return first;
   for (size_t slash = path.find('/', 1); slash != std::string::npos; slash = path.find('/', slash + 1)) {
     if (path[slash - 1] == '/') continue;
     bool ignored = false;
-    int e = _makeDirectory(path.substr(0, slash), mode, &ignored);
+    int e = _makeDirectory(path.substr(0, slash), mode, &ignored, nullptr);
     if (e && e != EEXIST) return e;
   }
-  return _makeDirectory(path, mode, created);
+  return _makeDirectory(path, mode, created, fd);
 }
 
 bool QRVFileManager::createDirectoryAtURL(const std::string& url, bool withIntermediateDirectories, mode_t mode,
                                           uid_t owner, uint32_t protectionClass, QRVError* error) {
   const char* call = withIntermediateDirectories ? "mkpath_np" : "mkdir";
   if (url.empty()) return QRVFail(error, QRV_POSIX_ERROR(ENOENT, "{} of {} failed: {}", call, url, errnoText(ENOENT)));
+  const bool leaveAsIs = protectionClass == kLeaveProtectionClassAlone && owner == 0;
   bool created = false;
-  int e = withIntermediateDirectories ? _makePath(url, mode, &created) : _makeDirectory(url, mode, &created);
+  int fd = -1;
+  int* keep = leaveAsIs ? nullptr : &fd;
+  int e = withIntermediateDirectories ? _makePath(url, mode, &created, keep) : _makeDirectory(url, mode, &created, keep);
   if (e && e != EEXIST) return QRVFail(error, QRV_POSIX_ERROR(e, "{} of {} failed: {}", call, url, errnoText(e)));
   if (!created) {
-    // Something was there already: fine when it is a directory.
+    // Something was there already, nearly always the very directory, owned
+    // as asked: then it is left untouched (a chown to the same owner would
+    // still write its inode, on every access of a configured directory).
     struct stat st;
+    if (protectionClass == kLeaveProtectionClassAlone &&
+        files_->status(AT_FDCWD, url, &st, AT_SYMLINK_NOFOLLOW) == 0 && S_ISDIR(st.st_mode) &&
+        (owner == 0 || (st.st_uid == owner && st.st_gid == owner)))
+      return true;
+    // Otherwise fine when it is a directory.
     if (files_->status(AT_FDCWD, url, &st, 0) != 0 || !S_ISDIR(st.st_mode))
       return QRVFail(error, QRV_POSIX_ERROR(EEXIST, "{} of {} failed: {}", call, url, errnoText(EEXIST)));
   }
-  if (protectionClass == kLeaveProtectionClassAlone && owner == 0) return true;
+  if (leaveAsIs) return true;
   // Class and owner are changed through a descriptor that did not follow a
   // link: a directory that was there already may lie in a container whose
   // user put a link in its place, and what the link points to is not ours to
   // give away.
-  int fd = -1;
-  if ((e = _openDirectoryNoFollow(AT_FDCWD, url, &fd)))
+  if (fd < 0 && (e = _openDirectoryNoFollow(AT_FDCWD, url, &fd)))
     return QRVFail(error, QRV_POSIX_ERROR(e, "opendir of {} failed: {}", url, errnoText(e)));
   bool ok = _setClassAndOwnerOfDirectory(fd, url, owner, protectionClass, error);
   _close(fd);
