@@ -131,6 +131,7 @@ QRVPlist lookupRequest(const std::string& identifier) {
 // dies with this process's main thread (PR_SET_PDEATHSIG), even on SIGKILL.
 
 std::atomic<pid_t> gDaemonPid{-1};
+std::atomic<bool> gStopping{false};  // no daemon is started once set
 std::mutex gRootMutex;
 std::string gRootToRemove;
 
@@ -144,14 +145,21 @@ void startSignalWatcher() {
   std::thread([set] {
     int signal = 0;
     sigwait(&set, &signal);
+    gStopping = true;
     fprintf(stderr, "\nsignal %d: stopping the daemon and removing the temporary root\n", signal);
     if (pid_t pid = gDaemonPid.exchange(-1); pid > 0) {
       kill(pid, SIGKILL);
       waitpid(pid, nullptr, 0);
     }
     std::lock_guard<std::mutex> lock(gRootMutex);
-    std::error_code ec;
-    if (!gRootToRemove.empty()) std::filesystem::remove_all(gRootToRemove, ec);
+    // The main thread may still be writing into the root (or removing it
+    // itself, after its daemon vanished): go on until it is gone.
+    for (int attempt = 0; attempt < 50 && !gRootToRemove.empty(); attempt++) {
+      std::error_code ec;
+      std::filesystem::remove_all(gRootToRemove, ec);
+      if (!std::filesystem::exists(gRootToRemove, ec)) break;
+      usleep(20'000);
+    }
     _exit(128 + signal);
   }).detach();
 }
@@ -172,21 +180,24 @@ std::string tailOf(const std::string& path) {
 // a trust-store entry that makes this process (root) an unrestricted client.
 class BenchRoot {
  public:
-  BenchRoot() {
-    daemon_.trustUID(getuid(), "com.example.bench.client",
-                     QRVPlist::dictionary().set("com.kelva.private.Quorva.allowed", QRVPlist::boolean(true)));
+  BenchRoot() : daemon_(std::make_unique<QRVDaemonProcess>()) {
+    daemon_->trustUID(getuid(), "com.example.bench.client",
+                      QRVPlist::dictionary().set("com.kelva.private.Quorva.allowed", QRVPlist::boolean(true)));
     std::lock_guard<std::mutex> lock(gRootMutex);
-    gRootToRemove = daemon_.root();
+    gRootToRemove = daemon_->root();
   }
+  // Removes the root under the lock, so that a signal meanwhile waits for
+  // the removal instead of ending the process half-way through it.
   ~BenchRoot() {
     std::lock_guard<std::mutex> lock(gRootMutex);
+    daemon_.reset();
     gRootToRemove.clear();
   }
-  const std::string& path() const { return daemon_.root(); }
-  std::string socketPath() const { return daemon_.socketPath(); }
+  const std::string& path() const { return daemon_->root(); }
+  std::string socketPath() const { return daemon_->socketPath(); }
 
  private:
-  QRVDaemonProcess daemon_;  // its destructor removes the root
+  std::unique_ptr<QRVDaemonProcess> daemon_;  // its destructor removes the root
 };
 
 // One run of the daemon binary: spawned by the constructor, stopped by the
@@ -196,6 +207,7 @@ class DaemonRun {
   explicit DaemonRun(const BenchRoot& root)
       : socketPath_(root.socketPath()), stderrPath_(root.path() + "/daemon-stderr.log"), spawned_(Clock::now()) {
     std::vector<std::string> args = {QUORVAD_BINARY, "--root", root.path()};
+    if (gStopping) fail("stopping");
     pid_ = fork();
     if (pid_ < 0) fail("fork failed");
     if (pid_ == 0) {
