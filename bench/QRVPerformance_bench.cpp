@@ -38,8 +38,8 @@
 //
 // Needs root (the daemon changes owners, the raw side does the same).
 #include <dirent.h>
-#include <fmt/format.h>
 #include <fcntl.h>
+#include <fmt/format.h>
 #include <pthread.h>
 #include <signal.h>
 #include <sys/epoll.h>
@@ -94,12 +94,12 @@ constexpr auto kTimeout = std::chrono::seconds(120);
 
 struct Sizes {
   int repetitions = 5;
-  int lookupContainers = 64;       // what the look-up rows ask for
-  int latencyRequests = 2000;      // per repetition and side
-  int throughputRequests = 4000;   // per repetition, side and client count
-  int creations = 40;              // per repetition and side
-  int startContainers = 10'000;    // the root of the first-answer rows
-  int usageFiles = 100'000;        // the container of the disk-usage row
+  int lookupContainers = 64;      // what the look-up rows ask for
+  int latencyRequests = 2000;     // per repetition and side
+  int throughputRequests = 4000;  // per repetition, side and client count
+  int creations = 40;             // per repetition and side
+  int startContainers = 10'000;   // the root of the first-answer rows
+  int usageFiles = 100'000;       // the container of the disk-usage row
 };
 
 Sizes quickSizes() {
@@ -119,8 +119,9 @@ Sizes quickSizes() {
 std::string identifierFor(const char* kind, int i) { return fmt::format("com.example.bench.{}{}", kind, i); }
 
 QRVPlist lookupRequest(const std::string& identifier) {
-  return QRVContainerRequests::createOrLookupContainer({.identifier = identifier, .containerClass = kDataClass, .persona = std::nullopt, .uuid = std::nullopt},
-                                                       /*create=*/true, /*transient=*/false);
+  return QRVContainerRequests::createOrLookupContainer(
+      {.identifier = identifier, .containerClass = kDataClass, .persona = std::nullopt, .uuid = std::nullopt},
+      /*create=*/true, /*transient=*/false);
 }
 
 // ---- Clean-up on every exit path ----
@@ -460,8 +461,7 @@ void printTable() {
   for (const Row& r : gRows) {
     const char* separator = r.note.empty() ? "" : "; ";
     if (r.raw == kNoRaw) {
-      printf("| %s | %.1f %s | - | -%s%s |\n", r.figure.c_str(), r.daemon, r.unit.c_str(), separator,
-             r.note.c_str());
+      printf("| %s | %.1f %s | - | -%s%s |\n", r.figure.c_str(), r.daemon, r.unit.c_str(), separator, r.note.c_str());
       continue;
     }
     double ratio = r.higherIsBetter ? r.raw / r.daemon : r.daemon / r.raw;
@@ -742,16 +742,14 @@ void benchFirstAnswer(const BenchRoot& root, const Sizes& sizes) {
       rebuild.raw.push_back(raw);
     }
     const char* cache = cold ? "cold" : "warm";
-    const std::string rawNote =
-        fmt::format("raw: read+decode of every metadata file, {} thread{}", cold ? kColdReadThreads : 1,
-                    cold ? "s" : "");
-    addRow(fmt::format("first look-up after start, {} containers, {} page cache (spawn to answer)", inDirectory,
-                       cache),
+    const std::string rawNote = fmt::format("raw: read+decode of every metadata file, {} thread{}",
+                                            cold ? kColdReadThreads : 1, cold ? "s" : "");
+    addRow(fmt::format("first look-up after start, {} containers, {} page cache (spawn to answer)", inDirectory, cache),
            "ms", first.d(), first.r(), false, rawNote);
     addRow(fmt::format("  of which start-up: spawn to a first answer needing no class map, {}", cache), "ms",
            QRVBench::median(startOnly), kNoRaw, false);
-    addRow(fmt::format("  of which the look-up that builds the class map, {}", cache), "ms", rebuild.d(),
-           rebuild.r(), false, rawNote);
+    addRow(fmt::format("  of which the look-up that builds the class map, {}", cache), "ms", rebuild.d(), rebuild.r(),
+           false, rawNote);
     return true;
   };
   measure(/*cold=*/false);
@@ -789,7 +787,10 @@ void benchDiskUsage(const BenchRoot& root, const Sizes& sizes) {
   QRVContainerClient client = daemon.firstAnswer();
   QRVContainerResult container = call(client, lookupRequest("com.example.bench.usage"));
   fillWithFiles(*container.path + "/Documents", sizes.usageFiles);
-  QRVContainerRef ref{.identifier = "com.example.bench.usage", .containerClass = kDataClass, .persona = std::nullopt, .uuid = container.uuid};
+  QRVContainerRef ref{.identifier = "com.example.bench.usage",
+                      .containerClass = kDataClass,
+                      .persona = std::nullopt,
+                      .uuid = container.uuid};
   uint64_t daemonBytes = 0, rawBytes = 0;
   Pair time;
   duBytes(*container.path);  // untimed: the tree in the page cache
@@ -822,7 +823,7 @@ std::string fileSystemOf(const std::string& directory) {
 void printMachine(const std::string& directory, const Sizes& sizes, bool quick) {
   utsname u{};
   uname(&u);
-  struct sysinfo si{};
+  struct sysinfo si {};
   sysinfo(&si);
   printf("machine: nproc %ld, memory %.1f GiB, Linux %s, %s on %s (%s)\n", sysconf(_SC_NPROCESSORS_ONLN),
          static_cast<double>(si.totalram) * si.mem_unit / (1u << 30), u.release, fileSystemOf(directory).c_str(),
@@ -873,8 +874,10 @@ int run(int argc, char** argv) {
     // made for these rows.
     BenchRoot root;
     benchFirstAnswer(root, sizes);
+    // Before the root goes: removing its containers takes a while.
+    printTable();
+    fprintf(stderr, "removing the temporary root\n");
   }
-  printTable();
   return 0;
 }
 
