@@ -1,5 +1,6 @@
 // What every bench measures with: milliseconds since a point in time, the
-// median of its rounds, and how many rounds it was asked for.
+// median of its rounds (and other percentiles), and how many rounds it was
+// asked for.
 #pragma once
 
 #include <algorithm>
@@ -20,6 +21,15 @@ inline double millisSince(Clock::time_point start) {
 inline double median(std::vector<double> v) {
   std::sort(v.begin(), v.end());
   return v.empty() ? 0 : v[v.size() / 2];
+}
+
+// The value below which a fraction `q` (0..1) of the samples lie: the
+// sample at that rank of the sorted list.
+inline double percentile(std::vector<double> v, double q) {
+  if (v.empty()) return 0;
+  std::sort(v.begin(), v.end());
+  size_t rank = static_cast<size_t>(q * static_cast<double>(v.size()));
+  return v[std::min(rank, v.size() - 1)];
 }
 
 // $QRV_BENCH_REPETITIONS, at least 1; `fallback` when it is not set.
