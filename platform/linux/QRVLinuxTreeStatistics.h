@@ -1,6 +1,6 @@
 // The walk behind QRVLinuxFileSystemExtras::directoryStatistics: allocated
 // bytes (st_blocks * 512) and the number of entries of a tree, the way `du`
-// counts them. It is descriptor-relative (openat/fstatat), so neither links
+// counts them. It is descriptor-relative (openat/statx), so neither links
 // nor the length of paths matter: an application can nest directories far
 // deeper than PATH_MAX inside its container, and its usage must still be
 // measured, not cut short.
@@ -16,15 +16,21 @@
 // - An entry that vanishes while the walk runs is not counted; any other
 //   failure ends the walk with its errno. There is no partial answer.
 //
+// It costs what `du` costs: one statx per entry, from its parent, asking
+// only for the fields counted; and per directory one open, one statx of
+// the open directory (what is counted is what was opened, so a directory
+// swapped for a mount point between the two calls is still left out),
+// getdents64 reads into one large buffer and one close. Each directory's
+// names are kept in one string.
+//
 // One walker serves one measurement, on one thread.
 #pragma once
 
-#include <sys/stat.h>
+#include <sys/types.h>
 
 #include <cstdint>
-#include <set>
 #include <string>
-#include <utility>
+#include <unordered_set>
 #include <vector>
 
 #include "platform/QRVFileSystemExtras.h"
@@ -41,31 +47,53 @@ class QRVLinuxTreeStatistics {
   int run(const std::string& path, QRVFileSystemExtras::DirectoryStatistics* statistics);
 
  private:
-  struct Frame {
-    int fd = -1;  // -1 while closed to save descriptors
+  // Which file an entry is: its device and inode.
+  struct Identity {
     dev_t dev = 0;
     ino_t ino = 0;
-    std::vector<std::string> pending;  // entries not yet measured, last first
+    bool operator==(const Identity&) const = default;
+  };
+  struct IdentityHash {
+    size_t operator()(const Identity& id) const { return id.ino ^ (static_cast<size_t>(id.dev) << 40); }
+  };
+  // What the walk needs to know of an entry.
+  struct Status {
+    Identity id;
+    mode_t mode = 0;
+    uint32_t nlink = 0;
+    uint64_t blocks = 0;
+    uint64_t mount = 0;  // 0 when the kernel cannot say
+  };
+  struct Frame {
+    int fd = -1;  // -1 while closed to save descriptors
+    Identity id;
+    std::string names;  // the entries, each ended by '\0'
+    size_t next = 0;    // offset in `names` of the next entry to measure
   };
 
-  // Counts one entry with status `st`; the starting point is no descendant.
-  void count(const struct stat& st, bool isRoot);
-  // Reads the names of the open directory `fd` (status `st`), counts it and
-  // makes it the innermost frame. Takes `fd` over in every case.
-  int push(int fd, const struct stat& st, bool isRoot);
+  // The status of `name` in the directory `directoryFD` ("" for the
+  // directory itself), links not followed. 0 or the errno of statx.
+  static int status(int directoryFD, const char* name, Status* status);
+  // Counts one entry; the starting point is no descendant.
+  void count(const Status& status, bool isRoot);
+  // Reads the names of the open directory `fd` (status `status`), counts it
+  // and makes it the innermost frame. Takes `fd` over in every case.
+  int push(int fd, const Status& status, bool isRoot);
   // Measures the next entry of the innermost frame, or leaves the frame.
   int step();
+  // Measures the directory `name` of the innermost frame, seen as `seen`.
+  int enter(const char* name, const Status& seen);
   // Re-finds the closed `parent` as ".." of the open directory `childFD`.
   int reopen(Frame& parent, int childFD);
-  // The mount the open directory `fd` is on, or 0 when the kernel cannot say.
-  static uint64_t mountOf(int fd);
+  // Whether a directory with status `status` lies on the starting point's mount.
+  bool onRootMount(const Status& status) const;
 
   std::vector<Frame> frames_;
   size_t openCount_ = 0;
   size_t firstOpen_ = 0;  // frames below this index are closed, the rest open
-  dev_t rootDevice_ = 0;
-  uint64_t rootMount_ = 0;
-  std::set<std::pair<dev_t, ino_t>> ancestors_;  // the directories of frames_
-  std::set<std::pair<dev_t, ino_t>> linked_;     // files with several names already counted
+  Status root_;
+  std::vector<char> direntBuffer_;
+  std::unordered_set<Identity, IdentityHash> ancestors_;  // the directories of frames_
+  std::unordered_set<Identity, IdentityHash> linked_;     // files with several names already counted
   QRVFileSystemExtras::DirectoryStatistics result_;
 };
