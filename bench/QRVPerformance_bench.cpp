@@ -28,13 +28,15 @@
 //  - disk usage of a container of kUsageFiles files: command 23; raw:
 //    `du -sB1` on the same directory.
 //
-//   QRVPerformance_bench [--dir DIR] [--quick] [--repetitions N]
+//   QRVPerformance_bench [--dir DIR] [--quick] [--repetitions N] [--only ROWS]
 //     --dir DIR          where the temporary root goes (default $TMPDIR or
 //                        /tmp); the figures are those of its file system
 //     --quick            small sizes and few requests: checks that every
 //                        part runs, in well under a minute
 //     --repetitions N    rounds of each side (default 5; at least 5 outside
 //                        --quick)
+//     --only ROWS        one group of rows: lookups, creations, usage or
+//                        first (the first answer after a start)
 //
 // Needs root (the daemon changes owners, the raw side does the same).
 #include <dirent.h>
@@ -838,6 +840,7 @@ int run(int argc, char** argv) {
   std::string directory = tmp && *tmp ? tmp : "/tmp";
   bool quick = false;
   int repetitions = 0;
+  std::string only;  // empty: every row
   for (int i = 1; i < argc; i++) {
     std::string arg = argv[i];
     if (arg == "--dir" && i + 1 < argc) {
@@ -846,8 +849,11 @@ int run(int argc, char** argv) {
       quick = true;
     } else if (arg == "--repetitions" && i + 1 < argc) {
       repetitions = atoi(argv[++i]);
+    } else if (arg == "--only" && i + 1 < argc) {
+      only = argv[++i];
     } else {
-      fprintf(stderr, "usage: %s [--dir DIR] [--quick] [--repetitions N]\n", argv[0]);
+      fprintf(stderr, "usage: %s [--dir DIR] [--quick] [--repetitions N] [--only lookups|creations|usage|first]\n",
+              argv[0]);
       return 2;
     }
   }
@@ -863,13 +869,14 @@ int run(int argc, char** argv) {
   startSignalWatcher();
   printMachine(directory, sizes, quick);
 
-  {
+  auto wanted = [&](const char* rows) { return only.empty() || only == rows; };
+  if (wanted("lookups") || wanted("creations") || wanted("usage")) {
     BenchRoot root;
-    benchLookups(root, sizes);
-    benchCreations(root, sizes);
-    benchDiskUsage(root, sizes);
+    if (wanted("lookups")) benchLookups(root, sizes);
+    if (wanted("creations")) benchCreations(root, sizes);
+    if (wanted("usage")) benchDiskUsage(root, sizes);
   }
-  {
+  if (wanted("first")) {
     // A root of its own, so that the class holds exactly the containers
     // made for these rows.
     BenchRoot root;
@@ -877,6 +884,8 @@ int run(int argc, char** argv) {
     // Before the root goes: removing its containers takes a while.
     printTable();
     fprintf(stderr, "removing the temporary root\n");
+  } else {
+    printTable();
   }
   return 0;
 }
