@@ -325,31 +325,35 @@ TEST_F(ContainerCacheTest, ABuildOutOfDescriptorsMidwayPublishesNothingAndTheNex
   env_.posixFileSystem->clearFaults();
 }
 
-// A build holds no lock while it reads: held inside the first metadata read
-// of alice's build, another class is served, and an addition and a removal
-// of alice's class wait and are applied to the map the build publishes.
+// A build holds no lock while it reads. Alice's build is held with every
+// metadata read stopped but that of "removed", listed first, whose file is
+// open by then: another class is served meanwhile, and a removal of
+// "removed" and an addition made after the listing wait for the build and
+// are applied to the map it publishes, neither lost nor undone.
 TEST_F(ContainerCacheTest, ABuildInProgressBlocksOnlyItsOwnClassAndLosesNoChange) {
-  auto removed = makeContainer(alice_, kData, "com.example.removed");
+  auto removed = makeContainer(alice_, kData, "com.example.removed", false,
+                               QRVUUID::fromString("00000000-0000-4000-8000-000000000000"));
   for (int i = 0; i < 50; i++) makeContainer(alice_, kData, "com.example." + std::to_string(i));
   makeContainer(bob_, kData, "com.example.bob");
   auto cache = makeCache();
+  // Bob's map first, so that the hooks stop alice's build only.
+  ASSERT_EQ(lookupCode(*cache, bob_, "com.example.bob"), 0u);
+
   std::promise<void> reached, release;
   std::shared_future<void> released = release.get_future().share();
-  std::atomic<bool> first{false};
-  env_.posixFileSystem->setHook(Op::kOpenResolved, [&](const std::string&) {
-    if (first.exchange(false)) {
-      reached.set_value();
-      released.wait();
-    }
+  std::atomic<bool> first{true};
+  const std::string removedName = removed->uuid().string();
+  env_.posixFileSystem->setHook(Op::kOpenResolved, [&](const std::string& path) {
+    if (path.find(removedName) == std::string::npos) released.wait();
   });
-  // Bob's map first, so that the hook stops alice's build only.
-  ASSERT_EQ(lookupCode(*cache, bob_, "com.example.bob"), 0u);
-  first = true;
+  env_.posixFileSystem->setHook(Op::kRead, [&](const std::string& path) {
+    if (path.find(removedName) != std::string::npos && first.exchange(false)) reached.set_value();
+  });
 
   auto building = std::async(std::launch::async, [&] { return lookupCode(*cache, alice_, "com.example.1"); });
   if (reached.get_future().wait_for(std::chrono::seconds(30)) != std::future_status::ready) {
     release.set_value();
-    FAIL() << "alice's build never read a metadata file";
+    FAIL() << "alice's build never read the first container";
   }
   // Served while alice's build is stopped.
   auto other = std::async(std::launch::async, [&] {
@@ -381,6 +385,7 @@ TEST_F(ContainerCacheTest, ABuildInProgressBlocksOnlyItsOwnClassAndLosesNoChange
     EXPECT_EQ(other.get(), 21u);
   }
   env_.posixFileSystem->setHook(Op::kOpenResolved, nullptr);
+  env_.posixFileSystem->setHook(Op::kRead, nullptr);
 
   EXPECT_EQ(lookupCode(*cache, alice_, "com.example.removed"), 21u);
   EXPECT_EQ(lookupCode(*cache, alice_, "com.example.added"), 0u);
