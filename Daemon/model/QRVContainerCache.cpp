@@ -73,14 +73,15 @@ QRVContainerCache::Locker::~Locker() {
   cache_.cacheLock_.unlock();
 }
 
-QRVContainerCache::Unlocker::Unlocker(QRVContainerCache& cache) : cache_(cache) {
-  cache_.cacheLockHolder_.store(std::thread::id(), std::memory_order_relaxed);
-  cache_.cacheLock_.unlock();
+void QRVContainerCache::_lock_release() {
+  _lock_assertHeld();
+  cacheLockHolder_.store(std::thread::id(), std::memory_order_relaxed);
+  cacheLock_.unlock();
 }
 
-QRVContainerCache::Unlocker::~Unlocker() {
-  cache_.cacheLock_.lock();
-  cache_.cacheLockHolder_.store(std::this_thread::get_id(), std::memory_order_relaxed);
+void QRVContainerCache::reacquireLock() {
+  cacheLock_.lock();
+  cacheLockHolder_.store(std::this_thread::get_id(), std::memory_order_relaxed);
 }
 
 void QRVContainerCache::_lock_waitForABuildToEnd() {
@@ -149,16 +150,20 @@ QRVContainerCache::ClassMap* QRVContainerCache::_lock_getCacheForUserIdentity(co
 
   building.insert(key);
   std::optional<ClassMap> built;
+  // An exception is held until the key is no longer marked, so that the
+  // threads waiting for this build wake up and build again.
+  // Nothing between the two lock calls can throw.
+  std::exception_ptr failure;
+  _lock_release();
   try {
-    Unlocker unlocked(*this);
     built = buildClassMap(userIdentity, contentClass, transient, key, error);
   } catch (...) {
-    building.erase(key);
-    buildEnded_.signalAll();
-    throw;
+    failure = std::current_exception();
   }
+  reacquireLock();
   building.erase(key);
   buildEnded_.signalAll();
+  if (failure) std::rethrow_exception(failure);
   if (!built) return nullptr;
   ClassMap& stored = maps[key] = std::move(*built);
   if (populateSandboxCache)

@@ -154,18 +154,11 @@ class QRVContainerCache {
    private:
     QRVContainerCache& cache_;
   };
-  // The opposite, for a stretch inside a Locker's scope: lets go of the lock
-  // and takes it again on the way out, exceptions included.
-  class SCOPED_CAPABILITY Unlocker {
-   public:
-    explicit Unlocker(QRVContainerCache& cache) RELEASE(cache.cacheLock_);
-    ~Unlocker() ACQUIRE();
-    Unlocker(const Unlocker&) = delete;
-    Unlocker& operator=(const Unlocker&) = delete;
-
-   private:
-    QRVContainerCache& cache_;
-  };
+  // Let go of the lock for a stretch inside a Locker's scope, and take it
+  // again. (A scoped unlocker would read better, but the analysis of the
+  // clang we build with does not follow one.)
+  void _lock_release() RELEASE(cacheLock_);
+  void reacquireLock() ACQUIRE(cacheLock_);
   // Ends the process unless the calling thread holds the lock: the run-time
   // twin of the REQUIRES below, for builds the analysis never sees (g++).
   void _lock_assertHeld() const ASSERT_CAPABILITY(cacheLock_);
