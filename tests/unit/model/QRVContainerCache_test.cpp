@@ -310,8 +310,7 @@ TEST_F(ContainerCacheTest, ABuildOutOfDescriptorsMidwayPublishesNothingAndTheNex
   QRVError error;
   EXPECT_EQ(lookup(*cache, alice_, "com.example.1", kData, &error), nullptr);
   EXPECT_EQ(error.code(), 43u);
-  // Nothing half-read was kept: not even a removal finds a map to change,
-  // and the next lookup reads everything.
+  // Nothing half-read was kept: the next lookup reads every container.
   const int opens = env_.posixFileSystem->calls(Op::kOpenResolved);
   EXPECT_EQ(lookupCode(*cache, alice_, "com.example.99"), 0u);
   EXPECT_EQ(env_.posixFileSystem->calls(Op::kOpenResolved) - opens, 100);
