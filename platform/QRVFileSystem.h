@@ -20,6 +20,7 @@
 #include <sys/types.h>
 
 #include <cstddef>
+#include <cstdint>
 #include <string>
 #include <vector>
 
@@ -35,6 +36,12 @@ class QRVFileSystem {
 
   // openat(2). `mode` only matters with O_CREAT or O_TMPFILE.
   virtual int open(int directoryFD, const std::string& path, int flags, mode_t mode, int* fd) = 0;
+  // openat2(2) without O_CREAT: `resolve` holds the RESOLVE_* flags that
+  // restrict how `path` is resolved (RESOLVE_BENEATH | RESOLVE_NO_SYMLINKS
+  // opens a path below `directoryFD` without following a link in any of its
+  // components). ENOSYS where the kernel, or a seccomp filter, does not
+  // offer the call: the caller then opens one component at a time.
+  virtual int openResolved(int directoryFD, const std::string& path, int flags, uint64_t resolve, int* fd) = 0;
   // close(2). The descriptor is gone whatever the result.
   virtual int close(int fd) = 0;
 

@@ -2,15 +2,25 @@
 #include "fs/QRVFileManager.h"
 
 #include <fcntl.h>
+#include <linux/openat2.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstring>
 
+#include "fs/QRVOpenDirectory.h"
 #include "fs/QRVPathComponents.h"
 
 namespace {
 
 std::string errnoText(int e) { return strerror(e); }
+
+// No link, and no blocking on a fifo planted in a file's place.
+constexpr int kUntrustedReadFlags = O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC;
+
+// Failures that say the process is short of something, not what the path
+// holds: asking again, one component at a time, would only fail again.
+bool isResourceExhaustion(int e) { return e == EMFILE || e == ENFILE || e == ENOMEM; }
 
 }  // namespace
 
@@ -68,19 +78,34 @@ int QRVFileManager::_writeAll(int fd, const std::vector<uint8_t>& bytes) {
 }
 
 // Reads `fd` to its end. More than `maxLength` bytes fail with EFBIG and
-// leave `contents` empty: the file may grow while it is read.
+// leave `contents` empty: the file may grow while it is read. The bytes go
+// straight into `contents`, sized for what the caller reserved plus one
+// byte, so a file of the expected size takes one read and the call that
+// sees its end.
 int QRVFileManager::_readAll(int fd, size_t maxLength, std::vector<uint8_t>* contents) {
+  constexpr size_t kChunk = 16384;
+  const size_t expected = contents->capacity();
+  const size_t limit = maxLength == SIZE_MAX ? SIZE_MAX : maxLength + 1;
   contents->clear();
-  uint8_t buf[16384];
+  size_t used = 0;
   for (;;) {
-    size_t n = 0;
-    if (int e = files_->read(fd, buf, sizeof buf, &n)) return e;
-    if (n == 0) return 0;
-    if (contents->size() + n > maxLength) {
-      contents->clear();
-      return EFBIG;
+    if (used == contents->size()) {
+      if (used > maxLength) {
+        contents->clear();
+        return EFBIG;
+      }
+      contents->resize(std::min(std::max(used + kChunk, expected + 1), limit));
     }
-    contents->insert(contents->end(), buf, buf + n);
+    size_t n = 0;
+    if (int e = files_->read(fd, contents->data() + used, contents->size() - used, &n)) {
+      contents->clear();
+      return e;
+    }
+    if (n == 0) {
+      contents->resize(used);
+      return 0;
+    }
+    used += n;
   }
 }
 
@@ -139,14 +164,44 @@ bool QRVFileManager::readRegularFileAtURL(const std::string& path, size_t maxLen
   if (int e =
           _open(QRVPathComponents::parentDirectory(path), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC, &directory))
     return QRVFail(error, QRV_POSIX_ERROR_QUIET(e, "Failed to open the directory of {}: {}", path, errnoText(e)));
-  // No link, and no blocking on a fifo planted in the file's place.
-  int fd = -1;
-  int e = files_->open(directory, QRVPathComponents::last(path),
-                       O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC, 0, &fd);
+  bool read = _readRegularFileInDirectory(directory, QRVPathComponents::last(path), path, maxLength, contents, error);
   _close(directory);
-  if (e) return QRVFail(error, QRV_POSIX_ERROR_QUIET(e, "Failed to open {}: {}", path, errnoText(e)));
+  return read;
+}
+
+bool QRVFileManager::readRegularFileBelowDirectory(const QRVOpenDirectory& directory, const std::string& child,
+                                                   const std::string& name, size_t maxLength,
+                                                   std::vector<uint8_t>* contents, QRVError* error) {
+  const std::string path = QRVPathComponents::appending(QRVPathComponents::appending(directory.url(), child), name);
+  int fd = -1;
+  int e = files_->openResolved(directory.fd(), child + "/" + name, kUntrustedReadFlags,
+                               RESOLVE_BENEATH | RESOLVE_NO_SYMLINKS, &fd);
+  if (!e) return _readOpenRegularFile(fd, path, maxLength, contents, error);
+  if (isResourceExhaustion(e))
+    return QRVFail(error, QRV_POSIX_ERROR_QUIET(e, "Failed to open {}: {}", path, errnoText(e)));
+  // A link, something missing, a call the kernel lacks: one component at a
+  // time tells which, in the words of a read by path.
+  int container = -1;
+  if ((e = files_->open(directory.fd(), child, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC, 0, &container)))
+    return QRVFail(error, QRV_POSIX_ERROR_QUIET(e, "Failed to open the directory of {}: {}", path, errnoText(e)));
+  bool read = _readRegularFileInDirectory(container, name, path, maxLength, contents, error);
+  _close(container);
+  return read;
+}
+
+bool QRVFileManager::_readRegularFileInDirectory(int directoryFD, const std::string& name, const std::string& path,
+                                                 size_t maxLength, std::vector<uint8_t>* contents, QRVError* error) {
+  int fd = -1;
+  if (int e = files_->open(directoryFD, name, kUntrustedReadFlags, 0, &fd))
+    return QRVFail(error, QRV_POSIX_ERROR_QUIET(e, "Failed to open {}: {}", path, errnoText(e)));
+  return _readOpenRegularFile(fd, path, maxLength, contents, error);
+}
+
+bool QRVFileManager::_readOpenRegularFile(int fd, const std::string& path, size_t maxLength,
+                                          std::vector<uint8_t>* contents, QRVError* error) {
   struct stat st;
-  if ((e = files_->statusOfFD(fd, &st))) {
+  int e = files_->statusOfFD(fd, &st);
+  if (e) {
   } else if (!S_ISREG(st.st_mode)) {
     e = EINVAL;
   } else if (static_cast<uint64_t>(st.st_size) > maxLength) {

@@ -42,6 +42,8 @@
 #include "platform/QRVFileSystem.h"
 #include "platform/QRVFileSystemExtras.h"
 
+class QRVOpenDirectory;
+
 // One entry of a traversal, as the walk delivers it.
 struct QRVDirectoryEntry {
   enum class Kind {
@@ -114,6 +116,13 @@ class QRVFileManager {
   // names that begin with ".", sorted by name. A missing directory fails with
   // ENOENT without logging.
   std::optional<std::vector<std::string>> urlsForItemsInDirectoryAtURL(const std::string& url, QRVError* error);
+  // The same in two steps, for a caller that goes on to read files below
+  // the directory through the descriptor: openDirectoryAtURL fails as the
+  // listing does when `url` cannot be opened (links in `url` are followed,
+  // as for a listing), and urlsForItemsInDirectory lists what it opened.
+  std::unique_ptr<QRVOpenDirectory> openDirectoryAtURL(const std::string& url, QRVError* error);
+  std::optional<std::vector<std::string>> urlsForItemsInDirectory(const QRVOpenDirectory& directory,
+                                                                  QRVError* error);
 
   // Called for each entry of a walk; returning false ends the walk, and what
   // the block stored through its error argument becomes the walk's error.
@@ -272,6 +281,16 @@ class QRVFileManager {
   // (a fifo or a device: EINVAL), and a file larger than `maxLength` bytes
   // fails with EFBIG instead of filling memory. Refusals are not logged.
   bool readRegularFileAtURL(const std::string& path, size_t maxLength, std::vector<uint8_t>* contents, QRVError* error);
+  // readRegularFileAtURL of `name` inside `child`, an entry of the open
+  // `directory`, with the same errors, the same refusals and no link
+  // followed in either component: usually a single openat2(2) below the
+  // descriptor. When that call fails it is not trusted to say which
+  // component failed, and the two components are opened one at a time for
+  // the answer, except when the process is out of descriptors or memory
+  // (EMFILE, ENFILE, ENOMEM), which fails at once with that errno.
+  bool readRegularFileBelowDirectory(const QRVOpenDirectory& directory, const std::string& child,
+                                     const std::string& name, size_t maxLength, std::vector<uint8_t>* contents,
+                                     QRVError* error);
   // Writes `contents` as a new file at `path` with `mode` and flushes it to
   // disk. Whatever was at `path` is removed first, so a link or hard link
   // planted there is never written through. Not atomic: for a temporary file
@@ -330,6 +349,14 @@ class QRVFileManager {
   int _syncDirectory(const std::string& directory);
   int _writeAll(int fd, const std::vector<uint8_t>& bytes);
   int _readAll(int fd, size_t maxLength, std::vector<uint8_t>* contents);
+  // The regular file `name` in the open directory `directoryFD`, read whole
+  // as readRegularFileAtURL does; `path` words the errors.
+  bool _readRegularFileInDirectory(int directoryFD, const std::string& name, const std::string& path,
+                                   size_t maxLength, std::vector<uint8_t>* contents, QRVError* error);
+  // Reads and closes `fd`, which must be a regular file of at most
+  // `maxLength` bytes.
+  bool _readOpenRegularFile(int fd, const std::string& path, size_t maxLength, std::vector<uint8_t>* contents,
+                            QRVError* error);
   void _close(int fd);
   void _standardizeMode(const std::string& path, const struct stat& st);
   // The rest of makeDirectory/makePath for createDirectoryAtURL.

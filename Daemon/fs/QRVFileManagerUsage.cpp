@@ -7,6 +7,7 @@
 #include <cstring>
 
 #include "fs/QRVFileManager.h"
+#include "fs/QRVOpenDirectory.h"
 #include "fs/QRVPathComponents.h"
 
 namespace {
@@ -26,6 +27,12 @@ unsigned char typeOfMode(mode_t mode) {
 
 std::optional<std::vector<std::string>> QRVFileManager::urlsForItemsInDirectoryAtURL(const std::string& url,
                                                                                      QRVError* error) {
+  std::unique_ptr<QRVOpenDirectory> directory = openDirectoryAtURL(url, error);
+  if (!directory) return std::nullopt;
+  return urlsForItemsInDirectory(*directory, error);
+}
+
+std::unique_ptr<QRVOpenDirectory> QRVFileManager::openDirectoryAtURL(const std::string& url, QRVError* error) {
   int fd = -1;
   if (int e = _open(url, O_RDONLY | O_DIRECTORY | O_NONBLOCK | O_CLOEXEC, &fd)) {
     if (e == ENOENT) {
@@ -34,26 +41,31 @@ std::optional<std::vector<std::string>> QRVFileManager::urlsForItemsInDirectoryA
       QRVLogError("opendir of {} failed: {}", url, errnoText(e));
       QRVFail(error, QRV_POSIX_ERROR(e, "_IterateDirectory for {} returned {}", url, errnoText(e)));
     }
+    return nullptr;
+  }
+  return std::make_unique<QRVOpenDirectory>(files_, fd, url);
+}
+
+std::optional<std::vector<std::string>> QRVFileManager::urlsForItemsInDirectory(const QRVOpenDirectory& directory,
+                                                                                QRVError* error) {
+  const std::string& url = directory.url();
+  std::vector<QRVFileSystem::DirectoryEntry> entries;
+  if (int e = files_->readDirectory(directory.fd(), &entries)) {
+    QRVFail(error, QRV_POSIX_ERROR(e, "_IterateDirectory for {} returned {}", url, errnoText(e)));
     return std::nullopt;
   }
-  std::vector<QRVFileSystem::DirectoryEntry> entries;
-  int e = files_->readDirectory(fd, &entries);
   std::vector<std::string> urls;
+  urls.reserve(entries.size());
   for (const QRVFileSystem::DirectoryEntry& entry : entries) {
-    if (e || entry.name[0] == '.') continue;
+    if (entry.name[0] == '.') continue;
     unsigned char type = entry.type;
     if (type == DT_UNKNOWN) {
       struct stat st;
-      if (files_->status(fd, entry.name, &st, AT_SYMLINK_NOFOLLOW) != 0) continue;
+      if (files_->status(directory.fd(), entry.name, &st, AT_SYMLINK_NOFOLLOW) != 0) continue;
       type = typeOfMode(st.st_mode);
     }
     if (type == DT_DIR || type == DT_REG || type == DT_LNK)
       urls.push_back(QRVPathComponents::appending(url, entry.name));
-  }
-  _close(fd);
-  if (e) {
-    QRVFail(error, QRV_POSIX_ERROR(e, "_IterateDirectory for {} returned {}", url, errnoText(e)));
-    return std::nullopt;
   }
   std::sort(urls.begin(), urls.end());
   return urls;

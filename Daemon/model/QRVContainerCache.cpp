@@ -1,12 +1,15 @@
 #include "model/QRVContainerCache.h"
 
 #include <algorithm>
+#include <cerrno>
 #include <exception>
 
 #include "base/QRVLog.h"
+#include "base/QRVParallelFor.h"
 #include "core/QRVExceptionReporter.h"
 #include "fs/QRVDictionaryAdditions.h"
 #include "fs/QRVFileManager.h"
+#include "fs/QRVOpenDirectory.h"
 #include "model/QRVGlobalConfiguration.h"
 #include "users/QRVUserIdentityCache.h"
 
@@ -25,6 +28,22 @@ const char* classDirectory(QRVContainerClass c) {
 // Data containers, whose mappings follow the application's personas: 2, 4,
 // 6, 9, 10, 11.
 bool isDataClassForSandbox(QRVContainerClass c) { return c < 12 && ((0xe54ULL >> c) & 1); }
+
+// A build keeps this many metadata reads in flight: with a cold page cache
+// the disk answers several at once much faster than one after another. A
+// class of a few dozen containers is read on the building thread alone,
+// which is cheaper than starting a thread.
+constexpr size_t kBuildThreads = 8;
+constexpr size_t kContainersPerBuildThread = 32;
+
+// Whether a read failed because the process ran short of descriptors or
+// memory, which says nothing about the container.
+bool isResourceExhaustion(const QRVError* error) {
+  for (; error; error = error->underlying())
+    if (error->isPOSIX() && (error->code() == EMFILE || error->code() == ENFILE || error->code() == ENOMEM))
+      return true;
+  return false;
+}
 
 }  // namespace
 
@@ -52,6 +71,24 @@ QRVContainerCache::Locker::Locker(QRVContainerCache& cache) : cache_(cache) {
 QRVContainerCache::Locker::~Locker() {
   cache_.cacheLockHolder_.store(std::thread::id(), std::memory_order_relaxed);
   cache_.cacheLock_.unlock();
+}
+
+void QRVContainerCache::_lock_release() {
+  _lock_assertHeld();
+  cacheLockHolder_.store(std::thread::id(), std::memory_order_relaxed);
+  cacheLock_.unlock();
+}
+
+void QRVContainerCache::reacquireLock() {
+  cacheLock_.lock();
+  cacheLockHolder_.store(std::this_thread::get_id(), std::memory_order_relaxed);
+}
+
+void QRVContainerCache::_lock_waitForABuildToEnd() {
+  _lock_assertHeld();
+  cacheLockHolder_.store(std::thread::id(), std::memory_order_relaxed);
+  buildEnded_.wait(&cacheLock_);
+  cacheLockHolder_.store(std::this_thread::get_id(), std::memory_order_relaxed);
 }
 
 void QRVContainerCache::_lock_assertHeld() const {
@@ -82,8 +119,10 @@ bool QRVContainerCache::containerURL(const std::string& url, QRVContainerClass i
 QRVContainerCache::ClassMap* QRVContainerCache::_lock_existingCacheForUserIdentity(
     const QRVUserIdentityRef& userIdentity, QRVContainerClass contentClass, bool transient) {
   _lock_assertHeld();
-  auto& maps = transient ? transientContainerCache_ : liveContainerCache_;
-  auto it = maps.find(cacheKey(userIdentity, contentClass));
+  const std::string key = cacheKey(userIdentity, contentClass);
+  while (_lock_building(transient).count(key)) _lock_waitForABuildToEnd();
+  auto& maps = _lock_maps(transient);
+  auto it = maps.find(key);
   return it == maps.end() ? nullptr : &it->second;
 }
 
@@ -99,31 +138,87 @@ QRVContainerCache::ClassMap* QRVContainerCache::_lock_getCacheForUserIdentity(co
                              contentClass, describe(userIdentity)));
     return nullptr;
   }
-  auto& maps = transient ? transientContainerCache_ : liveContainerCache_;
-  if (auto it = maps.find(key); it != maps.end()) return &it->second;
+  auto& maps = _lock_maps(transient);
+  std::set<std::string>& building = _lock_building(transient);
+  for (;;) {
+    if (auto it = maps.find(key); it != maps.end()) return &it->second;
+    // Whether another thread's build succeeds or fails, this thread looks
+    // again: a failed build leaves nothing, and then this one builds.
+    if (!building.count(key)) break;
+    _lock_waitForABuildToEnd();
+  }
 
+  building.insert(key);
+  std::optional<ClassMap> built;
+  // An exception is held until the key is no longer marked, so that the
+  // threads waiting for this build wake up and build again.
+  // Nothing between the two lock calls can throw.
+  std::exception_ptr failure;
+  _lock_release();
+  try {
+    built = buildClassMap(userIdentity, contentClass, transient, key, error);
+  } catch (...) {
+    failure = std::current_exception();
+  }
+  reacquireLock();
+  building.erase(key);
+  buildEnded_.signalAll();
+  if (failure) std::rethrow_exception(failure);
+  if (!built) return nullptr;
+  ClassMap& stored = maps[key] = std::move(*built);
+  if (populateSandboxCache)
+    for (auto& [identifier, entry] : stored) _lock_registerWithSandboxIfNeeded(&entry, userIdentity, contentClass);
+  return &stored;
+}
+
+std::optional<QRVContainerCache::ClassMap> QRVContainerCache::buildClassMap(const QRVUserIdentityRef& userIdentity,
+                                                                            QRVContainerClass contentClass,
+                                                                            bool transient, const std::string& key,
+                                                                            QRVError* error) {
   QRVLogDebug("RebuildingCache: class {}", contentClass);
-  std::optional<std::string> directory =
+  std::optional<std::string> directoryURL =
       globalConfiguration_->containerDirectoryURLForUserIdentity(userIdentity, contentClass, transient);
-  if (!directory) {
+  if (!directoryURL) {
     QRVFail(error, QRV_ERROR(QRVResultCode::kInvalidObject, "Cache: {}{}: no container directory", key,
                              transientSuffix(transient)));
-    return nullptr;
+    return std::nullopt;
   }
-  std::optional<std::vector<std::string>> entries = fileManager_->urlsForItemsInDirectoryAtURL(*directory, error);
-  if (!entries) return nullptr;
+  std::unique_ptr<QRVOpenDirectory> directory = fileManager_->openDirectoryAtURL(*directoryURL, error);
+  if (!directory) return std::nullopt;
+  std::optional<std::vector<std::string>> entries = fileManager_->urlsForItemsInDirectory(*directory, error);
+  if (!entries) return std::nullopt;
+
+  struct Candidate {
+    const std::string* url;
+    std::string name;
+    QRVMetadataRef metadata;
+    QRVError readError;
+  };
+  std::vector<Candidate> candidates;
+  for (const std::string& url : *entries)
+    if (containerURL(url, contentClass)) candidates.push_back({&url, QRVLastPathComponent(url), nullptr, {}});
+
+  // The class-path check keeps a container that was moved into another
+  // class's tree out of this class's map. Files that do not validate were
+  // logged by the reader and are not containers.
+  QRVParallelFor(candidates.size(), kBuildThreads, kContainersPerBuildThread, [&](size_t i) {
+    Candidate& c = candidates[i];
+    c.metadata = QRVMetadata::readAndValidateMetadataBelowDirectory(*directory, c.name, userIdentity, true,
+                                                                    *fileManager_, *userIdentityCache_, &c.readError);
+    return c.metadata || !isResourceExhaustion(&c.readError);
+  });
+  for (Candidate& c : candidates)
+    if (!c.metadata && isResourceExhaustion(&c.readError)) {
+      QRVFail(error, std::move(c.readError));
+      return std::nullopt;
+    }
 
   ClassMap map;
-  for (const std::string& url : *entries) {
-    if (!containerURL(url, contentClass)) continue;
-    // The class-path check keeps a container that was moved into another
-    // class's tree out of this class's map. Files that do not validate were
-    // logged by the reader and are not containers.
-    QRVMetadataRef metadata = QRVMetadata::readAndValidateMetadataAtUrl(url, userIdentity, true, *fileManager_,
-                                                                        *userIdentityCache_, nullptr);
-    if (!metadata) continue;
+  for (Candidate& c : candidates) {
+    if (!c.metadata) continue;
+    QRVMetadataRef metadata = std::move(c.metadata);
     if (metadata->containerClass() != contentClass) {
-      QRVLogError("Cache: {}{}: {} holds a container of class {}; skipped", key, transientSuffix(transient), url,
+      QRVLogError("Cache: {}{}: {} holds a container of class {}; skipped", key, transientSuffix(transient), *c.url,
                   metadata->containerClass());
       continue;
     }
@@ -131,13 +226,10 @@ QRVContainerCache::ClassMap* QRVContainerCache::_lock_getCacheForUserIdentity(co
     auto [it, inserted] = map.try_emplace(metadata->identifier());
     if (!inserted)
       QRVLogError("Cache: {}{}: {} and {} both claim identifier {}; keeping the latter", key,
-                  transientSuffix(transient), it->second.metadata->url(), url, metadata->identifier());
+                  transientSuffix(transient), it->second.metadata->url(), *c.url, metadata->identifier());
     it->second = Entry{std::move(metadata), {}};
   }
-  ClassMap& stored = maps[key] = std::move(map);
-  if (populateSandboxCache)
-    for (auto& [identifier, entry] : stored) _lock_registerWithSandboxIfNeeded(&entry, userIdentity, contentClass);
-  return &stored;
+  return map;
 }
 
 // ---- Lookups ----

@@ -9,13 +9,22 @@
 // facility, so that the launcher can find a process's container.
 //
 // One per process (QRVServices::containerCache). Thread-safe: both maps live
-// under one lock, which is held while a class directory is read. Methods
-// named `_lock_` require it (checked by clang's thread-safety analysis) and
-// check at run time that the calling thread holds it.
+// under one lock. Methods named `_lock_` require it (checked by clang's
+// thread-safety analysis) and check at run time that the calling thread
+// holds it. The lock is not held while a class directory is read: the thread
+// that builds a map marks its key as being built, reads the directory
+// without the lock (many metadata files at once) and takes the lock again
+// only to publish the map. Every other class is served meanwhile; an
+// operation on the class being built (lookup, listing, addition, removal)
+// waits for the build to end and then goes on as usual, so that an addition
+// or removal made while the disk was being read is applied to the map that
+// was read, never lost under it. A failed build publishes nothing, and the
+// next operation on that class builds again.
 // While the lock is held the cache calls the user identity cache, the seams
-// and the sandbox facility, none of which may call back into it. Callers that
-// create containers additionally hold the global identifier locks, which
-// order lookups against creations.
+// and the sandbox facility, none of which may call back into it; the build
+// calls the user identity cache and the seams from several threads. Callers
+// that create containers additionally hold the global identifier locks,
+// which order lookups against creations.
 #pragma once
 
 #include <atomic>
@@ -28,6 +37,7 @@
 #include <unordered_map>
 #include <vector>
 
+#include "base/QRVCondVar.h"
 #include "base/QRVError.h"
 #include "base/QRVMutex.h"
 #include "model/QRVContainerCacheSeams.h"
@@ -144,17 +154,47 @@ class QRVContainerCache {
    private:
     QRVContainerCache& cache_;
   };
+  // Let go of the lock for a stretch inside a Locker's scope, and take it
+  // again. (A scoped unlocker would read better, but the analysis of the
+  // clang we build with does not follow one.)
+  void _lock_release() RELEASE(cacheLock_);
+  void reacquireLock() ACQUIRE(cacheLock_);
   // Ends the process unless the calling thread holds the lock: the run-time
   // twin of the REQUIRES below, for builds the analysis never sees (g++).
   void _lock_assertHeld() const ASSERT_CAPABILITY(cacheLock_);
+  // Sleeps, without the lock, until some build ends.
+  void _lock_waitForABuildToEnd() REQUIRES(cacheLock_);
+
+  // The maps of live or transient containers, and the keys of those being
+  // built.
+  std::unordered_map<std::string, ClassMap>& _lock_maps(bool transient) REQUIRES(cacheLock_) {
+    return transient ? transientContainerCache_ : liveContainerCache_;
+  }
+  std::set<std::string>& _lock_building(bool transient) REQUIRES(cacheLock_) {
+    return transient ? transientBuilding_ : liveBuilding_;
+  }
+
+  // Reads the class directory into a new map, without the lock: the
+  // directory is listed, then the metadata files of the entries named like
+  // containers are read and validated on a few threads, and the results are
+  // taken in listing order. Nothing with the listing's error when the
+  // directory cannot be read, or when the process runs out of descriptors
+  // or memory while reading it (a map missing a container would answer "no
+  // such container" for one that exists).
+  std::optional<ClassMap> buildClassMap(const QRVUserIdentityRef& userIdentity, QRVContainerClass contentClass,
+                                        bool transient, const std::string& key, QRVError* error);
 
   // The class's map, built from disk on first use; null with the listing's
   // error when the class directory cannot be read. With
   // `populateSandboxCache`, a map built now has its containers pushed.
-  // The pointer stays valid while the lock is held.
+  // Waits for a build of the same map by another thread; the lock is let go
+  // while waiting and while building. The pointer stays valid while the lock
+  // is held.
   ClassMap* _lock_getCacheForUserIdentity(const QRVUserIdentityRef& userIdentity, QRVContainerClass contentClass,
                                           bool transient, bool populateSandboxCache, QRVError* error)
       REQUIRES(cacheLock_);
+  // The map when it is built, after waiting for a build in progress (which
+  // may have read the disk before the caller's change); never builds.
   ClassMap* _lock_existingCacheForUserIdentity(const QRVUserIdentityRef& userIdentity, QRVContainerClass contentClass,
                                                bool transient) REQUIRES(cacheLock_);
   bool _lock_shouldRegisterSandboxMappingWithUserIdentity(const QRVUserIdentityRef& userIdentity,
@@ -179,4 +219,8 @@ class QRVContainerCache {
   std::atomic<std::thread::id> cacheLockHolder_{};
   std::unordered_map<std::string, ClassMap> liveContainerCache_ GUARDED_BY(cacheLock_);
   std::unordered_map<std::string, ClassMap> transientContainerCache_ GUARDED_BY(cacheLock_);
+  std::set<std::string> liveBuilding_ GUARDED_BY(cacheLock_);
+  std::set<std::string> transientBuilding_ GUARDED_BY(cacheLock_);
+  // Signalled, under the lock, whenever a build ends, well or badly.
+  QRVCondVar buildEnded_;
 };

@@ -5,6 +5,7 @@
 #include "base/QRVLog.h"
 #include "fs/QRVDictionaryAdditions.h"
 #include "fs/QRVFileManager.h"
+#include "fs/QRVOpenDirectory.h"
 #include "model/QRVGlobalConfiguration.h"
 #include "users/QRVUserIdentityCache.h"
 
@@ -193,13 +194,41 @@ QRVMetadataRef QRVMetadata::readAndValidateMetadataAtFileUrl(const std::string& 
                                                              bool checkClassPath, QRVFileManager& fileManager,
                                                              QRVUserIdentityCache& userIdentityCache,
                                                              QRVError* error) {
+  std::vector<uint8_t> bytes;
+  QRVError readError;
+  bool read = fileManager.readRegularFileAtURL(fileURL, kMaximumFileSize, &bytes, &readError);
+  return readAndValidateMetadataAtFileUrl(fileURL, read, bytes, readError, userIdentity, checkClassPath,
+                                          userIdentityCache, error);
+}
+
+QRVMetadataRef QRVMetadata::readAndValidateMetadataBelowDirectory(const QRVOpenDirectory& classDirectory,
+                                                                  const std::string& containerName,
+                                                                  const QRVUserIdentityRef& userIdentity,
+                                                                  bool checkClassPath, QRVFileManager& fileManager,
+                                                                  QRVUserIdentityCache& userIdentityCache,
+                                                                  QRVError* error) {
+  const std::string fileURL = appending(appending(classDirectory.url(), containerName), kFileName);
+  std::vector<uint8_t> bytes;
+  QRVError readError;
+  bool read = fileManager.readRegularFileBelowDirectory(classDirectory, containerName, kFileName, kMaximumFileSize,
+                                                        &bytes, &readError);
+  return readAndValidateMetadataAtFileUrl(fileURL, read, bytes, readError, userIdentity, checkClassPath,
+                                          userIdentityCache, error);
+}
+
+QRVMetadataRef QRVMetadata::readAndValidateMetadataAtFileUrl(const std::string& fileURL, bool read,
+                                                             const std::vector<uint8_t>& bytes,
+                                                             const QRVError& givenReadError,
+                                                             const QRVUserIdentityRef& userIdentity,
+                                                             bool checkClassPath,
+                                                             QRVUserIdentityCache& userIdentityCache,
+                                                             QRVError* error) {
   const std::string directory = directoryOf(fileURL);
 
   // 1. The file, whose root must be a dictionary.
-  std::vector<uint8_t> bytes;
-  QRVError readError;
+  QRVError readError = givenReadError;
   std::optional<QRVPlist> parsed;
-  if (fileManager.readRegularFileAtURL(fileURL, kMaximumFileSize, &bytes, &readError)) {
+  if (read) {
     parsed = QRVPlist::fromBytes(bytes.data(), bytes.size());
     if (!parsed || !parsed->isDictionary()) {
       readError = QRVError::make(QRVError::kGeneralDomain, 2048, __func__, __LINE__, -1,

@@ -17,6 +17,7 @@
 #include <cstdint>
 #include <memory>
 #include <string>
+#include <vector>
 
 #include "base/QRVError.h"
 #include "base/QRVPlist.h"
@@ -26,6 +27,7 @@
 #include "model/QRVUserIdentity.h"
 
 class QRVFileManager;
+class QRVOpenDirectory;
 class QRVGlobalConfiguration;
 class QRVUserIdentityCache;
 class QRVMetadata;
@@ -90,6 +92,17 @@ class QRVMetadata {
                                                          QRVFileManager& fileManager,
                                                          QRVUserIdentityCache& userIdentityCache, QRVError* error);
 
+  // The same for the container directory `containerName` of an open class
+  // directory, its file read below the descriptor without following a link
+  // (QRVFileManager::readRegularFileBelowDirectory): the checks, errors and
+  // log lines of readAndValidateMetadataAtUrl on the same directory.
+  static QRVMetadataRef readAndValidateMetadataBelowDirectory(const QRVOpenDirectory& classDirectory,
+                                                              const std::string& containerName,
+                                                              const QRVUserIdentityRef& userIdentity,
+                                                              bool checkClassPath, QRVFileManager& fileManager,
+                                                              QRVUserIdentityCache& userIdentityCache,
+                                                              QRVError* error);
+
   // The uid an older file's "QRVMetadataPersona" value stands for: 499 is
   // read as uid 0, deliberately, so that such files read as they always did.
   static uint64_t _uidForLegacyPersonaValue(uint64_t value) { return value == 499 ? 0 : value; }
@@ -129,6 +142,14 @@ class QRVMetadata {
   QRVMetadata() = default;
   template <typename Change>
   QRVMetadataRef copyWith(Change change) const;
+  // The validation of the readers, given what reading `fileURL` gave: the
+  // bytes when `read`, otherwise the read's error. Named like the reader so
+  // that its errors and log lines name the function they always named,
+  // whichever way the file was read.
+  static QRVMetadataRef readAndValidateMetadataAtFileUrl(const std::string& fileURL, bool read,
+                                                         const std::vector<uint8_t>& bytes, const QRVError& readError,
+                                                         const QRVUserIdentityRef& userIdentity, bool checkClassPath,
+                                                         QRVUserIdentityCache& userIdentityCache, QRVError* error);
 
   bool transient_ = false;
   bool existed_ = false;

@@ -8,6 +8,9 @@
 //   path it names (either path of a rename; for a call on a descriptor, the
 //   path that descriptor was opened with through this wrapper). failNext() is
 //   the common case: the next matching call fails once.
+// - setHook(op, hook) runs `hook(path)` at every call of kind `op`, before
+//   it goes on, without the wrapper's lock: a test can make one call wait
+//   on a latch to hold an operation halfway while it looks at the others.
 // - calls(op) counts the calls of a kind that reached the wrapper, failed
 //   ones included.
 // - setRecordOwnership(true) turns ownership changes into bookkeeping, so
@@ -24,6 +27,7 @@
 #include <fcntl.h>
 
 #include <cerrno>
+#include <functional>
 #include <map>
 #include <memory>
 #include <mutex>
@@ -37,6 +41,7 @@ class QRVFaultInjectionFileSystem : public QRVFileSystem {
  public:
   enum class Operation {
     kOpen,
+    kOpenResolved,
     kClose,
     kMakeDirectory,
     kMakeTemporaryDirectory,
@@ -76,6 +81,15 @@ class QRVFaultInjectionFileSystem : public QRVFileSystem {
     std::lock_guard<std::mutex> l(m_);
     faults_.clear();
   }
+  using Hook = std::function<void(const std::string& path)>;
+  // An empty hook removes the one of that kind.
+  void setHook(Operation op, Hook hook) {
+    std::lock_guard<std::mutex> l(m_);
+    if (hook)
+      hooks_[op] = std::make_shared<const Hook>(std::move(hook));
+    else
+      hooks_.erase(op);
+  }
   int calls(Operation op) {
     std::lock_guard<std::mutex> l(m_);
     return calls_[op];
@@ -108,6 +122,12 @@ class QRVFaultInjectionFileSystem : public QRVFileSystem {
   int open(int directoryFD, const std::string& path, int flags, mode_t mode, int* fd) override {
     if (int e = enter(Operation::kOpen, path)) return e;
     int e = target_->open(directoryFD, path, flags, mode, fd);
+    if (!e) remember(*fd, path);
+    return e;
+  }
+  int openResolved(int directoryFD, const std::string& path, int flags, uint64_t resolve, int* fd) override {
+    if (int e = enter(Operation::kOpenResolved, path)) return e;
+    int e = target_->openResolved(directoryFD, path, flags, resolve, fd);
     if (!e) remember(*fd, path);
     return e;
   }
@@ -214,8 +234,10 @@ class QRVFaultInjectionFileSystem : public QRVFileSystem {
     Fault fault;
   };
 
-  // Counts the call and returns the injected failure, if one is due.
+  // Runs the hook of `op`, then counts the call and returns the injected
+  // failure, if one is due.
   int enter(Operation op, const std::string& path, const std::string& otherPath = "") {
+    if (std::shared_ptr<const Hook> hook = hookFor(op)) (*hook)(path);
     std::lock_guard<std::mutex> l(m_);
     calls_[op]++;
     if (tracing_) trace_.push_back({op, path, otherPath});
@@ -231,6 +253,11 @@ class QRVFaultInjectionFileSystem : public QRVFileSystem {
       return e;
     }
     return 0;
+  }
+  std::shared_ptr<const Hook> hookFor(Operation op) {
+    std::lock_guard<std::mutex> l(m_);
+    auto it = hooks_.find(op);
+    return it == hooks_.end() ? nullptr : it->second;
   }
   void remember(int fd, const std::string& path) {
     std::lock_guard<std::mutex> l(m_);
@@ -266,6 +293,7 @@ class QRVFaultInjectionFileSystem : public QRVFileSystem {
   std::mutex m_;
   std::vector<PendingFault> faults_;
   std::map<Operation, int> calls_;
+  std::map<Operation, std::shared_ptr<const Hook>> hooks_;
   std::map<int, std::string> paths_;  // open descriptors -> the path they were opened with
   bool recordOwnership_ = false;
   bool tracing_ = false;

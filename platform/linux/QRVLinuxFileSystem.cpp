@@ -3,8 +3,10 @@
 #include <dirent.h>
 #include <fcntl.h>
 #include <limits.h>
+#include <linux/openat2.h>
 #include <stdio.h>
 #include <stdlib.h>
+#include <sys/syscall.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -25,6 +27,24 @@ int QRVLinuxFileSystem::open(int directoryFD, const std::string& path, int flags
   if (opened < 0) return errno;
   *fd = opened;
   return 0;
+}
+
+int QRVLinuxFileSystem::openResolved(int directoryFD, const std::string& path, int flags, uint64_t resolve, int* fd) {
+#ifdef SYS_openat2
+  struct open_how how = {};
+  how.flags = static_cast<uint64_t>(flags);
+  how.resolve = resolve;
+  long opened;
+  do {
+    opened = ::syscall(SYS_openat2, directoryFD, path.c_str(), &how, sizeof how);
+  } while (opened < 0 && errno == EINTR);
+  if (opened < 0) return errno;
+  *fd = static_cast<int>(opened);
+  return 0;
+#else
+  (void)directoryFD, (void)path, (void)flags, (void)resolve, (void)fd;
+  return ENOSYS;
+#endif
 }
 
 // Linux releases the descriptor even when close fails (EINTR included), so

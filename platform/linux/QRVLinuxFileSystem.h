@@ -7,6 +7,7 @@
 class QRVLinuxFileSystem : public QRVFileSystem {
  public:
   int open(int directoryFD, const std::string& path, int flags, mode_t mode, int* fd) override;
+  int openResolved(int directoryFD, const std::string& path, int flags, uint64_t resolve, int* fd) override;
   int close(int fd) override;
   int makeDirectory(int directoryFD, const std::string& path, mode_t mode) override;
   int makeTemporaryDirectory(std::string* pathTemplate) override;

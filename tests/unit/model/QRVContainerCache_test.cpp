@@ -3,9 +3,13 @@
 #include <gtest/gtest.h>
 #include <unistd.h>
 
+#include <sys/stat.h>
+
 #include <cerrno>
+#include <chrono>
 #include <filesystem>
 #include <fstream>
+#include <future>
 #include <map>
 #include <set>
 #include <stdexcept>
@@ -19,6 +23,7 @@ namespace {
 namespace fs = std::filesystem;
 constexpr QRVContainerClass kData = QRVContainerClassAppData;
 using Item = QRVSandboxUserStateItem;
+using Op = QRVFaultInjectionFileSystem::Operation;
 
 class FakeParents : public QRVPluginParentResolver {
  public:
@@ -233,6 +238,157 @@ TEST_F(ContainerCacheTest, WellKnownNamesCountForSystemClassesOnly) {
   // A system name is not a group name, and data classes know no names.
   EXPECT_FALSE(cache->containerURL("/x/" + name, QRVContainerClassSystemGroup));
   EXPECT_EQ(lookupCode(*cache, alice_, name), 21u);
+}
+
+// Many containers, so that the build reads on several threads, among every
+// kind of entry a user can plant: the map holds exactly what reading each
+// entry on its own, by path, accepts.
+TEST_F(ContainerCacheTest, AParallelBuildAcceptsWhatReadingEachEntryByPathAccepts) {
+  const std::string dir = classDirectory(alice_, kData);
+  for (int i = 0; i < 300; i++) makeContainer(alice_, kData, "com.example." + std::to_string(i));
+  auto planted = [&](const std::string& what) {
+    std::string path = dir + "/" + QRVUUID::random().string();
+    fs::create_directory(path);
+    return path + "/" + (what.empty() ? QRVMetadata::kFileName : what);
+  };
+  std::string outside = env_.root.path() + "/outside";
+  fs::create_directories(outside);
+  auto elsewhere = makeContainer(alice_, kData, "com.example.linked");
+  fs::rename(elsewhere->url(), outside + "/c");
+  for (int i = 0; i < 20; i++) {
+    // A link in the container's place, and one in the metadata file's.
+    fs::create_directory_symlink(outside + "/c", dir + "/" + QRVUUID::random().string());
+    fs::create_symlink(outside + "/c/" + QRVMetadata::kFileName, planted(""));
+    std::ofstream(planted("")) << "bplist00 garbage";   // corrupt
+    std::ofstream(planted("")) << "<plist><array/></plist>";  // not a dictionary
+    fs::create_directory(planted(""));                   // a directory
+    ASSERT_EQ(mkfifo(planted("").c_str(), 0600), 0);     // a fifo, never blocked on
+    planted("other-name");                               // no metadata at all
+    std::ofstream(dir + "/" + QRVUUID::random().string()) << "a file";
+    makeContainer(alice_, kData, "com.example.junk" + std::to_string(i), false, std::nullopt, "Junk" + std::to_string(i));
+  }
+  // The same identifier twice: the last listed wins, as before.
+  makeContainer(alice_, kData, "com.example.7", false, QRVUUID::fromString("00000000-0000-4000-8000-000000000001"));
+  makeContainer(alice_, kData, "com.example.7", false, QRVUUID::fromString("FFFFFFFF-FFFF-4FFF-8FFF-FFFFFFFFFFFF"));
+
+  // The model: every listed entry read alone, by path, in listing order.
+  std::map<std::string, QRVMetadataRef> expected;
+  QRVError error;
+  auto cache = makeCache();
+  auto listed = fm().urlsForItemsInDirectoryAtURL(dir, &error);
+  ASSERT_TRUE(listed) << error.description();
+  for (const std::string& url : *listed) {
+    if (!cache->containerURL(url, kData)) continue;
+    if (auto m = QRVMetadata::readAndValidateMetadataAtUrl(url, alice_, true, fm(), identities(), nullptr))
+      expected[m->identifier()] = m;
+  }
+  ASSERT_EQ(expected.size(), 300u);
+  const int opensBefore = env_.posixFileSystem->calls(Op::kOpenResolved);
+  auto all = cache->allContainersForUserIdentity(alice_, kData, false, &error);
+  ASSERT_TRUE(all) << error.description();
+  ASSERT_EQ(all->size(), expected.size());
+  for (const QRVMetadataRef& m : *all) {
+    const QRVMetadataRef& e = expected[m->identifier()];
+    ASSERT_TRUE(e) << m->identifier();
+    EXPECT_EQ(m->url(), e->url());
+    EXPECT_EQ(m->uuid(), e->uuid());
+    EXPECT_EQ(m->plist(), e->plist());
+    EXPECT_TRUE(m->userIdentity()->isEqualToUserIdentity(*e->userIdentity()));
+  }
+  EXPECT_EQ(lookup(*cache, alice_, "com.example.7", kData, &error)->uuid().string(),
+            "FFFFFFFF-FFFF-4FFF-8FFF-FFFFFFFFFFFF");
+  // One open per good container, below the class directory.
+  EXPECT_GE(env_.posixFileSystem->calls(Op::kOpenResolved) - opensBefore, 300);
+  // Nothing outside the tree was changed.
+  EXPECT_TRUE(fs::exists(outside + "/c/" + QRVMetadata::kFileName));
+}
+
+TEST_F(ContainerCacheTest, ABuildOutOfDescriptorsMidwayPublishesNothingAndTheNextLookupBuildsAgain) {
+  for (int i = 0; i < 100; i++) makeContainer(alice_, kData, "com.example." + std::to_string(i));
+  auto cache = makeCache();
+  env_.posixFileSystem->inject(Op::kOpenResolved, {EMFILE, 60, 1, QRVMetadata::kFileName});
+  QRVError error;
+  EXPECT_EQ(lookup(*cache, alice_, "com.example.1", kData, &error), nullptr);
+  EXPECT_EQ(error.code(), 43u);
+  // Nothing half-read was kept: the next lookup reads every container.
+  const int opens = env_.posixFileSystem->calls(Op::kOpenResolved);
+  EXPECT_EQ(lookupCode(*cache, alice_, "com.example.99"), 0u);
+  EXPECT_EQ(env_.posixFileSystem->calls(Op::kOpenResolved) - opens, 100);
+  EXPECT_EQ(allURLs(*cache, alice_).size(), 100u);
+
+  // Any other failure of the one open is asked again one component at a
+  // time, and only that container is left out, as a read by path would.
+  auto other = makeCache();
+  env_.posixFileSystem->inject(Op::kOpenResolved, {ENOSYS, 1, QRVFaultInjectionFileSystem::kForever, ""});
+  EXPECT_EQ(allURLs(*other, alice_).size(), 100u);
+  env_.posixFileSystem->clearFaults();
+}
+
+// A build holds no lock while it reads. Alice's build is held with every
+// metadata read stopped but that of "removed", listed first, whose file is
+// open by then: another class is served meanwhile, and a removal of
+// "removed" and an addition made after the listing wait for the build and
+// are applied to the map it publishes, neither lost nor undone.
+TEST_F(ContainerCacheTest, ABuildInProgressBlocksOnlyItsOwnClassAndLosesNoChange) {
+  auto removed = makeContainer(alice_, kData, "com.example.removed", false,
+                               QRVUUID::fromString("00000000-0000-4000-8000-000000000000"));
+  for (int i = 0; i < 50; i++) makeContainer(alice_, kData, "com.example." + std::to_string(i));
+  makeContainer(bob_, kData, "com.example.bob");
+  auto cache = makeCache();
+  // Bob's map first, so that the hooks stop alice's build only.
+  ASSERT_EQ(lookupCode(*cache, bob_, "com.example.bob"), 0u);
+
+  std::promise<void> reached, release;
+  std::shared_future<void> released = release.get_future().share();
+  std::atomic<bool> first{true};
+  const std::string removedName = removed->uuid().string();
+  env_.posixFileSystem->setHook(Op::kOpenResolved, [&](const std::string& path) {
+    if (path.find(removedName) == std::string::npos) released.wait();
+  });
+  env_.posixFileSystem->setHook(Op::kRead, [&](const std::string& path) {
+    if (path.find(removedName) != std::string::npos && first.exchange(false)) reached.set_value();
+  });
+
+  auto building = std::async(std::launch::async, [&] { return lookupCode(*cache, alice_, "com.example.1"); });
+  if (reached.get_future().wait_for(std::chrono::seconds(30)) != std::future_status::ready) {
+    release.set_value();
+    FAIL() << "alice's build never read the first container";
+  }
+  // Served while alice's build is stopped.
+  auto other = std::async(std::launch::async, [&] {
+    return lookupCode(*cache, bob_, "com.example.bob") + lookupCode(*cache, system_, "x", QRVContainerClassSystemData);
+  });
+  bool served = other.wait_for(std::chrono::seconds(30)) == std::future_status::ready;
+  EXPECT_TRUE(served) << "another class waited for alice's build";
+
+  // A deletion and a creation after the build listed the directory.
+  fs::remove_all(removed->url());
+  auto added = makeContainer(alice_, kData, "com.example.added");
+  auto removal = std::async(std::launch::async, [&] {
+    QRVError error;
+    return cache->removeContainerForUserIdentity(alice_, kData, "com.example.removed", false, &error);
+  });
+  auto addition = std::async(std::launch::async, [&] {
+    QRVError error;
+    return cache->addContainerMetadata(added, added->url(), /*transient=*/false, /*updateSandbox=*/false, &error);
+  });
+  // Both have had time to reach the cache; a wrong cache applies them now,
+  // under the build.
+  EXPECT_EQ(removal.wait_for(std::chrono::milliseconds(200)), std::future_status::timeout);
+  release.set_value();
+  EXPECT_EQ(building.get(), 0u);
+  EXPECT_TRUE(removal.get());
+  EXPECT_TRUE(addition.get());
+  // Bob's container is found (0); the system class has no "x" (21).
+  if (served) {
+    EXPECT_EQ(other.get(), 21u);
+  }
+  env_.posixFileSystem->setHook(Op::kOpenResolved, nullptr);
+  env_.posixFileSystem->setHook(Op::kRead, nullptr);
+
+  EXPECT_EQ(lookupCode(*cache, alice_, "com.example.removed"), 21u);
+  EXPECT_EQ(lookupCode(*cache, alice_, "com.example.added"), 0u);
+  EXPECT_EQ(allURLs(*cache, alice_).size(), 51u);
 }
 
 // ---- Changes ----

@@ -6,6 +6,7 @@
 #include <dirent.h>
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <linux/openat2.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -96,6 +97,24 @@ TEST_P(FileSystemConformanceTest, CallsReturnTheErrnoAndNeverFollowALinkUnasked)
   EXPECT_EQ(f.unlink(dir, "moved", AT_REMOVEDIR), ENOTDIR);
   EXPECT_EQ(f.unlink(dir, "moved", 0), 0);
   EXPECT_EQ(f.unlink(AT_FDCWD, at("d"), AT_REMOVEDIR), ENOTEMPTY);
+
+  // Several components below the directory in one call, refusing a link in
+  // any of them and any way out of it.
+  constexpr uint64_t kBelow = RESOLVE_BENEATH | RESOLVE_NO_SYMLINKS;
+  ASSERT_EQ(f.makeDirectory(dir, "sub", 0700), 0);
+  ASSERT_EQ(f.open(dir, "sub/inner", O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0600, &fd), 0);
+  f.close(fd);
+  ASSERT_EQ(symlink("sub", at("d/sublink").c_str()), 0);
+  ASSERT_EQ(symlink("inner", at("d/sub/innerlink").c_str()), 0);
+  int e = f.openResolved(dir, "sub/inner", O_RDONLY | O_CLOEXEC, kBelow, &fd);
+  if (e != ENOSYS) {
+    ASSERT_EQ(e, 0);
+    f.close(fd);
+    EXPECT_EQ(f.openResolved(dir, "sublink/inner", O_RDONLY | O_CLOEXEC, kBelow, &fd), ELOOP);
+    EXPECT_EQ(f.openResolved(dir, "sub/innerlink", O_RDONLY | O_CLOEXEC, kBelow, &fd), ELOOP);
+    EXPECT_EQ(f.openResolved(dir, "../d/sub/inner", O_RDONLY | O_CLOEXEC, kBelow, &fd), EXDEV);
+    EXPECT_EQ(f.openResolved(dir, "sub/none", O_RDONLY | O_CLOEXEC, kBelow, &fd), ENOENT);
+  }
   f.close(dir);
 
   // Temporary names are unique and made private.
