@@ -242,8 +242,18 @@ QRVMetadataRef QRVContainerCache::containerForContainerIdentity(const QRVContain
 QRVMetadataRef QRVContainerCache::containerForContainerIdentity(const QRVContainerIdentity& containerIdentity,
                                                                 bool transient, bool updateSandbox, QRVError* error) {
   try {
+    QRVMetadataRef metadata;
+    {
+      Locker lock(*this);
+      metadata = _lock_containerForContainerIdentity(containerIdentity, transient, updateSandbox, error);
+    }
+    if (!metadata) return nullptr;
+    // The disk is the truth: a container whose metadata file has gone is not
+    // handed out. The check is a system call, made without the lock, which
+    // every look-up of every class would otherwise queue behind.
+    const bool present = fileManager_->itemExistsAtURL(metadata->metadataFileURL());
     Locker lock(*this);
-    return _lock_containerForContainerIdentity(containerIdentity, transient, updateSandbox, error);
+    return _lock_confirmContainer(containerIdentity, metadata, present, transient, updateSandbox, error);
   } catch (...) {
     // The lock is released by now. On an internal build the crash report is
     // worth more than the request.
@@ -295,17 +305,34 @@ QRVMetadataRef QRVContainerCache::_lock_containerForContainerIdentity(const QRVC
             QRV_ERROR(QRVResultCode::kCacheInvalidURL, "Cache: {}{}: Invalid URL path string: {}", key, suffix, url));
     return nullptr;
   }
-  const std::string metadataFile = metadata->metadataFileURL();
-  if (!fileManager_->itemExistsAtURL(metadataFile)) {
+  return metadata;
+}
+
+QRVMetadataRef QRVContainerCache::_lock_confirmContainer(const QRVContainerIdentity& containerIdentity,
+                                                         const QRVMetadataRef& metadata, bool present, bool transient,
+                                                         bool updateSandbox, QRVError* error) {
+  const QRVUserIdentityRef& userIdentity = containerIdentity.userIdentity();
+  const QRVContainerClass contentClass = containerIdentity.containerClass();
+  const std::string& identifier = containerIdentity.identifier();
+  const std::string key = cacheKey(userIdentity, contentClass);
+  const char* suffix = transientSuffix(transient);
+  // The entry may have changed while the lock was let go; only the entry
+  // that was found is dropped or registered.
+  ClassMap* map = _lock_existingCacheForUserIdentity(userIdentity, contentClass, transient);
+  auto it = map ? map->find(identifier) : ClassMap::iterator();
+  const bool current = map && it != map->end() && it->second.metadata == metadata;
+  if (!present) {
     QRVFail(error, QRV_ERROR(QRVResultCode::kCacheInconsistent,
                              "Cache: {}{}: INCONSISTENT-No Metadata at: {} for id: {}, class: {}", key, suffix,
-                             metadataFile, identifier, contentClass));
-    // The disk is the truth: the next request rebuilds from it.
-    map->erase(it);
-    QRVLogDebug("Cache: {}{}: Removed Identifier: {}", key, suffix, identifier);
+                             metadata->metadataFileURL(), identifier, contentClass));
+    // The next request rebuilds from the disk.
+    if (current) {
+      map->erase(it);
+      QRVLogDebug("Cache: {}{}: Removed Identifier: {}", key, suffix, identifier);
+    }
     return nullptr;
   }
-  if (updateSandbox) _lock_registerWithSandboxIfNeeded(&it->second, userIdentity, contentClass);
+  if (updateSandbox && current) _lock_registerWithSandboxIfNeeded(&it->second, userIdentity, contentClass);
   QRVLogDebug("Cache: {}{}: Found Identifier: {}", key, suffix, identifier);
   return metadata;
 }

@@ -19,7 +19,8 @@
 // waits for the build to end and then goes on as usual, so that an addition
 // or removal made while the disk was being read is applied to the map that
 // was read, never lost under it. A failed build publishes nothing, and the
-// next operation on that class builds again.
+// next operation on that class builds again. A look-up's check that the
+// container's metadata file is still on disk is made without the lock too.
 // While the lock is held the cache calls the user identity cache, the seams
 // and the sandbox facility, none of which may call back into it; the build
 // calls the user identity cache and the seams from several threads. Callers
@@ -204,8 +205,18 @@ class QRVContainerCache {
   // taken before, and pushes the mapping when it says so.
   void _lock_registerWithSandboxIfNeeded(Entry* entry, const QRVUserIdentityRef& userIdentity,
                                          QRVContainerClass containerClass) REQUIRES(cacheLock_);
+  // The entry of `containerIdentity`, its URL checked, or null with the
+  // error; the metadata file's presence is checked by the caller, without
+  // the lock, and handed to _lock_confirmContainer.
   QRVMetadataRef _lock_containerForContainerIdentity(const QRVContainerIdentity& containerIdentity, bool transient,
                                                      bool updateSandbox, QRVError* error) REQUIRES(cacheLock_);
+  // Finishes a look-up: a container whose metadata file is not `present`
+  // fails with 44 and its entry is dropped; otherwise it is registered with
+  // the sandbox facility when asked. Either only while the entry still holds
+  // `metadata`.
+  QRVMetadataRef _lock_confirmContainer(const QRVContainerIdentity& containerIdentity, const QRVMetadataRef& metadata,
+                                        bool present, bool transient, bool updateSandbox, QRVError* error)
+      REQUIRES(cacheLock_);
 
   const std::shared_ptr<QRVFileManager> fileManager_;
   const std::shared_ptr<QRVGlobalConfiguration> globalConfiguration_;

@@ -172,6 +172,50 @@ TEST_F(ContainerCacheTest, AVanishedMetadataFileIs44ThenNotFound) {
   EXPECT_EQ(lookupCode(*cache, alice_, "com.example.a"), 0u);
 }
 
+// A look-up checks that the metadata file is still there without the lock:
+// another look-up is answered meanwhile, and an entry replaced meanwhile is
+// not dropped for the old container's missing file.
+TEST_F(ContainerCacheTest, TheMetadataFileCheckHoldsNoLock) {
+  auto a = makeContainer(alice_, kData, "com.example.a");
+  makeContainer(bob_, kData, "com.example.bob");
+  auto cache = makeCache();
+  ASSERT_EQ(lookupCode(*cache, alice_, "com.example.a"), 0u);
+  ASSERT_EQ(lookupCode(*cache, bob_, "com.example.bob"), 0u);
+
+  std::promise<void> reached, release;
+  std::shared_future<void> released = release.get_future().share();
+  std::atomic<bool> first{true};
+  env_.posixFileSystem->setHook(Op::kStatus, [&](const std::string& path) {
+    if (path != a->metadataFileURL() || !first.exchange(false)) return;
+    reached.set_value();
+    released.wait();
+  });
+  auto stopped = std::async(std::launch::async, [&] { return lookupCode(*cache, alice_, "com.example.a"); });
+  if (reached.get_future().wait_for(std::chrono::seconds(30)) != std::future_status::ready) {
+    release.set_value();
+    FAIL() << "the look-up never checked the metadata file";
+  }
+  auto other = std::async(std::launch::async, [&] { return lookupCode(*cache, bob_, "com.example.bob"); });
+  const bool served = other.wait_for(std::chrono::seconds(30)) == std::future_status::ready;
+  EXPECT_TRUE(served) << "a look-up waited for another one's file check";
+  if (served) {
+    auto b = makeContainer(alice_, kData, "com.example.a");
+    QRVError error;
+    ASSERT_TRUE(cache->addContainerMetadata(b, b->url(), /*transient=*/false, /*updateSandbox=*/false, &error));
+    ASSERT_TRUE(fs::remove(a->metadataFileURL()));
+  }
+  release.set_value();
+  EXPECT_EQ(stopped.get(), served ? 44u : 0u);
+  env_.posixFileSystem->setHook(Op::kStatus, nullptr);
+  if (served) {
+    EXPECT_EQ(other.get(), 0u);
+    QRVError error;
+    auto found = lookup(*cache, alice_, "com.example.a", kData, &error);
+    ASSERT_NE(found, nullptr) << error.description();
+    EXPECT_NE(found->url(), a->url());
+  }
+}
+
 TEST_F(ContainerCacheTest, TransientAndLiveContainersAreIndexedApart) {
   auto live = makeContainer(alice_, kData, "com.example.a");
   auto temporary = makeContainer(alice_, kData, "com.example.a", true);
