@@ -232,13 +232,15 @@ class QRVLinuxMessageService::Connection : public QRVConnection {
     }
     // The first bytes after a complete frame start the next one.
     if (in_.empty()) frameStarted_ = nowMillis();
-    size_t old = in_.size();
-    in_.resize(old + kReadChunk);
+    // Received on the stack and appended: growing the buffer by a chunk
+    // first would zero 64 KiB for every read, most of which find a small
+    // frame or nothing at all.
+    uint8_t chunk[kReadChunk];
     ssize_t n;
     do {
-      n = recv(fd, in_.data() + old, kReadChunk, 0);
+      n = recv(fd, chunk, sizeof chunk, 0);
     } while (n < 0 && errno == EINTR);
-    in_.resize(old + (n > 0 ? static_cast<size_t>(n) : 0));
+    if (n > 0) in_.insert(in_.end(), chunk, chunk + n);
     if (n == 0) {
       peerEOF_ = true;
       return false;
