@@ -35,10 +35,12 @@ std::optional<QRVPeerProcessState> QRVPeerProcess::state() {
   struct stat exe;
   if (fstatat(procFD_, "exe", &exe, 0) != 0) return std::nullopt;
   if (!confined_) {
-    // A proc file read from offset 0 is generated afresh.
-    char buffer[4096];
-    ssize_t n = pread(statusFD_, buffer, sizeof buffer - 1, 0);
-    if (n <= 0) return std::nullopt;
+    // A proc file read from offset 0 is generated afresh. One that fills
+    // the buffer (a process in thousands of groups) may have the lines that
+    // matter cut off: then the state is not known.
+    char buffer[8192];
+    ssize_t n = pread(statusFD_, buffer, sizeof buffer, 0);
+    if (n <= 0 || static_cast<size_t>(n) == sizeof buffer) return std::nullopt;
     confined_ = QRVProcInfo::statusShowsConfinement(std::string_view(buffer, static_cast<size_t>(n)));
   }
   return QRVPeerProcessState{static_cast<uint64_t>(exe.st_dev), static_cast<uint64_t>(exe.st_ino), confined_};
