@@ -34,22 +34,25 @@ std::string selfExecutable() {
   return n > 0 ? std::string(buf, static_cast<size_t>(n)) : std::string();
 }
 
-// The addresses of the identities logged for `identifier`, one per request.
-std::vector<std::string> loggedIdentities(const std::string& log, const std::string& identifier) {
+// One capture per identity logged for `identifier` (one per request):
+// `field` is a pattern with one group, matched after the identity's opening.
+std::vector<std::string> loggedIdentityField(const std::string& log, const std::string& identifier,
+                                             const std::string& field) {
   std::vector<std::string> out;
-  std::regex line("\\[" + identifier + "\\] Relay client identity: <QRVClientIdentity: (0x[0-9a-f]+);");
+  std::regex line("\\[" + identifier + "\\] Relay client identity: <QRVClientIdentity: " + field);
   for (auto it = std::sregex_iterator(log.begin(), log.end(), line); it != std::sregex_iterator(); ++it)
     out.push_back((*it)[1]);
   return out;
 }
 
+// The addresses of the identities logged for `identifier`.
+std::vector<std::string> loggedIdentities(const std::string& log, const std::string& identifier) {
+  return loggedIdentityField(log, identifier, "(0x[0-9a-f]+);");
+}
+
 // The "isSandboxed" field of each identity logged for `identifier`.
 std::vector<std::string> loggedSandboxFlags(const std::string& log, const std::string& identifier) {
-  std::vector<std::string> out;
-  std::regex line("\\[" + identifier + "\\] Relay client identity: <QRVClientIdentity: [^\n]*isSandboxed = ([01])");
-  for (auto it = std::sregex_iterator(log.begin(), log.end(), line); it != std::sregex_iterator(); ++it)
-    out.push_back((*it)[1]);
-  return out;
+  return loggedIdentityField(log, identifier, "[^\n]*isSandboxed = ([01])");
 }
 
 // A peer process that connects to the daemon under `uid` and then runs
