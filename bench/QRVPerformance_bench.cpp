@@ -16,9 +16,14 @@
 //    and connection; raw: the same server, kDaemonWorkerThreads workers on
 //    one epoll set, each connection owned by one worker at a time (as the
 //    daemon's message service serves them).
+//  - the look-up rows again against the same server doing, per request, what
+//    a look-up must do beyond that (re-reading the peer, the metadata file's
+//    stat, a sealed sandbox token), with the daemon's own platform code: the
+//    daemon's cost over this is its own overhead.
 //  - durable creations per second: new containers through the daemon; raw:
 //    the directories, files, fsyncs and renames the daemon makes for one
-//    creation, as system calls on the same file system.
+//    creation, as system calls on the same file system; and again with the
+//    daemon's own, safer, sequence of system calls.
 //  - first answer after a start on a root of kStartContainers containers of
 //    one class: from spawn to the first answered look-up (which builds the
 //    class map), warm and cold page cache; raw: reading and decoding every
@@ -49,6 +54,7 @@
 #include <sys/prctl.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <sys/sysinfo.h>
 #include <sys/un.h>
 #include <sys/utsname.h>
@@ -64,6 +70,7 @@
 #include <functional>
 #include <memory>
 #include <mutex>
+#include <optional>
 #include <stdexcept>
 #include <string>
 #include <thread>
@@ -76,6 +83,8 @@
 #include "base/QRVWireFrame.h"
 #include "client/QRVContainerClient.h"
 #include "integration/QRVDaemonProcess.h"
+#include "platform/linux/QRVLinuxSandbox.h"
+#include "platform/linux/QRVPeerProcess.h"
 
 namespace {
 
@@ -303,10 +312,28 @@ QRVContainerResult call(QRVContainerClient& client, const QRVPlist& request) {
 // the encoding and sending of a stored reply. kDaemonWorkerThreads workers
 // share one epoll set; a connection is armed one-shot, so one worker at a
 // time reads it and answers on its own thread, as in the daemon.
+//
+// With `checks`, each request also pays what a look-up must do beyond that,
+// with the daemon's own platform code: the peer re-read on the descriptors
+// kept since accept (a peer may exec or enter a sandbox between requests),
+// the stat of the container's metadata file (a container removed behind the
+// daemon's back is not handed out), and a freshly sealed sandbox token in
+// the reply. The daemon's cost over this server is its own overhead.
 class RawLookupServer {
  public:
-  RawLookupServer(std::string path, std::unordered_map<std::string, QRVPlist> replies)
+  struct Checks {
+    std::string keyPath;  // the sealing key of the server's own tokens
+  };
+
+  RawLookupServer(std::string path, std::unordered_map<std::string, QRVPlist> replies,
+                  std::optional<Checks> checks = std::nullopt)
       : path_(std::move(path)), replies_(std::move(replies)) {
+    if (checks) {
+      sandbox_ = std::make_unique<QRVLinuxSandbox>(QRVLinuxSandbox::Options{
+          .keyPath = checks->keyPath, .registryPath = checks->keyPath + ".registry", .registryQueue = nullptr});
+      for (const auto& [identifier, reply] : replies_)
+        metadataPaths_[identifier] = reply.stringForKey("ReplyPath") + "/" + kMetadataFileName;
+    }
     sockaddr_un address{};
     address.sun_family = AF_UNIX;
     snprintf(address.sun_path, sizeof address.sun_path, "%s", path_.c_str());
@@ -339,6 +366,8 @@ class RawLookupServer {
   struct Connection {
     int fd;
     std::vector<uint8_t> in;
+    std::unique_ptr<QRVPeerProcess> peer;  // with checks
+    QRVAuditToken token;
   };
 
   void watch(int fd, void* tag, int op, uint32_t events) {
@@ -372,7 +401,15 @@ class RawLookupServer {
     for (;;) {
       int fd = accept4(listenFd_, nullptr, nullptr, SOCK_NONBLOCK | SOCK_CLOEXEC);
       if (fd < 0) break;
-      auto c = std::make_unique<Connection>(Connection{fd, {}});
+      auto c = std::make_unique<Connection>(Connection{fd, {}, nullptr, {}});
+      if (sandbox_) {
+        ucred cred{};
+        socklen_t length = sizeof cred;
+        if (getsockopt(fd, SOL_SOCKET, SO_PEERCRED, &cred, &length) != 0) fail("raw server: SO_PEERCRED");
+        int pidfd = static_cast<int>(syscall(SYS_pidfd_open, cred.pid, 0));
+        c->peer = std::make_unique<QRVPeerProcess>(cred.pid, pidfd);
+        c->token = QRVAuditToken::make(cred.uid, cred.gid, cred.pid, 0);
+      }
       Connection* raw = c.get();
       {
         std::lock_guard<std::mutex> lock(mutex_);
@@ -405,16 +442,30 @@ class RawLookupServer {
         if (c->in.size() - offset < QRVWireFrame::kHeaderSize + h.length) break;
         auto body = QRVWireFrame::decodeBody(c->in.data() + offset + QRVWireFrame::kHeaderSize, h.length);
         offset += QRVWireFrame::kHeaderSize + h.length;
-        if (!body || !answer(c->fd, *body, h.messageId)) return false;
+        if (!body || !answer(*c, *body, h.messageId)) return false;
       }
       c->in.erase(c->in.begin(), c->in.begin() + static_cast<ptrdiff_t>(offset));
     }
   }
 
-  bool answer(int fd, const QRVPlist& request, uint64_t messageId) {
+  bool answer(Connection& c, const QRVPlist& request, uint64_t messageId) {
+    const int fd = c.fd;
     auto it = replies_.find(request.stringForKey("Identifier"));
     QRVPlist notFound = QRVPlist::dictionary().set("ReplyError", QRVPlist::uinteger(21));
-    std::vector<uint8_t> frame = QRVWireFrame::encode(it == replies_.end() ? notFound : it->second, 0, messageId);
+    std::vector<uint8_t> frame;
+    if (it != replies_.end() && sandbox_) {
+      if (!c.peer->state()) return false;
+      struct stat st;
+      if (stat(metadataPaths_.at(it->first).c_str(), &st) != 0) fail("raw server: the metadata file has gone");
+      QRVPlist reply = it->second;
+      auto token = sandbox_->issueExtension("com.kelva.sandbox.container", reply.stringForKey("ReplyPath"),
+                                            c.token, nullptr);
+      if (!token) fail("raw server: no sandbox token");
+      reply.set("SandboxToken", QRVPlist::string(std::move(*token)));
+      frame = QRVWireFrame::encode(reply, 0, messageId);
+    } else {
+      frame = QRVWireFrame::encode(it == replies_.end() ? notFound : it->second, 0, messageId);
+    }
     for (size_t sent = 0; sent < frame.size();) {
       ssize_t n = send(fd, frame.data() + sent, frame.size() - sent, MSG_NOSIGNAL);
       if (n < 0 && (errno == EINTR || errno == EAGAIN)) continue;
@@ -426,6 +477,8 @@ class RawLookupServer {
 
   const std::string path_;
   const std::unordered_map<std::string, QRVPlist> replies_;
+  std::unique_ptr<QRVLinuxSandbox> sandbox_;  // with checks
+  std::unordered_map<std::string, std::string> metadataPaths_;
   int listenFd_ = -1;
   int epollFd_ = -1;
   int wakeFd_ = -1;
@@ -539,35 +592,52 @@ void benchLookups(const BenchRoot& root, const Sizes& sizes) {
     replies[id] = call(client, requests.back()).reply;
   }
   RawLookupServer raw(root.path() + "/run/bench-raw.sock", replies);
+  RawLookupServer checked(root.path() + "/run/bench-raw-checked.sock", replies,
+                          RawLookupServer::Checks{root.path() + "/run/bench-raw.key"});
   QRVContainerClient rawClient = connectTo(raw.path());
-  // Untimed warm-up of both.
+  QRVContainerClient checkedClient = connectTo(checked.path());
+  // Untimed warm-up of all three.
   timeLookups(client, requests, 200);
   timeLookups(rawClient, requests, 200);
+  timeLookups(checkedClient, requests, 200);
 
-  Pair p50, p99;
+  // The checked server's figures sit in the `raw` side of a second pair.
+  Pair p50, p99, checkedP50, checkedP99;
   for (int rep = 0; rep < sizes.repetitions; rep++) {
     auto d = timeLookups(client, requests, sizes.latencyRequests);
     auto r = timeLookups(rawClient, requests, sizes.latencyRequests);
-    p50.daemon.push_back(QRVBench::percentile(d, 0.50));
+    auto c = timeLookups(checkedClient, requests, sizes.latencyRequests);
+    for (Pair* p : {&p50, &checkedP50}) p->daemon.push_back(QRVBench::percentile(d, 0.50));
+    for (Pair* p : {&p99, &checkedP99}) p->daemon.push_back(QRVBench::percentile(d, 0.99));
     p50.raw.push_back(QRVBench::percentile(r, 0.50));
-    p99.daemon.push_back(QRVBench::percentile(d, 0.99));
     p99.raw.push_back(QRVBench::percentile(r, 0.99));
+    checkedP50.raw.push_back(QRVBench::percentile(c, 0.50));
+    checkedP99.raw.push_back(QRVBench::percentile(c, 0.99));
   }
   addRow("cache-hit look-up latency p50, one client", "us", p50.d(), p50.r(), false);
   addRow("cache-hit look-up latency p99, one client", "us", p99.d(), p99.r(), false);
+  addRow("same p50, raw with the per-request checks", "us", checkedP50.d(), checkedP50.r(), false);
+  addRow("same p99, raw with the per-request checks", "us", checkedP99.d(), checkedP99.r(), false);
 
   for (int clients : {1, 2, 8, 64}) {
-    Pair rate;
+    Pair rate, checkedRate;
     for (int rep = 0; rep < sizes.repetitions; rep++) {
-      rate.daemon.push_back(lookupRate(root.socketPath(), requests, clients, sizes.throughputRequests));
+      double d = lookupRate(root.socketPath(), requests, clients, sizes.throughputRequests);
+      rate.daemon.push_back(d);
+      checkedRate.daemon.push_back(d);
       rate.raw.push_back(lookupRate(raw.path(), requests, clients, sizes.throughputRequests));
+      checkedRate.raw.push_back(lookupRate(checked.path(), requests, clients, sizes.throughputRequests));
     }
-    addRow(fmt::format("look-ups/s, {} concurrent client{}", clients, clients == 1 ? "" : "s"), "/s", rate.d(),
-           rate.r(), true);
+    const std::string figure = fmt::format("look-ups/s, {} concurrent client{}", clients, clients == 1 ? "" : "s");
+    addRow(figure, "/s", rate.d(), rate.r(), true);
+    addRow(figure + ", raw with the per-request checks", "/s", checkedRate.d(), checkedRate.r(), true);
   }
   gNotes.push_back(fmt::format(
       "Raw look-up server: {} worker threads on one epoll set, one-shot connections (the daemon's message "
-      "service's parallelism); the reply it encodes is the daemon's own reply to the same request ({} bytes).",
+      "service's parallelism); the reply it encodes is the daemon's own reply to the same request ({} bytes). "
+      "With the per-request checks it also re-reads the peer's executable and confinement on descriptors "
+      "kept since accept, stats the container's metadata file and seals a fresh sandbox token, with the "
+      "daemon's own platform code.",
       kDaemonWorkerThreads, replies.begin()->second.toBinary().size()));
   fflush(stderr);
 }
@@ -612,6 +682,74 @@ void rawCreation(const std::string& staging, const std::string& live, const QRVP
   fsyncPath(live);
 }
 
+// The daemon's directory step: made private, reopened without following a
+// link, then given its mode and owner through the descriptor, so that nobody
+// enters it before it is the owner's.
+void makeDirectoryPrivately(int parent, const char* name, uid_t owner) {
+  if (mkdirat(parent, name, 0700) != 0) fail(std::string("mkdir ") + name + ": " + strerror(errno));
+  int fd = openat(parent, name, O_RDONLY | O_NOFOLLOW | O_CLOEXEC | O_DIRECTORY);
+  if (fd < 0 || fchmod(fd, 0755) != 0 || fchown(fd, owner, owner) != 0)
+    fail(std::string("mode ") + name + ": " + strerror(errno));
+  close(fd);
+}
+
+// A directory accessor's cost on an existing directory: it is made if
+// missing, and checked to be a directory.
+void ensureDirectory(const std::string& path) {
+  struct stat st;
+  if ((mkdir(path.c_str(), 0700) != 0 && errno != EEXIST) || lstat(path.c_str(), &st) != 0)
+    fail("ensure " + path + ": " + strerror(errno));
+}
+
+// The same creation with the daemon's own system calls, as traced: each
+// directory made privately; the staging and live directories (and their
+// parent) re-ensured at each access; a stale temporary file removed first
+// and the file's mode set through its descriptor; each default subdirectory
+// made relative to a fresh, link-free open of its parent.
+void rawCreationWithDaemonSteps(const std::string& staging, const std::string& live, const QRVPlist& metadata) {
+  const std::string parent = staging.substr(0, staging.rfind('/'));
+  const std::string uuid = QRVUUID::random().string();
+  const std::string dir = staging + "/" + uuid;
+  ensureDirectory(parent);
+  ensureDirectory(staging);
+  makeDirectoryPrivately(AT_FDCWD, dir.c_str(), 501);
+  ensureDirectory(parent);
+  ensureDirectory(staging);
+  const std::string temporary = staging + "/temp_metadata-" + uuid + ".plist";
+  unlink(temporary.c_str());
+  QRVPlist::Bytes bytes = metadata.toBinary();
+  int fd = open(temporary.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0644);
+  if (fd < 0 || write(fd, bytes.data(), bytes.size()) != static_cast<ssize_t>(bytes.size()) || fchmod(fd, 0644) != 0 ||
+      fsync(fd) != 0)
+    fail("metadata " + temporary + ": " + strerror(errno));
+  close(fd);
+  if (rename(temporary.c_str(), (dir + "/" + kMetadataFileName).c_str()) != 0) fail("rename metadata");
+  fsyncPath(dir);
+  for (const char* sub : {"Documents", "Library", "Library/Caches", "Library/Preferences", "SystemData", "tmp"}) {
+    int container = open(dir.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC | O_DIRECTORY);
+    if (container < 0) fail("open " + dir);
+    std::string_view path(sub);
+    if (size_t slash = path.find('/'); slash != std::string_view::npos) {
+      const std::string first(path.substr(0, slash));
+      mkdirat(container, first.c_str(), 0700);  // exists: made just before
+      int inner = openat(container, first.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC | O_DIRECTORY);
+      close(container);
+      if (inner < 0) fail("open " + first);
+      makeDirectoryPrivately(inner, sub + slash + 1, 501);
+      close(inner);
+    } else {
+      makeDirectoryPrivately(container, sub, 501);
+      close(container);
+    }
+  }
+  fsyncPath(dir + "/Library");
+  fsyncPath(dir);
+  ensureDirectory(parent);
+  ensureDirectory(live);
+  if (rename(dir.c_str(), (live + "/" + uuid).c_str()) != 0) fail("rename live");
+  fsyncPath(live);
+}
+
 void benchCreations(const BenchRoot& root, const Sizes& sizes) {
   fprintf(stderr, "creations: %d per repetition\n", sizes.creations);
   DaemonRun daemon(root);
@@ -632,10 +770,11 @@ void benchCreations(const BenchRoot& root, const Sizes& sizes) {
   if (!metadata) fail("the daemon's metadata file does not decode");
   const std::string rawStaging = root.path() + "/bench-raw/staging";
   const std::string rawLive = root.path() + "/bench-raw/live";
-  std::filesystem::create_directories(rawStaging);
-  std::filesystem::create_directories(rawLive);
+  const std::string stepsStaging = root.path() + "/bench-raw/steps/staging";
+  const std::string stepsLive = root.path() + "/bench-raw/steps/live";
+  for (const std::string& d : {rawStaging, rawLive, stepsStaging, stepsLive}) std::filesystem::create_directories(d);
 
-  Pair rate;
+  Pair rate, steps;  // the daemon's side of `steps` repeats `rate`'s
   int next = 0;
   for (int rep = 0; rep < sizes.repetitions; rep++) {
     auto begin = Clock::now();
@@ -644,11 +783,16 @@ void benchCreations(const BenchRoot& root, const Sizes& sizes) {
         fail("a creation found an existing container");
     }
     rate.daemon.push_back(sizes.creations / (millisSince(begin) / 1000));
+    steps.daemon.push_back(rate.daemon.back());
     begin = Clock::now();
     for (int i = 0; i < sizes.creations; i++) rawCreation(rawStaging, rawLive, *metadata);
     rate.raw.push_back(sizes.creations / (millisSince(begin) / 1000));
+    begin = Clock::now();
+    for (int i = 0; i < sizes.creations; i++) rawCreationWithDaemonSteps(stepsStaging, stepsLive, *metadata);
+    steps.raw.push_back(sizes.creations / (millisSince(begin) / 1000));
   }
   addRow("durable creations/s, one client", "/s", rate.d(), rate.r(), true);
+  addRow("same, raw with the daemon's own system calls", "/s", steps.d(), steps.r(), true);
   std::error_code ec;
   std::filesystem::remove_all(root.path() + "/bench-raw", ec);
 }
